@@ -1,0 +1,42 @@
+# Convenience wrapper around CMake and CTest.
+#   make demo   build, start the sample K Capture server, command it
+#   make test   build under AddressSanitizer + UndefinedBehaviorSanitizer, run every test
+#   make tsan   build under ThreadSanitizer, run the multithreaded tests
+#   make bench  build optimised and run the benchmarks
+#   make fuzz   build the fuzz targets with clang's libFuzzer
+JOBS ?= $(shell nproc)
+
+.PHONY: all build demo test tsan bench fuzz clean
+
+all: build
+
+build:
+	cmake -S . -B build -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKLP_TESTS=OFF >/dev/null
+	cmake --build build -j $(JOBS)
+
+demo: build
+	./scripts/demo.sh build
+
+test:
+	cmake -S . -B build-asan -DCMAKE_BUILD_TYPE=Debug -DKLP_SANITIZE=address,undefined >/dev/null
+	cmake --build build-asan -j $(JOBS)
+	ASAN_OPTIONS=detect_leaks=1:abort_on_error=0 UBSAN_OPTIONS=print_stacktrace=1 \
+	  ctest --test-dir build-asan -j $(JOBS) --output-on-failure --timeout 300
+
+tsan:
+	cmake -S . -B build-tsan -DCMAKE_BUILD_TYPE=Debug -DKLP_SANITIZE=thread >/dev/null
+	cmake --build build-tsan -j $(JOBS)
+	ctest --test-dir build-tsan -j $(JOBS) -L 'common/thread|tsan' --output-on-failure
+
+bench:
+	cmake -S . -B build-bench -DCMAKE_BUILD_TYPE=Release -DKLP_TESTS=OFF -DKLP_BENCH=ON >/dev/null
+	cmake --build build-bench -j $(JOBS)
+	./scripts/bench.sh build-bench
+
+fuzz:
+	CC=clang CXX=clang++ cmake -S . -B build-fuzz -DCMAKE_BUILD_TYPE=Debug -DKLP_FUZZ=ON >/dev/null
+	cmake --build build-fuzz -j $(JOBS)
+	@echo "fuzz targets are in build-fuzz/bin (run one with -max_total_time=60)"
+
+clean:
+	rm -rf build build-asan build-tsan build-bench build-fuzz

@@ -1,0 +1,226 @@
+// Platform services: the one narrow layer between the run-time and the
+// operating system. Every inter-process object, clock, lock, library load and
+// trap dump goes through here; nothing else in the code base calls these OS
+// services directly. Failures are nonzero platform codes (ECF_*), never
+// exceptions; print them as "0x%X" with ecfErrorGetDescription().
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <ctime>
+
+// ---------------------------------------------------------------------------
+// Platform codes
+// ---------------------------------------------------------------------------
+typedef uint32_t hsvRC;
+
+constexpr hsvRC ECF_OK = 0;
+constexpr hsvRC ECF_ACCESS_DENIED = 0x90000001;
+constexpr hsvRC ECF_NOT_FOUND = 0x90000002;       // no such queue / block / library / symbol
+constexpr hsvRC ECF_INVALID_ARGUMENT = 0x90000003;
+constexpr hsvRC ECF_INVALID_VERSION = 0x90000004;
+constexpr hsvRC ECF_ALREADY_EXISTS = 0x90000005;
+constexpr hsvRC ECF_NOT_ATTACHED = 0x90000006;    // operation on an object not created/attached
+constexpr hsvRC ECF_MSG_TOO_BIG = 0x90000007;     // put longer than the queue's maximum message
+constexpr hsvRC ECF_BUFFER_TOO_SMALL = 0x90000008;
+constexpr hsvRC ECF_DEADLOCK = 0x90000009;
+constexpr hsvRC ECF_QUEUE_FULL = 0x9000000A;      // put still blocked after the bounded wait
+constexpr hsvRC ECF_INTERRUPTED = 0x9000000B;
+constexpr hsvRC ECF_LIMIT_REACHED = 0x9000000C;   // system limit on queues / memory reached
+constexpr hsvRC ECF_NO_MEMORY = 0x9000000D;
+constexpr hsvRC ECF_TIMEOUT = 0x90000013;
+constexpr hsvRC ECF_SEM_WAIT_ABANDONED = 0x90000080;
+constexpr hsvRC ECF_SYSTEM_ERROR = 0x900000FF;    // any other errno
+constexpr hsvRC ECF_WAITPOST_NOT_INITIALIZED = 0x900003FF;
+constexpr hsvRC ECF_WAITPOST_NOT_POSTED = 0x90000400;
+constexpr hsvRC ECF_WAITPOST_RESET = 0x90000401;
+
+// A readable text for a platform code; never null, static storage.
+const char* ecfErrorGetDescription(hsvRC code);
+
+// ---------------------------------------------------------------------------
+// Resource ids: derived from a path, identical in every process.
+// ---------------------------------------------------------------------------
+constexpr int HSV_QUEUE_RESID_OPTION = 48;
+constexpr int HSV_MEMORY_RESID_OPTION = 109;
+constexpr int HSV_CREATE_OPTION = 51;
+constexpr size_t HSV_MAX_MSG_SIZE = 4096;
+
+struct HSVResID {
+  char part1[16];       // object kind: "mqueue" or "shm"
+  char part2[40];       // the POSIX object name, e.g. "/klpq.0123456789abcdef"
+  char part3[24];       // the option value the id was derived with, decimal
+  const char* posixName() const { return part2; }
+};
+
+// path -> queue id (option 48) / shared-memory id (option 109).
+// ECF_INVALID_ARGUMENT for a null or empty path.
+hsvRC hsvIPCGetQueResID(const char* path, int option, HSVResID* out);
+hsvRC hsvIPCGetResID(const char* path, int option, HSVResID* out);
+// "(%s, %s, %s)" of the three parts, cut to bufLen-1 characters and NUL-ended.
+void hsvResIDPrintable(const HSVResID& id, char* buf, size_t bufLen);
+
+// ---------------------------------------------------------------------------
+// Inter-process message queue (POSIX message queue, mode 0600).
+// ---------------------------------------------------------------------------
+class HSVHIPCQueue {
+ public:
+  HSVHIPCQueue();
+  ~HSVHIPCQueue();  // closes the descriptor; never destroys the queue
+  HSVHIPCQueue(const HSVHIPCQueue&) = delete;
+  HSVHIPCQueue& operator=(const HSVHIPCQueue&) = delete;
+
+  // Creates the queue (ECF_ALREADY_EXISTS when one exists) and keeps it open.
+  hsvRC create(const HSVResID& id, size_t maxMsgSize, int option);
+  // Attaches to an existing queue; ECF_NOT_FOUND while none exists.
+  hsvRC attach(const HSVResID& id);
+  hsvRC detach();   // closes the descriptor, queue stays
+  hsvRC destroy();  // closes and removes the queue from the system
+  // Puts one whole message. When the queue is full, waits up to 30 s for room.
+  hsvRC put(const void* buf, size_t len);
+  // Takes one whole message, waiting up to timeoutMs (negative: forever).
+  // ECF_TIMEOUT when none came; ECF_BUFFER_TOO_SMALL when capacity is below
+  // the queue's message size.
+  hsvRC get(void* buf, size_t capacity, size_t* outLen, int32_t timeoutMs);
+  // True when a message is waiting; answers at once.
+  bool hasMessage();
+  // Waits up to timeoutMs until a message is waiting, without taking it.
+  // ECF_OK when one is there, ECF_TIMEOUT otherwise.
+  hsvRC waitForMessage(int32_t timeoutMs);
+  bool isOpen() const { return fd_ >= 0; }
+  const HSVResID& resID() const { return id_; }
+
+ private:
+  int fd_ = -1;
+  size_t msgSize_ = 0;
+  HSVResID id_{};
+};
+
+// ---------------------------------------------------------------------------
+// Inter-process shared memory (POSIX shared memory, mode 0600).
+// ---------------------------------------------------------------------------
+class HSVHIPCMemory {
+ public:
+  HSVHIPCMemory();
+  ~HSVHIPCMemory();  // unmaps; never destroys the block
+  HSVHIPCMemory(const HSVHIPCMemory&) = delete;
+  HSVHIPCMemory& operator=(const HSVHIPCMemory&) = delete;
+
+  hsvRC create(const HSVResID& id, size_t size, int option);  // zero-filled
+  hsvRC attach(const HSVResID& id);                           // ECF_NOT_FOUND when none
+  void* getAddress() const { return addr_; }
+  size_t getSize() const { return size_; }
+  hsvRC detach();
+  hsvRC destroy();  // unmaps and removes the name; attached processes keep their mapping
+
+ private:
+  void* addr_ = nullptr;
+  size_t size_ = 0;
+  HSVResID id_{};
+};
+
+// ---------------------------------------------------------------------------
+// Wait/post object (process-local auto-reset event).
+// A post while nobody waits is remembered until the next wait consumes it.
+// ---------------------------------------------------------------------------
+class HSVHIPCWaitpost {
+ public:
+  HSVHIPCWaitpost();
+  ~HSVHIPCWaitpost();
+  HSVHIPCWaitpost(const HSVHIPCWaitpost&) = delete;
+  HSVHIPCWaitpost& operator=(const HSVHIPCWaitpost&) = delete;
+
+  hsvRC create(int option);
+  // 0 when posted, ECF_TIMEOUT when timeMs passed, ECF_WAITPOST_NOT_INITIALIZED
+  // before create / after destroy. Negative timeMs waits forever.
+  hsvRC wait(int32_t timeMs);
+  hsvRC post();
+  hsvRC destroy();
+
+ private:
+  struct Impl;
+  Impl* impl_ = nullptr;
+};
+
+// ---------------------------------------------------------------------------
+// Byte locks across processes (a byte in shared memory).
+// ---------------------------------------------------------------------------
+// Atomic exchange of 1 into the byte; answers the previous value (0: taken).
+uint8_t hsvByteLockExchange(volatile uint8_t* lock);
+// Waits (yielding, then sleeping briefly) until the exchange succeeds.
+void hsvByteLockConflict(volatile uint8_t* lock);
+// Takes the lock: exchange, and on conflict wait.
+inline void hsvByteLock(volatile uint8_t* lock) {
+  if (hsvByteLockExchange(lock) != 0) hsvByteLockConflict(lock);
+}
+// Release stores 0.
+void hsvByteLockRelease(volatile uint8_t* lock);
+
+// ---------------------------------------------------------------------------
+// Ids, time, sleep, one-time initialisation
+// ---------------------------------------------------------------------------
+int32_t hsvProcessID();
+uint64_t hsvThreadID();  // kernel thread id of the caller
+
+struct HSVTimeUTC {
+  int64_t seconds;       // since the epoch
+  int32_t microseconds;  // 0..999999
+};
+HSVTimeUTC hsvTimeGetUTC();
+// Broken-down time of UTC seconds; false when the conversion failed.
+bool hsvTimeLocalTime(int64_t seconds, struct tm* out);
+bool hsvTimeGmTime(int64_t seconds, struct tm* out);
+void hsvSleep(uint32_t milliseconds);
+// One-time initialisation of the platform layer in this process; idempotent
+// and thread-safe.
+hsvRC hsvOneTimeOnly();
+
+// ---------------------------------------------------------------------------
+// Shared libraries (dlopen)
+// ---------------------------------------------------------------------------
+class HSVSharedLib {
+ public:
+  HSVSharedLib();
+  ~HSVSharedLib();  // unloads when loaded
+  HSVSharedLib(const HSVSharedLib&) = delete;
+  HSVSharedLib& operator=(const HSVSharedLib&) = delete;
+
+  // option 4: resolve lazily, local; 0: resolve now. ECF_NOT_FOUND when it
+  // cannot be loaded; lastError() then holds the loader's text.
+  hsvRC load(const char* name, int option);
+  void* getFuncAddress(const char* symbol);  // null when absent
+  hsvRC unload();
+  bool isLoaded() const { return handle_ != nullptr; }
+  const char* lastError() const { return err_; }
+
+ private:
+  void* handle_ = nullptr;
+  char err_[256] = {0};
+};
+
+// ---------------------------------------------------------------------------
+// Trap file: a dump file that is appended to.
+// ---------------------------------------------------------------------------
+constexpr int HSV_TRAPFILE_OPEN_OPTION = 20;
+constexpr int HSV_TRAPFILE_DUMP_OPTION = 507911;
+
+class HSVTrapFile {
+ public:
+  HSVTrapFile();
+  ~HSVTrapFile();  // closes
+  HSVTrapFile(const HSVTrapFile&) = delete;
+  HSVTrapFile& operator=(const HSVTrapFile&) = delete;
+
+  hsvRC open(const char* path, int option);  // create or open for append, mode 0600
+  hsvRC seekToEnd();
+  bool isValid() const { return fd_ >= 0; }
+  hsvRC write(const void* buf, size_t len);
+  // Writes a readable dump: signal, process and thread ids, time, the
+  // fault address when siginfo is given, and the calling thread's stack trace
+  // (async-signal-safe: backtrace_symbols_fd).
+  hsvRC dump(int option, int signalNumber, const void* siginfo, const void* ucontext);
+  hsvRC close();
+
+ private:
+  int fd_ = -1;
+};
