@@ -20,12 +20,14 @@ demo: build
 test:
 	cmake -S . -B build-asan -DCMAKE_BUILD_TYPE=Debug -DKLP_SANITIZE=address,undefined >/dev/null
 	cmake --build build-asan -j $(JOBS)
+	ulimit -q unlimited 2>/dev/null || true; \
 	ASAN_OPTIONS=detect_leaks=1:abort_on_error=0 UBSAN_OPTIONS=print_stacktrace=1 \
 	  ctest --test-dir build-asan -j $(JOBS) --output-on-failure --timeout 300
 
 tsan:
 	cmake -S . -B build-tsan -DCMAKE_BUILD_TYPE=Debug -DKLP_SANITIZE=thread >/dev/null
 	cmake --build build-tsan -j $(JOBS)
+	ulimit -q unlimited 2>/dev/null || true; \
 	ctest --test-dir build-tsan -j $(JOBS) -L 'common/thread|tsan' --output-on-failure
 
 bench:

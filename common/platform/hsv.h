@@ -37,6 +37,9 @@ constexpr hsvRC ECF_WAITPOST_RESET = 0x90000401;
 
 // A readable text for a platform code; never null, static storage.
 const char* ecfErrorGetDescription(hsvRC code);
+// The platform code for an errno value (ENOENT -> ECF_NOT_FOUND, ...;
+// anything without a closer code -> ECF_SYSTEM_ERROR).
+hsvRC hsvErrnoToECF(int err);
 
 // ---------------------------------------------------------------------------
 // Resource ids: derived from a path, identical in every process.
@@ -45,6 +48,8 @@ constexpr int HSV_QUEUE_RESID_OPTION = 48;
 constexpr int HSV_MEMORY_RESID_OPTION = 109;
 constexpr int HSV_CREATE_OPTION = 51;
 constexpr size_t HSV_MAX_MSG_SIZE = 4096;
+constexpr long HSV_QUEUE_DEPTH = 10;          // messages a queue holds before put waits
+constexpr int32_t HSV_PUT_WAIT_MS = 30000;    // how long put waits for room
 
 struct HSVResID {
   char part1[16];       // object kind: "mqueue" or "shm"
@@ -71,13 +76,17 @@ class HSVHIPCQueue {
   HSVHIPCQueue& operator=(const HSVHIPCQueue&) = delete;
 
   // Creates the queue (ECF_ALREADY_EXISTS when one exists) and keeps it open.
+  // An object that already holds a queue answers ECF_INVALID_ARGUMENT.
   hsvRC create(const HSVResID& id, size_t maxMsgSize, int option);
   // Attaches to an existing queue; ECF_NOT_FOUND while none exists.
   hsvRC attach(const HSVResID& id);
   hsvRC detach();   // closes the descriptor, queue stays
   hsvRC destroy();  // closes and removes the queue from the system
-  // Puts one whole message. When the queue is full, waits up to 30 s for room.
+  // Puts one whole message. When the queue is full, waits up to 30 s for room
+  // (ECF_QUEUE_FULL after that); ECF_MSG_TOO_BIG above the message size.
   hsvRC put(const void* buf, size_t len);
+  // put with a chosen wait for room (negative: forever, 0: not at all).
+  hsvRC putWait(const void* buf, size_t len, int32_t waitMs);
   // Takes one whole message, waiting up to timeoutMs (negative: forever).
   // ECF_TIMEOUT when none came; ECF_BUFFER_TOO_SMALL when capacity is below
   // the queue's message size.
@@ -89,6 +98,8 @@ class HSVHIPCQueue {
   hsvRC waitForMessage(int32_t timeoutMs);
   bool isOpen() const { return fd_ >= 0; }
   const HSVResID& resID() const { return id_; }
+  // The queue's maximum message size (0 while not open).
+  size_t maxMsgSize() const { return msgSize_; }
 
  private:
   int fd_ = -1;
@@ -135,6 +146,8 @@ class HSVHIPCWaitpost {
   // before create / after destroy. Negative timeMs waits forever.
   hsvRC wait(int32_t timeMs);
   hsvRC post();
+  // Wakes the threads still waiting (they answer ECF_WAITPOST_NOT_INITIALIZED)
+  // and returns once they have left; no wait may start after it.
   hsvRC destroy();
 
  private:

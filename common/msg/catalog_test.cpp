@@ -1,0 +1,246 @@
+// The message catalogue: our MO reader on hand-made and damaged images, the
+// built catalogue's contents, and the logger's use of it (fallback and the
+// one-time KLP0513E when it cannot be opened).
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "common/msg/msg_testing.h"
+#include "common/msg/msglogger.h"
+
+namespace {
+
+const std::string kBuiltCatalog = std::string(KLP_BIN_DIR) + "/vdbklp.mo";
+
+void put32(std::vector<uint8_t>& b, size_t at, uint32_t v, bool big) {
+  for (int i = 0; i < 4; ++i)
+    b[at + (big ? 3 - i : i)] = static_cast<uint8_t>(v >> (8 * i));
+}
+
+// A minimal MO image of the given (id, text) pairs.
+std::vector<uint8_t> moImage(const std::vector<std::pair<std::string, std::string>>& entries,
+                             bool big = false) {
+  uint32_t n = static_cast<uint32_t>(entries.size());
+  size_t orig = 28, trans = orig + 8 * n, strings = trans + 8 * n;
+  std::vector<uint8_t> b(strings, 0);
+  put32(b, 0, 0x950412de, big);
+  put32(b, 8, n, big);
+  put32(b, 12, static_cast<uint32_t>(orig), big);
+  put32(b, 16, static_cast<uint32_t>(trans), big);
+  for (uint32_t i = 0; i < n; ++i) {
+    const std::string* s[2] = {&entries[i].first, &entries[i].second};
+    size_t table[2] = {orig, trans};
+    for (int k = 0; k < 2; ++k) {
+      put32(b, table[k] + 8 * i, static_cast<uint32_t>(s[k]->size()), big);
+      put32(b, table[k] + 8 * i + 4, static_cast<uint32_t>(b.size()), big);
+      b.insert(b.end(), s[k]->begin(), s[k]->end());
+      b.push_back(0);
+    }
+  }
+  return b;
+}
+
+std::string lookup(const std::vector<uint8_t>& image, const char* key) {
+  int reason = -1;
+  msgMoCatalog* c = msgMoParse(image.data(), image.size(), &reason);
+  if (c == nullptr) return "<damaged " + std::to_string(reason) + ">";
+  size_t len = 0;
+  const char* t = msgMoLookup(c, key, &len);
+  std::string out = t != nullptr ? std::string(t, len) : "<none>";
+  msgMoFree(c);
+  return out;
+}
+
+int reasonOf(const char* errorText) {
+  const char* colon = strchr(errorText, ':');
+  return colon != nullptr && strlen(colon) >= 3 ? atoi(colon + 3) : -1;
+}
+
+TEST(MoReader, ReadsBothByteOrders) {
+  auto entries = std::vector<std::pair<std::string, std::string>>{
+      {"", "Content-Type: text/plain\n"}, {"500", "KLP0500E first"}, {"7112", "KLP7112I  Label"}};
+  for (bool big : {false, true}) {
+    auto img = moImage(entries, big);
+    EXPECT_EQ("KLP0500E first", lookup(img, "500"));
+    EXPECT_EQ("KLP7112I  Label", lookup(img, "7112"));
+    EXPECT_EQ("<none>", lookup(img, "501"));
+  }
+}
+
+TEST(MoReader, DamagedImagesAreRefusedWithoutReadingOutside) {
+  auto good = moImage({{"500", "KLP0500E first"}, {"501", "KLP0501E second"}});
+  EXPECT_EQ("<damaged 3>", lookup({}, "500"));
+  EXPECT_EQ("<damaged 3>", lookup(std::vector<uint8_t>(good.begin(), good.begin() + 27), "500"));
+  // Every truncation of the image is either refused or still sound.
+  for (size_t cut = 0; cut < good.size(); ++cut) {
+    std::vector<uint8_t> part(good.begin(), good.begin() + cut);
+    EXPECT_EQ("<damaged 3>", lookup(part, "500")) << cut;
+  }
+  auto bad = good;
+  bad[0] ^= 0xFF;  // magic
+  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
+  bad = good;
+  put32(bad, 4, 0x00010000, false);  // unknown major revision
+  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
+  bad = good;
+  put32(bad, 8, 0xFFFFFFFF, false);  // count far beyond the file
+  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
+  bad = good;
+  put32(bad, 16, 0xFFFFFFF0, false);  // table offset beyond the file
+  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
+  bad = good;
+  put32(bad, 28 + 8 + 4, 0xFFFFFFF8, false);  // string offset wraps in 32 bits
+  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
+  bad = good;
+  put32(bad, 28 + 16, 0x7FFFFFFF, false);  // string length beyond the file
+  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
+  EXPECT_EQ("KLP0501E second", lookup(good, "501"));
+}
+
+TEST(Catalogue, BuiltFileHoldsEveryIssuedNumber) {
+  int required[] = {500, 501, 502, 503, 504, 506, 507, 508, 509, 510, 511, 513, 514, 517,
+                    518, 519, 520, 521, 522, 523, 524, 525, 526, 527, 529, 534, 541, 543,
+                    545, 552, 554, 568, 569, 574, 575, 589, 590, 591, 592, 593, 594, 595,
+                    596, 597, 598, 599, 600, 601, 602, 606, 615, 616, 617, 619, 624, 626,
+                    7112, 7113, 7114, 7115, 7116, 7117, 7118, 7119, 7120, 7121, 7122, 7123,
+                    7124, 7193};
+  for (int number : required) {
+    SCOPED_TRACE(number);
+    char text[1100];
+    int n = retrieveCatalogMsg(kBuiltCatalog.c_str(), number, nullptr, nullptr, 0, text,
+                               sizeof text);
+    ASSERT_GT(n, 0) << text;
+    char id[8];
+    snprintf(id, sizeof id, "KLP%04d", number);
+    ASSERT_EQ(0, strncmp(text, id, 7)) << text;
+    ASSERT_NE(nullptr, strchr("EIW", text[7])) << text;
+    if ((number >= 7112 && number <= 7124) || number == 7193) {
+      // The status report cuts the first ten characters: id and two blanks.
+      EXPECT_EQ(0, strncmp(text + 8, "  ", 2)) << text;
+      EXPECT_NE(' ', text[10]) << text;
+    } else {
+      // Header values come first: application name, then qualifier-and-thread.
+      EXPECT_EQ(0, strncmp(text + 8, "  \"*\" : \"*\" : ", 14)) << text;
+    }
+  }
+}
+
+TEST(Catalogue, ValuesAreSubstitutedAndReasonsReported) {
+  char* values[4] = {const_cast<char*>("App"), const_cast<char*>("KLP\" : \"T"),
+                     const_cast<char*>("PARM"), const_cast<char*>("")};
+  char text[200];
+  int n = retrieveCatalogMsg(kBuiltCatalog.c_str(), 500, nullptr, values, 4, text, sizeof text);
+  EXPECT_STREQ("KLP0500E  \"App\" : \"KLP\" : \"T\" : The value \"PARM\" of the parameter \"*\" "
+               "is not valid.",
+               text);
+  EXPECT_EQ(static_cast<int>(strlen(text)), n);
+
+  char small[12];
+  memset(small, '#', sizeof small);
+  n = retrieveCatalogMsg(kBuiltCatalog.c_str(), 500, nullptr, values, 4, small, 8);
+  EXPECT_EQ(7, n);
+  EXPECT_STREQ("KLP0500", small);
+  EXPECT_EQ('#', small[8]);
+
+  EXPECT_LE(retrieveCatalogMsg(kBuiltCatalog.c_str(), 4999, nullptr, nullptr, 0, text,
+                               sizeof text),
+            0);
+  EXPECT_EQ(4, reasonOf(text));
+  EXPECT_LE(retrieveCatalogMsg("/no/such/dir/vdbklp.mo", 500, nullptr, nullptr, 0, text,
+                               sizeof text),
+            0);
+  EXPECT_EQ(2, reasonOf(text)) << text;
+  EXPECT_NE(':', text[0]);
+}
+
+TEST(Catalogue, DamagedFileFoundThroughTheDirectoryVariable) {
+  klptest::TmpDir tmp;
+  std::string image = klptest::readFile(kBuiltCatalog);
+  ASSERT_GT(image.size(), 100u);
+  FILE* f = fopen((tmp.path() + "vdbklp.mo").c_str(), "wb");
+  ASSERT_NE(nullptr, f);
+  fwrite(image.data(), 1, image.size() / 2, f);
+  fclose(f);
+  setenv("KLP_CATALOG_DIR", tmp.path().c_str(), 1);
+  msgCatalogReset();
+  char text[300];
+  int n = retrieveCatalogMsg("vdbklp.mo", 500, nullptr, nullptr, 0, text, sizeof text);
+  EXPECT_LE(n, 0);
+  EXPECT_EQ(3, reasonOf(text)) << text;
+
+  // A whole copy there is used; the parsed file is kept for the process.
+  f = fopen((tmp.path() + "vdbklp.mo").c_str(), "wb");
+  fwrite(image.data(), 1, image.size(), f);
+  fclose(f);
+  msgCatalogReset();
+  EXPECT_GT(retrieveCatalogMsg("vdbklp.mo", 500, nullptr, nullptr, 0, text, sizeof text), 0);
+  remove((tmp.path() + "vdbklp.mo").c_str());
+  EXPECT_GT(retrieveCatalogMsg("vdbklp.mo", 501, nullptr, nullptr, 0, text, sizeof text), 0);
+  unsetenv("KLP_CATALOG_DIR");
+  msgCatalogReset();
+}
+
+// A logger whose catalogue file does not exist.
+struct NoCatalogLogger : msgLoggerU {
+  NoCatalogLogger() : msgLoggerU(MSG_APP_KLPKCCMD, 0) {
+    snprintf(catalogName_, sizeof catalogName_, "%s", "no-such-catalogue.mo");
+  }
+};
+
+TEST(Catalogue, LoggerUsesTheCatalogueAndFallsBack) {
+  msgCatalogReset();
+  msgLogger* u = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
+  ASSERT_NE(nullptr, u);
+  u->loadBuiltinMsgs(builtinMsgTable);
+  u->setProgramQualifier("KLP");
+  char text[1100];
+  u->getKlpMsgText(506, "o", "T", text, sizeof text, "Capture Commands");
+  EXPECT_STREQ("KLP0506E  \"KlpKCcmd\" : \"KLP\" : \"T\" : The program could not reach the "
+               "\"Capture Commands\" queue of the server. The server is not running or its "
+               "queue is not available.",
+               text);
+  u->getKlpMsgText(7123, "N/A", "T", text, sizeof text);
+  EXPECT_STREQ("Up", text + 10);
+  // Built-in numbers below 8000 that the catalogue lacks come from the table.
+  u->getKlpMsgText(661, "o", "T", text, sizeof text);
+  EXPECT_STREQ("KLP0661E Job was cancelled", text);
+  u->getKlpMsgText(9011, "o", "T", text, sizeof text);
+  EXPECT_EQ(0u, std::string(text).find("KLP7654E  \"KlpKCcmd\" : \"KLP\" : \"T\" : The autostop "));
+  delete u;
+}
+
+TEST(Catalogue, MissingCatalogueIsReportedOnce) {
+  klptest::TmpDir tmp;
+  auto c = msgtest::inChild(tmp.path(), [&] {
+    NoCatalogLogger l;
+    l.loadBuiltinMsgs(builtinMsgTable);
+    l.setProgramQualifier("KLP");
+    l.setLogFileName(tmp.path().c_str(), "test.log");
+    l.putKlpMsg(506, MSG_DEST_STDOUT, "o", "T", "Capture Commands");
+    l.putKlpMsg(589, MSG_DEST_STDOUT, "o", "T", "a", "1", "b");
+    l.putKlpMsg(661, MSG_DEST_STDOUT, "o", "T");
+    return 0;
+  });
+  ASSERT_TRUE(c.finished);
+  auto err = msgtest::lines(c.err);
+  ASSERT_EQ(1u, err.size()) << c.err;
+  EXPECT_NE(std::string::npos,
+            err[0].find(" KLP0513E \"KlpKCcmd\":\"KLP\" : \" \": The program could not open the "
+                        "message file named 'no-such-catalogue.mo', Reason: "))
+      << err[0];
+  EXPECT_EQ(2, reasonOf(err[0].c_str() + err[0].find("Reason: ") + 8));
+  std::string log = klptest::readFile(tmp.path() + "test.log");
+  EXPECT_NE(std::string::npos, log.find("<composeKlpMsg> ")) << log;
+  auto out = msgtest::lines(c.out);
+  ASSERT_EQ(3u, out.size()) << c.out;
+  EXPECT_NE(std::string::npos, out[0].find("KLP0553W")) << out[0];
+  EXPECT_NE(std::string::npos, out[0].find("number \"506\""));
+  EXPECT_NE(std::string::npos, out[1].find("number \"589\""));
+  EXPECT_NE(std::string::npos, out[2].find("KLP0661E Job was cancelled"));
+}
+
+}  // namespace

@@ -1,0 +1,100 @@
+// Inter-process shared memory over POSIX shared memory objects.
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "common/platform/hsv.h"
+
+namespace {
+
+bool posixName(const HSVResID& id, char (&name)[sizeof(HSVResID::part2)]) {
+  size_t n = strnlen(id.part2, sizeof id.part2);
+  if (n < 2 || n >= sizeof id.part2 || id.part2[0] != '/') return false;
+  if (memchr(id.part2 + 1, '/', n - 1)) return false;
+  memcpy(name, id.part2, n + 1);
+  return true;
+}
+
+}  // namespace
+
+HSVHIPCMemory::HSVHIPCMemory() = default;
+
+HSVHIPCMemory::~HSVHIPCMemory() { detach(); }
+
+hsvRC HSVHIPCMemory::create(const HSVResID& id, size_t size, int /*option*/) {
+  if (addr_) return ECF_INVALID_ARGUMENT;  // already holds a block
+  if (size == 0 || size > static_cast<size_t>(PTRDIFF_MAX)) return ECF_INVALID_ARGUMENT;
+  char name[sizeof(HSVResID::part2)];
+  if (!posixName(id, name)) return ECF_INVALID_ARGUMENT;
+  int fd = shm_open(name, O_RDWR | O_CREAT | O_EXCL, 0600);
+  if (fd < 0) return hsvErrnoToECF(errno);
+  // A new object is zero-filled by the kernel; ftruncate only sizes it.
+  if (ftruncate(fd, static_cast<off_t>(size)) != 0) {
+    int err = errno;
+    close(fd);
+    shm_unlink(name);
+    return err == EFBIG ? ECF_INVALID_ARGUMENT : hsvErrnoToECF(err);
+  }
+  void* p = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+  int err = errno;
+  close(fd);
+  if (p == MAP_FAILED) {
+    shm_unlink(name);
+    return hsvErrnoToECF(err);
+  }
+  addr_ = p;
+  size_ = size;
+  id_ = id;
+  return ECF_OK;
+}
+
+hsvRC HSVHIPCMemory::attach(const HSVResID& id) {
+  if (addr_) return ECF_INVALID_ARGUMENT;
+  char name[sizeof(HSVResID::part2)];
+  if (!posixName(id, name)) return ECF_INVALID_ARGUMENT;
+  int fd = shm_open(name, O_RDWR, 0);
+  if (fd < 0) return hsvErrnoToECF(errno);
+  struct stat st{};
+  if (fstat(fd, &st) != 0) {
+    int err = errno;
+    close(fd);
+    return hsvErrnoToECF(err);
+  }
+  // A creator that has not sized the block yet leaves it empty: there is
+  // nothing to attach to until it has.
+  if (st.st_size <= 0) {
+    close(fd);
+    return ECF_NOT_FOUND;
+  }
+  size_t size = static_cast<size_t>(st.st_size);
+  void* p = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+  int err = errno;
+  close(fd);
+  if (p == MAP_FAILED) return hsvErrnoToECF(err);
+  addr_ = p;
+  size_ = size;
+  id_ = id;
+  return ECF_OK;
+}
+
+hsvRC HSVHIPCMemory::detach() {
+  if (!addr_) return ECF_NOT_ATTACHED;
+  munmap(addr_, size_);
+  addr_ = nullptr;
+  size_ = 0;
+  return ECF_OK;
+}
+
+hsvRC HSVHIPCMemory::destroy() {
+  if (!addr_) return ECF_NOT_ATTACHED;
+  char name[sizeof(HSVResID::part2)];
+  bool named = posixName(id_, name);
+  detach();
+  if (!named) return ECF_INVALID_ARGUMENT;
+  if (shm_unlink(name) != 0) return hsvErrnoToECF(errno);
+  return ECF_OK;
+}

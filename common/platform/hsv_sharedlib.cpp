@@ -1,0 +1,55 @@
+// Shared libraries loaded at run time.
+#include <dlfcn.h>
+
+#include <cstdio>
+
+#include "common/platform/hsv.h"
+
+namespace {
+
+void keepError(char* dst, size_t cap, const char* fallback) {
+  const char* e = dlerror();
+  snprintf(dst, cap, "%s", e ? e : fallback);
+}
+
+}  // namespace
+
+HSVSharedLib::HSVSharedLib() = default;
+
+HSVSharedLib::~HSVSharedLib() { unload(); }
+
+hsvRC HSVSharedLib::load(const char* name, int option) {
+  err_[0] = '\0';
+  if (!name || !*name) return ECF_INVALID_ARGUMENT;
+  // Loading over a loaded library would lose its handle and leak it.
+  if (handle_) return ECF_ALREADY_EXISTS;
+  int flags = option == 4 ? (RTLD_LAZY | RTLD_LOCAL) : (RTLD_NOW | RTLD_LOCAL);
+  dlerror();
+  void* h = dlopen(name, flags);
+  if (!h) {
+    keepError(err_, sizeof err_, "library not loaded");
+    return ECF_NOT_FOUND;
+  }
+  handle_ = h;
+  return ECF_OK;
+}
+
+void* HSVSharedLib::getFuncAddress(const char* symbol) {
+  if (!handle_ || !symbol || !*symbol) return nullptr;
+  dlerror();
+  void* p = dlsym(handle_, symbol);
+  if (!p) keepError(err_, sizeof err_, "symbol not found");
+  return p;
+}
+
+hsvRC HSVSharedLib::unload() {
+  if (!handle_) return ECF_NOT_ATTACHED;
+  void* h = handle_;
+  handle_ = nullptr;
+  dlerror();
+  if (dlclose(h) != 0) {
+    keepError(err_, sizeof err_, "library not unloaded");
+    return ECF_SYSTEM_ERROR;
+  }
+  return ECF_OK;
+}
