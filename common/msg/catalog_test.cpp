@@ -126,6 +126,14 @@ TEST(Catalogue, BuiltFileHoldsEveryIssuedNumber) {
       // Header values come first: application name, then qualifier-and-thread.
       EXPECT_EQ(0, strncmp(text + 8, "  \"*\" : \"*\" : ", 14)) << text;
     }
+    // Markers must stand in ascending order, or the later ones stay unsubstituted.
+    char v[9][3] = {"v1", "v2", "v3", "v4", "v5", "v6", "v7", "v8", "v9"};
+    char* values[9] = {v[0], v[1], v[2], v[3], v[4], v[5], v[6], v[7], v[8]};
+    uint64_t lengths[9] = {2, 2, 2, 2, 2, 2, 2, 2, 2};
+    n = retrieveCatalogMsg(kBuiltCatalog.c_str(), number, lengths, values, 9, text, sizeof text);
+    ASSERT_GT(n, 0) << text;
+    for (const char* p = text; (p = strchr(p, '$')) != nullptr; ++p)
+      EXPECT_FALSE(p[1] >= '1' && p[1] <= '9') << "unsubstituted marker in " << text;
   }
 }
 

@@ -1,0 +1,3 @@
+#include "xqpub/klpkccmd.h"
+
+int main(int c, char** v) { return klpkccmdMain(c, v); }
