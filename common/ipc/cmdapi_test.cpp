@@ -1,0 +1,923 @@
+// Command client and control interface: reply checking, status data
+// conversion, and exchanges with a fake server in a forked process over the
+// real platform queues.
+#include "common/ipc/cmdapi.h"
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstddef>
+#include <cstdlib>
+#include <cstring>
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "common/env/klpenv.h"
+#include "common/ipc/ipcmsg.h"
+#include "common/msg/klplog.h"
+#include "common/msg/msglogger.h"
+#include "common/parms/klpparm.h"
+#include "common/thread/klpthread.h"
+#include "common/thread/recoverymgr.h"
+#include "common/util/klprc.h"
+#include "include/klpapi.h"
+#include "tests/testing/klptest.h"
+#include "xqpub/kcapcmdparms.h"
+#include "xqpub/xqpubparms.h"
+
+// ---------------------------------------------------------------------------
+// The public records keep their byte layout.
+// ---------------------------------------------------------------------------
+static_assert(sizeof(klpReleaseInfo) == 12);
+static_assert(offsetof(klpReleaseInfo, version) == 4);
+static_assert(offsetof(klpReleaseInfo, modification) == 8);
+static_assert(offsetof(klpStatusRequest, schema) == 129);
+static_assert(offsetof(klpStatusRequest, statusSize) == 260);
+static_assert(offsetof(klpStatusRequest, buffer) == 264);
+static_assert(offsetof(klpStatusRequest, bufferSize) == 272);
+static_assert(offsetof(klpStatusRequest, requiredSize) == 276);
+static_assert(sizeof(klpResultBlock) == 1036);
+static_assert(offsetof(klpResultBlock, text) == 8);
+static_assert(sizeof(klpStatusFmt1) == 8 && sizeof(klpStatusThread) == 24);
+static_assert(offsetof(klpStatusThread, kind) == 16 && offsetof(klpStatusThread, state) == 20);
+static_assert(sizeof(klpStatusFmt3) == KLP_STATUS_FMT3_SIZE);
+static_assert(offsetof(klpStatusFmt3, logFile) == 8);
+static_assert(offsetof(klpStatusFmt3, activeSubs) == 1036);
+static_assert(offsetof(klpStatusFmt3, currentLogTime) == 1040);
+static_assert(offsetof(klpStatusFmt3, allPublishedLsn) == 1067);
+static_assert(offsetof(klpStatusFmt3, currentMemory) == 1132);
+static_assert(offsetof(klpStatusFmt3, sectionText) == 1136);
+static_assert(offsetof(klpStatusFmt3, sectionA) == 2161);
+static_assert(offsetof(klpStatusFmt3, sectionB) == 2191);
+static_assert(sizeof(klpStatusFmt2) == 1048);
+static_assert(offsetof(klpStatusFmt2, value8) == 8 && offsetof(klpStatusFmt2, text) == 12);
+static_assert(offsetof(klpStatusFmt2, value1040) == 1040);
+static_assert(offsetof(klpStatusFmt2, value1044) == 1044);
+static_assert(sizeof(klpStatusFmt2Record) == 12272);
+static_assert(offsetof(klpStatusFmt2Record, value52) == 52);
+static_assert(offsetof(klpStatusFmt2Record, block83) == 83);
+static_assert(offsetof(klpStatusFmt2Record, block148) == 148);
+static_assert(offsetof(klpStatusFmt2Record, time213) == 213);
+static_assert(offsetof(klpStatusFmt2Record, value240) == 240);
+static_assert(offsetof(klpStatusFmt2Record, value248) == 248);
+static_assert(offsetof(klpStatusFmt2Record, value264) == 264);
+static_assert(offsetof(klpStatusFmt2Record, text268) == 268);
+static_assert(offsetof(klpStatusFmt2Record, text3269) == 3269);
+static_assert(offsetof(klpStatusFmt2Record, text6270) == 6270);
+static_assert(offsetof(klpStatusFmt2Record, text9271) == 9271);
+
+namespace {
+
+void put32(std::vector<char>& b, size_t off, int32_t v) { std::memcpy(b.data() + off, &v, 4); }
+void put16(std::vector<char>& b, size_t off, uint16_t v) { std::memcpy(b.data() + off, &v, 2); }
+void put64(std::vector<char>& b, size_t off, int64_t v) { std::memcpy(b.data() + off, &v, 8); }
+int32_t get32(const char* p, size_t off) {
+  int32_t v;
+  std::memcpy(&v, p + off, 4);
+  return v;
+}
+
+// A STATUS payload: three header words and one 20-byte record per thread,
+// plus the spare slot the server sizes its reply with.
+std::vector<char> statusPayload(const std::vector<std::pair<std::string, int32_t>>& threads,
+                                int32_t claimedCount = -1) {
+  std::vector<char> p(12 + 20 * (threads.size() + 1), 0);
+  put32(p, 8, claimedCount >= 0 ? claimedCount : static_cast<int32_t>(threads.size()));
+  for (size_t i = 0; i < threads.size(); ++i) {
+    std::memcpy(p.data() + 12 + 20 * i, threads[i].first.c_str(), threads[i].first.size());
+    put32(p, 12 + 20 * i + 16, threads[i].second);
+  }
+  return p;
+}
+
+// ---------------------------------------------------------------------------
+// Thread kinds and names
+// ---------------------------------------------------------------------------
+
+TEST(CmdApiNames, ThreadKindsFollowTheNameTable) {
+  EXPECT_EQ(klpThreadKind("AdminThread"), 1);
+  EXPECT_EQ(klpThreadKind("HoldLThread"), 5);
+  EXPECT_EQ(klpThreadKind("PruneThread"), 7);
+  EXPECT_EQ(klpThreadKind("WorkerThread"), 8);
+  EXPECT_EQ(klpThreadKind("MonitorThread"), 6);
+  EXPECT_EQ(klpThreadKind("LogRdrThread"), 9);
+  EXPECT_EQ(klpThreadKind("BRx0000A9"), 4);
+  EXPECT_EQ(klpThreadKind("BRx0000B9"), 3);
+  EXPECT_EQ(klpThreadKind("BR"), 3);  // no eighth character
+  EXPECT_EQ(klpThreadKind("Admin"), 0);  // shorter than the kind name
+  EXPECT_EQ(klpThreadKind("Somebody"), 0);
+}
+
+TEST(CmdApiNames, FourteenCharacterNameMatchesTheKindItBegins) {
+  // Names are stored cut to 14 characters, so the full kind name never
+  // arrives.
+  EXPECT_EQ(klpThreadKind("BehinderWorker"), 2);
+  EXPECT_EQ(klpThreadKind("BehinderWorkerThread"), 2);
+  EXPECT_EQ(klpThreadKind("BehinderWorke"), 0);  // 13 characters: no match
+  EXPECT_EQ(klpThreadKind("BehinderWorkeX"), 0);
+}
+
+TEST(CmdApiNames, ServerNameIsUpperCasedAndJoined) {
+  char out[KLP_UNIQUE_NAME_SIZE];
+  ASSERT_EQ(klpBuildServerName(KLP_KIND_KCAP, "mydb", "klp.", out, sizeof(out)), 0);
+  EXPECT_STREQ(out, "MYDB.KLP.KCAP");
+  ASSERT_EQ(klpBuildServerName(KLP_KIND_APP, "db1 junk", "asn\0junk", out, sizeof(out)), 0);
+  EXPECT_STREQ(out, "DB1.ASN.APP");
+  EXPECT_EQ(klpBuildServerName(KLP_KIND_MON, " x", "s", out, sizeof(out)), KLP_API_NO_SERVER);
+  EXPECT_EQ(klpBuildServerName(KLP_KIND_MON, "x", "", out, sizeof(out)), KLP_API_NO_SCHEMA);
+  EXPECT_EQ(klpBuildServerName(6, "x", "s", out, sizeof(out)), KLP_API_BAD_KIND);
+  // A 128-character name field without terminator is read to 128 only.
+  char server[128], schema[128];
+  std::memset(server, 'a', sizeof(server));
+  std::memset(schema, 'b', sizeof(schema));
+  EXPECT_EQ(klpBuildServerName(KLP_KIND_CAP, server, schema, out, sizeof(out)), KLP_API_BAD_NAME);
+}
+
+// ---------------------------------------------------------------------------
+// Status data of format 1
+// ---------------------------------------------------------------------------
+
+TEST(CmdApiStatusFormat1, ThreeThreadsIntoFittingAndShortBuffers) {
+  auto p = statusPayload({{"AdminThread", 4}, {"BRx0000A9", 5}, {"BehinderWorker", 8}});
+  std::vector<char> out(80, 0x55);
+  int32_t required = 0;
+  ASSERT_EQ(klpStatusFromThreads(p.data(), p.size(), out.data(), out.size(), &required), 0);
+  EXPECT_EQ(required, 80);
+  EXPECT_EQ(get32(out.data(), 0), 1);
+  EXPECT_EQ(get32(out.data(), 4), 3);
+  klpStatusThread t[3];
+  std::memcpy(t, out.data() + 8, sizeof(t));
+  EXPECT_STREQ(t[0].name, "AdminThread");
+  EXPECT_EQ(t[0].kind, 1);
+  EXPECT_EQ(t[0].state, 4);
+  EXPECT_EQ(t[1].kind, 4);
+  EXPECT_EQ(t[2].kind, 2);
+  EXPECT_EQ(t[2].state, 8);
+
+  // 56 bytes hold two records: filled, the rest refused with 1001.
+  std::vector<char> small(56 + 8, 0x55);
+  ASSERT_EQ(klpStatusFromThreads(p.data(), p.size(), small.data(), 56, &required),
+            KLP_API_BUFFER_TOO_SMALL);
+  EXPECT_EQ(required, 80);
+  EXPECT_EQ(get32(small.data(), 4), 2);
+  for (size_t i = 56; i < small.size(); ++i) ASSERT_EQ(small[i], 0x55) << "byte " << i;
+}
+
+TEST(CmdApiStatusFormat1, NoThreadsNeeds32Bytes) {
+  auto p = statusPayload({});
+  char out[32];
+  int32_t required = 0;
+  EXPECT_EQ(klpStatusFromThreads(p.data(), p.size(), out, sizeof(out), &required), 0);
+  EXPECT_EQ(required, 32);
+  EXPECT_EQ(get32(out, 4), 0);
+}
+
+TEST(CmdApiStatusFormat1, CountsBeyondThePayloadAreRefused) {
+  auto p = statusPayload({{"AdminThread", 4}}, 3);
+  std::vector<char> out(1000);
+  int32_t required = 0;
+  EXPECT_EQ(klpStatusFromThreads(p.data(), p.size(), out.data(), out.size(), &required),
+            KLP_API_BAD_REPLY);
+  auto neg = statusPayload({}, 0);
+  put32(neg, 8, -1);
+  EXPECT_EQ(klpStatusFromThreads(neg.data(), neg.size(), out.data(), out.size(), &required),
+            KLP_API_BAD_REPLY);
+  EXPECT_EQ(klpStatusFromThreads(p.data(), 11, out.data(), out.size(), &required),
+            KLP_API_BAD_REPLY);
+  // Exactly the records and no spare slot is still a whole reply.
+  auto exact = statusPayload({{"A", 1}, {"B", 2}});
+  EXPECT_EQ(klpStatusFromThreads(exact.data(), 12 + 40, out.data(), out.size(), &required), 0);
+}
+
+TEST(CmdApiStatusFormat1, UnterminatedNameIsCutTo15) {
+  auto p = statusPayload({{"", 4}});
+  std::memset(p.data() + 12, 'N', 16);
+  std::vector<char> out(32);
+  int32_t required = 0;
+  ASSERT_EQ(klpStatusFromThreads(p.data(), p.size(), out.data(), out.size(), &required), 0);
+  EXPECT_EQ(std::string(out.data() + 8), std::string(15, 'N'));
+}
+
+TEST(CmdApiStatusFormat1, PrintStateRefusesShortPayload) {
+  auto p = statusPayload({{"AdminThread", 4}}, 9);
+  klpMsgCapture cap{};
+  EXPECT_EQ(printState(p.data(), p.size(), &cap), 817);
+  EXPECT_EQ(cap.length, 0);  // nothing printed from a lying reply
+}
+
+// ---------------------------------------------------------------------------
+// Status data of format 3
+// ---------------------------------------------------------------------------
+
+std::vector<char> kcapPayload() {
+  std::vector<char> p(400, 0);
+  put32(p, 12, 90061);
+  put32(p, 20, 7);
+  std::memcpy(p.data() + 24, "2024-01-02-03.04.05.123456", 26);
+  const unsigned char lsn[8] = {0x00, 0x0a, 0xbc, 0xde, 0xf0, 0x12, 0x34, 0xff};
+  std::memcpy(p.data() + 51, lsn, 8);
+  put32(p, 64, 4096);
+  // log file at 100
+  put16(p, 16, 100);
+  put16(p, 100, 12);
+  std::memcpy(p.data() + 102, "/var/log/kcp", 12);
+  // section at 200: fields A and B, then its text
+  put16(p, 68, 200);
+  std::memset(p.data() + 200, 'A', 30);
+  std::memset(p.data() + 230, 'B', 30);
+  put16(p, 260, 5);
+  std::memcpy(p.data() + 262, "hello", 5);
+  return p;
+}
+
+TEST(CmdApiStatusFormat3, FieldsComeFromTheirOffsets) {
+  auto p = kcapPayload();
+  klpStatusFmt3 s;
+  int32_t required = 0;
+  ASSERT_EQ(klpStatusFromKcap(p.data(), p.size(), reinterpret_cast<char*>(&s), sizeof(s), &required), 0);
+  EXPECT_EQ(required, 2224);
+  EXPECT_EQ(s.format, 3);
+  EXPECT_EQ(s.upTime, 90061);
+  EXPECT_STREQ(s.logFile, "/var/log/kcp");
+  EXPECT_EQ(s.activeSubs, 7);
+  EXPECT_STREQ(s.currentLogTime, "2024-01-02-03.04.05.123456");
+  EXPECT_STREQ(s.allPublishedLsn, "000ABCDEF01234FF");
+  EXPECT_EQ(s.currentMemory, 4096);
+  EXPECT_STREQ(s.sectionText, "hello");
+  EXPECT_EQ(std::string(s.sectionA, 30), std::string(30, 'A'));
+  EXPECT_EQ(std::string(s.sectionB, 30), std::string(30, 'B'));
+}
+
+TEST(CmdApiStatusFormat3, OffsetsOutsideThePayloadAreIgnored) {
+  auto p = kcapPayload();
+  put16(p, 16, 399);      // the length word itself would run past the end
+  put16(p, 68, 380);      // the section's fields would run past the end
+  klpStatusFmt3 s;
+  int32_t required = 0;
+  ASSERT_EQ(klpStatusFromKcap(p.data(), p.size(), reinterpret_cast<char*>(&s), sizeof(s), &required), 0);
+  EXPECT_STREQ(s.logFile, "");
+  EXPECT_EQ(s.sectionA[0], 0);
+  EXPECT_STREQ(s.sectionText, "");
+
+  p = kcapPayload();
+  put16(p, 100, 60000);   // a text longer than the payload
+  put16(p, 260, 400);     // section text running past the end
+  ASSERT_EQ(klpStatusFromKcap(p.data(), p.size(), reinterpret_cast<char*>(&s), sizeof(s), &required), 0);
+  EXPECT_STREQ(s.logFile, "");
+  EXPECT_STREQ(s.sectionText, "");
+  EXPECT_EQ(s.sectionA[0], 'A');  // the fields themselves were inside
+
+  // A payload too short for the fixed fields is refused.
+  EXPECT_EQ(klpStatusFromKcap(p.data(), 69, reinterpret_cast<char*>(&s), sizeof(s), &required),
+            KLP_API_BAD_REPLY);
+}
+
+TEST(CmdApiStatusFormat3, LongLogFileNameIsCutToItsField) {
+  std::vector<char> p(2000, 0);
+  put16(p, 16, 100);
+  put16(p, 100, 1500);
+  std::memset(p.data() + 102, 'x', 1500);
+  klpStatusFmt3 s;
+  int32_t required = 0;
+  ASSERT_EQ(klpStatusFromKcap(p.data(), p.size(), reinterpret_cast<char*>(&s), sizeof(s), &required), 0);
+  EXPECT_EQ(std::strlen(s.logFile), 1027u);
+  EXPECT_EQ(s.activeSubs, 0);
+}
+
+TEST(CmdApiStatusFormat3, SmallBufferGetsNothing) {
+  auto p = kcapPayload();
+  std::vector<char> out(2223, 0x55);
+  int32_t required = 0;
+  EXPECT_EQ(klpStatusFromKcap(p.data(), p.size(), out.data(), out.size(), &required),
+            KLP_API_BUFFER_TOO_SMALL);
+  EXPECT_EQ(required, 2224);
+  for (char c : out) ASSERT_EQ(c, 0x55);
+}
+
+// ---------------------------------------------------------------------------
+// Status data of format 2
+// ---------------------------------------------------------------------------
+
+std::vector<char> kappPayload(int records) {
+  std::vector<char> p(32 + 12296 * static_cast<size_t>(records) + 64, 0);
+  put32(p, 12, records);
+  put32(p, 16, 77);
+  put16(p, 20, static_cast<uint16_t>(p.size() - 20));
+  put16(p, p.size() - 20, 4);
+  std::memcpy(p.data() + p.size() - 18, "QMGR", 4);
+  put32(p, 24, 11);
+  put32(p, 28, 12);
+  for (int r = 0; r < records; ++r) {
+    size_t b = 32 + 12296 * static_cast<size_t>(r);
+    std::memset(p.data() + b, 'a' + r, 48);
+    put32(p, b + 52, 520 + r);
+    std::memcpy(p.data() + b + 56, "2024-01-02-03.04.05.000001", 26);
+    std::memset(p.data() + b + 83, 'q', 64);
+    std::memset(p.data() + b + 148, 'r', 64);
+    std::memcpy(p.data() + b + 213, "2024-01-02-03.04.05.000002", 26);
+    put32(p, b + 240, 240);
+    put32(p, b + 244, 244);
+    int16_t w = -5;
+    std::memcpy(p.data() + b + 248, &w, 2);
+    put64(p, b + 256, 0x100000007LL);
+    put64(p, b + 264, 8);
+    put64(p, b + 272, 9);
+    put64(p, b + 280, 10);
+    std::memcpy(p.data() + b + 288, "first", 5);
+    std::memset(p.data() + b + 3289, 'z', 3001);  // unterminated: cut to 3000
+    std::memcpy(p.data() + b + 6290, "third", 5);
+    std::memcpy(p.data() + b + 9291, "fourth", 6);
+  }
+  return p;
+}
+
+TEST(CmdApiStatusFormat2, RecordsAreCopiedWidenedAndCut) {
+  auto p = kappPayload(2);
+  std::vector<char> out(1048 + 2 * 12272, 0x55);
+  int32_t required = 0;
+  ASSERT_EQ(klpStatusFromKapp(p.data(), p.size(), out.data(), out.size(), &required), 0);
+  EXPECT_EQ(required, 13320 + 12272);
+  klpStatusFmt2 h;
+  std::memcpy(&h, out.data(), sizeof(h));
+  EXPECT_EQ(h.format, 2);
+  EXPECT_EQ(h.count, 2);
+  EXPECT_EQ(h.value8, 77);
+  EXPECT_STREQ(h.text, "QMGR");
+  EXPECT_EQ(h.value1040, 11);
+  EXPECT_EQ(h.value1044, 12);
+  auto* r = new klpStatusFmt2Record;
+  std::memcpy(r, out.data() + 1048 + 12272, sizeof(*r));
+  EXPECT_EQ(std::string(r->ident, 48), std::string(48, 'b'));
+  EXPECT_EQ(r->unused48, 0);
+  EXPECT_EQ(r->value52, 521);
+  EXPECT_EQ(std::string(r->time56, 26), "2024-01-02-03.04.05.000001");
+  EXPECT_EQ(r->gap82, 0);
+  EXPECT_EQ(std::string(r->block83, 64), std::string(64, 'q'));
+  EXPECT_EQ(std::string(r->block148, 64), std::string(64, 'r'));
+  EXPECT_EQ(std::string(r->time213, 26), "2024-01-02-03.04.05.000002");
+  EXPECT_EQ(r->value240, 240);
+  EXPECT_EQ(r->value244, 244);
+  EXPECT_EQ(r->value248, -5);
+  EXPECT_EQ(r->value252, 7);  // low 32 bits of 0x100000007
+  EXPECT_EQ(r->value264, 10);
+  EXPECT_STREQ(r->text268, "first");
+  EXPECT_EQ(std::strlen(r->text3269), 3000u);
+  EXPECT_STREQ(r->text6270, "third");
+  EXPECT_STREQ(r->text9271, "fourth");
+  delete r;
+}
+
+TEST(CmdApiStatusFormat2, ShortBuffersAndLyingCounts) {
+  auto p = kappPayload(2);
+  std::vector<char> out(13320, 0x55);
+  int32_t required = 0;
+  // Room for one record: that one is filled and the call still succeeds.
+  ASSERT_EQ(klpStatusFromKapp(p.data(), p.size(), out.data(), out.size(), &required), 0);
+  EXPECT_EQ(get32(out.data(), 4), 1);
+  // Below 13320 nothing is written.
+  std::vector<char> tiny(13319, 0x55);
+  ASSERT_EQ(klpStatusFromKapp(p.data(), p.size(), tiny.data(), tiny.size(), &required), 0);
+  for (char c : tiny) ASSERT_EQ(c, 0x55);
+  // More records claimed than carried.
+  put32(p, 12, 3);
+  EXPECT_EQ(klpStatusFromKapp(p.data(), p.size(), out.data(), out.size(), &required),
+            KLP_API_BAD_REPLY);
+}
+
+// ---------------------------------------------------------------------------
+// Exchanges with a fake server in a child process
+// ---------------------------------------------------------------------------
+
+// A logger for the messages of the calls under test, and the main thread
+// known to the recovery manager so that queue resources can be registered.
+class CmdApiExchange : public ::testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    saved_ = klpGetProcessLogger();
+    logger_ = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
+    ASSERT_NE(logger_, nullptr);
+    logger_->loadBuiltinMsgs(builtinMsgTable);
+    klpSetProcessLogger(logger_);
+    klpEnsureMainThread();
+  }
+  static void TearDownTestSuite() {
+    klpSetProcessLogger(saved_);
+    delete logger_;
+  }
+  void SetUp() override {
+    // The IPC directory is kept once read: start each test from its own.
+    ASSERT_EQ(klpEnvClear(klpGetEnv()), 0);
+  }
+  void TearDown() override { klpEnvClear(klpGetEnv()); }
+
+  std::string replyPath(const std::string& server) {
+    return tmp_.path() + server + ".IPC.CMD" + std::to_string(getpid());
+  }
+
+  klptest::TmpDir tmp_;
+  static msgLogger* logger_;
+  static msgLogger* saved_;
+};
+msgLogger* CmdApiExchange::logger_ = nullptr;
+msgLogger* CmdApiExchange::saved_ = nullptr;
+
+// Server side run in a forked child: owns the server queue (created by the
+// parent before the fork, so the client finds it at once) and answers
+// `requests` requests with `respond`, whose answer becomes the exit code.
+class FakeServer {
+ public:
+  FakeServer(const std::string& dir, const std::string& name) : dir_(dir), name_(name) {
+    path_ = dir + name + ".IPC";
+    HSVResID id;
+    EXPECT_EQ(hsvIPCGetQueResID(path_.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+    EXPECT_EQ(queue_.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK);
+  }
+  ~FakeServer() {
+    if (child_ > 0) {
+      kill(child_, SIGKILL);
+      waitpid(child_, nullptr, 0);
+    }
+    queue_.destroy();
+  }
+
+  void start(int requests, const std::function<int(const IpcMsgView&)>& respond) {
+    fflush(stdout);
+    child_ = fork();
+    if (child_ != 0) return;
+    // The reply sender names the reply queue by this process's prefix.
+    std::snprintf(klpGetEnv()->appVersion.rel.uniqueName, KLP_UNIQUE_NAME_SIZE, "%s",
+                  name_.c_str());
+    // A forked child is a new OS thread: register it as the main thread.
+    klpThread::prologue(klpMainThread());
+    int code = 0;
+    for (int i = 0; i < requests; ++i) {
+      char buf[HSV_MAX_MSG_SIZE];
+      size_t got = 0;
+      if (queue_.get(buf, sizeof(buf), &got, 20000) != ECF_OK) _exit(90);
+      IpcMsgView view;
+      if (ipcDecodeMsg(buf, got, &view) != 0) _exit(91);
+      code |= respond(view);
+    }
+    fflush(stdout);
+    _exit(code);
+  }
+
+  // Waits for the child (its own gets are bounded); answers its exit code.
+  int finish() {
+    int status = 0;
+    if (child_ <= 0 || waitpid(child_, &status, 0) != child_) return -1;
+    child_ = -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  }
+
+  // True once a request waits on the server queue.
+  bool hasRequest() { return queue_.hasMessage(); }
+
+  // Puts raw bytes on the requester's reply queue.
+  int putRaw(int32_t pid, const std::vector<char>& bytes) {
+    char path[2048];
+    ipcReplyQueuePath(path, sizeof(path), dir_.c_str(), name_.c_str(), pid);
+    HSVResID id;
+    HSVHIPCQueue q;
+    if (hsvIPCGetQueResID(path, HSV_QUEUE_RESID_OPTION, &id) != ECF_OK) return 80;
+    if (q.attach(id) != ECF_OK) return 81;
+    int rc = q.put(bytes.data(), bytes.size()) == ECF_OK ? 0 : 82;
+    q.detach();
+    return rc;
+  }
+
+  // Answers through the library's reply sender.
+  static int reply(const IpcMsgView& req, const std::vector<char>& payload) {
+    IpcMsg* msg = nullptr;
+    if (createReplyMsg(&msg, IPC_HEADER_SIZE + payload.size(), req.header.func, getpid()) != 0)
+      return 70;
+    msg->subFunc = req.header.subFunc;
+    if (!payload.empty()) std::memcpy(msg->payload(), payload.data(), payload.size());
+    int rc = KLPResponseFunc(req.header.senderPid, msg);
+    freeIpcMsg(msg);
+    return rc == 0 ? 0 : 71;
+  }
+
+ private:
+  std::string dir_, name_, path_;
+  HSVHIPCQueue queue_;
+  pid_t child_ = -1;
+};
+
+// A hand-made reply message: header fields as given, payload bytes.
+std::vector<char> rawMsg(int32_t func, const std::vector<char>& payload, int32_t pieceCount,
+                         int32_t pieceNo, int32_t total, int32_t version = 1) {
+  std::vector<char> m(IPC_HEADER_SIZE + payload.size(), 0);
+  std::memcpy(m.data(), "IPC:", 4);
+  put32(m, 8, version);
+  put32(m, 12, static_cast<int32_t>(m.size()));
+  put32(m, 16, func);
+  put32(m, 24, getpid());
+  put32(m, 32, pieceCount);
+  put32(m, 36, pieceNo);
+  put32(m, 40, total);
+  if (!payload.empty()) std::memcpy(m.data() + IPC_HEADER_SIZE, payload.data(), payload.size());
+  return m;
+}
+
+TEST_F(CmdApiExchange, StopIsAnsweredAndQueuesAreGone) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [](const IpcMsgView& req) {
+    if (req.header.func != 14 || req.payloadLen != 0 || req.header.msgLength != 44) return 60;
+    return FakeServer::reply(req, {});
+  });
+  char* reply = nullptr;
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 14, nullptr, &reply, &cap), 0) << cap.text;
+  EXPECT_EQ(srv.finish(), 0);
+  ASSERT_NE(reply, nullptr);
+  EXPECT_GT(get32(reply, 0), 0);
+  EXPECT_EQ(get32(reply, 4), 0);
+  std::free(reply);
+  EXPECT_FALSE(klptest::queueExists(replyPath("S1.KLP.KCAP")));
+}
+
+TEST_F(CmdApiExchange, RequestTextTravelsWithItsTerminator) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [](const IpcMsgView& req) {
+    if (req.header.func != 23 || req.payloadLen != 3 || std::memcmp(req.payload, "Q1", 3) != 0)
+      return 61;
+    return FakeServer::reply(req, {});
+  });
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 23, "Q1", nullptr, &cap), 0) << cap.text;
+  EXPECT_EQ(srv.finish(), 0);
+  // The reply of an ordinary command is reported with message 522.
+  EXPECT_NE(std::string(cap.text).find("KLP0522"), std::string::npos) << cap.text;
+}
+
+TEST_F(CmdApiExchange, StatusReplyIsPrintedPerThread) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [](const IpcMsgView& req) {
+    return FakeServer::reply(req, statusPayload({{"AdminThread", 4}, {"HoldLThread", 5}}));
+  });
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 15, nullptr, nullptr, &cap), 0) << cap.text;
+  EXPECT_EQ(srv.finish(), 0);
+  std::string text(cap.text);
+  EXPECT_NE(text.find("AdminThread"), std::string::npos) << text;
+  EXPECT_NE(text.find("is doing work"), std::string::npos) << text;
+  EXPECT_NE(text.find("is resting"), std::string::npos) << text;
+}
+
+TEST_F(CmdApiExchange, LyingStatusReplyFailsInsteadOfReadingBeyond) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [](const IpcMsgView& req) {
+    return FakeServer::reply(req, statusPayload({{"AdminThread", 4}}, 50));
+  });
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 15, nullptr, nullptr, &cap), 817);
+  EXPECT_EQ(srv.finish(), 0);
+  EXPECT_EQ(std::string(cap.text).find("AdminThread"), std::string::npos);
+  EXPECT_NE(std::string(cap.text).find("817"), std::string::npos) << cap.text;
+}
+
+TEST_F(CmdApiExchange, MultiPieceReplyIsGatheredWhole) {
+  // Two KAPP records travel in seven pieces.
+  auto payload = kappPayload(2);
+  FakeServer srv(tmp_.path(), "S1.KLP.KAPP");
+  srv.start(1, [&](const IpcMsgView& req) {
+    if (req.header.func != 61) return 62;
+    return FakeServer::reply(req, payload);
+  });
+  klpReleaseInfo rel{KLP_KIND_KAPP, 9, 1, 0};
+  klpStatusRequest req{};
+  std::strcpy(req.serverName, "s1");
+  std::strcpy(req.schema, "klp");
+  std::vector<char> out(1048 + 2 * 12272);
+  req.buffer = out.data();
+  req.bufferSize = static_cast<int32_t>(out.size());
+  klpResultBlock res{};
+  EXPECT_EQ(klpGetStatus(&rel, &req, &res), 0) << res.text;
+  EXPECT_EQ(srv.finish(), 0);
+  EXPECT_EQ(req.requiredSize, 13320 + 12272);
+  EXPECT_EQ(get32(out.data(), 4), 2);
+  EXPECT_STREQ(out.data() + 1048 + 12272 + 9271, "fourth");
+}
+
+TEST_F(CmdApiExchange, PieceNumbersThatDisagreeFailWithAMessage) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [&](const IpcMsgView& req) {
+    std::vector<char> first(4052, 'a'), third(100, 'c');
+    int rc = srv.putRaw(req.header.senderPid, rawMsg(60, first, 2, 1, 4152));
+    rc |= srv.putRaw(req.header.senderPid, rawMsg(60, third, 2, 3, 4152));
+    return rc;
+  });
+  char* reply = nullptr;
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 60, nullptr, &reply, &cap), 816);
+  EXPECT_EQ(srv.finish(), 0);
+  EXPECT_EQ(reply, nullptr);
+  EXPECT_NE(std::string(cap.text).find("KLP0589"), std::string::npos) << cap.text;
+  EXPECT_FALSE(klptest::queueExists(replyPath("S1.KLP.KCAP")));
+}
+
+TEST_F(CmdApiExchange, TotalLargerThanThePiecesCarryIsRefused) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [&](const IpcMsgView& req) {
+    std::vector<char> piece(4052, 'a');
+    // Two pieces can never carry 100000 bytes.
+    return srv.putRaw(req.header.senderPid, rawMsg(60, piece, 2, 1, 100000));
+  });
+  char* reply = nullptr;
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 60, nullptr, &reply, &cap), 816);
+  EXPECT_EQ(srv.finish(), 0);
+  EXPECT_EQ(reply, nullptr);
+}
+
+TEST_F(CmdApiExchange, WrongVersionIsRefused) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [&](const IpcMsgView& req) {
+    return srv.putRaw(req.header.senderPid, rawMsg(14, {}, 1, 0, 0, 2));
+  });
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 14, nullptr, nullptr, &cap), 825);
+  EXPECT_EQ(srv.finish(), 0);
+}
+
+TEST_F(CmdApiExchange, ShortStatusThroughTheCollectorIsRefused) {
+  FakeServer srv(tmp_.path(), "S1.KLP.CAP");
+  srv.start(1, [](const IpcMsgView& req) {
+    // Three records claimed, one carried.
+    return FakeServer::reply(req, statusPayload({{"AdminThread", 4}}, 3));
+  });
+  klpReleaseInfo rel{KLP_KIND_CAP, 9, 1, 0};
+  klpStatusRequest req{};
+  std::strcpy(req.serverName, "S1");
+  std::strcpy(req.schema, "KLP");
+  std::vector<char> out(200);
+  req.buffer = out.data();
+  req.bufferSize = static_cast<int32_t>(out.size());
+  klpResultBlock res{};
+  EXPECT_EQ(klpGetStatus(&rel, &req, &res), KLP_API_BAD_REPLY);
+  EXPECT_EQ(res.rc, KLP_API_BAD_REPLY);
+  EXPECT_EQ(srv.finish(), 0);
+  EXPECT_NE(std::string(res.text), "");
+}
+
+TEST_F(CmdApiExchange, CollectorAllocatesWhenGivenNoBuffer) {
+  FakeServer srv(tmp_.path(), "MYDB.KLP.KCAP");
+  srv.start(1, [](const IpcMsgView& req) {
+    if (req.header.func != 60) return 63;
+    return FakeServer::reply(req, kcapPayload());
+  });
+  klpReleaseInfo rel{KLP_KIND_KCAP, 9, 1, 0};
+  klpStatusRequest req{};
+  std::strcpy(req.serverName, "mydb");
+  std::strcpy(req.schema, "KLP.");
+  klpResultBlock res{};
+  EXPECT_EQ(klpCollectStatus(&rel, &req, &res, nullptr), 0);
+  EXPECT_EQ(srv.finish(), 0);
+  ASSERT_NE(req.buffer, nullptr);
+  EXPECT_EQ(req.bufferSize, 2224);
+  EXPECT_EQ(req.requiredSize, 2224);
+  klpStatusFmt3 s;
+  std::memcpy(&s, req.buffer, sizeof(s));
+  EXPECT_EQ(s.upTime, 90061);
+  EXPECT_STREQ(s.logFile, "/var/log/kcp");
+  std::free(req.buffer);
+}
+
+TEST_F(CmdApiExchange, StaleReplyQueueIsReplaced) {
+  // A queue with our reply queue's name, and a message in it, left over by
+  // an earlier process with the same id.
+  std::string stale = replyPath("S1.KLP.KCAP");
+  HSVResID id;
+  ASSERT_EQ(hsvIPCGetQueResID(stale.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+  HSVHIPCQueue old;
+  ASSERT_EQ(old.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK);
+  auto junk = rawMsg(15, statusPayload({{"OldThread", 1}}), 1, 0, 0);
+  ASSERT_EQ(old.put(junk.data(), junk.size()), ECF_OK);
+  old.detach();
+
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [](const IpcMsgView& req) {
+    return FakeServer::reply(req, statusPayload({{"NewThread", 4}}));
+  });
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 15, nullptr, nullptr, &cap), 0) << cap.text;
+  EXPECT_EQ(srv.finish(), 0);
+  EXPECT_NE(std::string(cap.text).find("NewThread"), std::string::npos) << cap.text;
+  EXPECT_EQ(std::string(cap.text).find("OldThread"), std::string::npos) << cap.text;
+  EXPECT_FALSE(klptest::queueExists(stale));
+}
+
+TEST_F(CmdApiExchange, ChangedParametersAreSentOneByOne) {
+  ParmEntry cmdTable[KCAPCMD_PARM_COUNT];
+  ParmEntry srvTable[XQPUB_PARM_COUNT];
+  buildKCapCmdParmTable(cmdTable);
+  buildXqpubParmTable(srvTable);
+  int rc1 = 0, rc2 = 0;
+  kCapCmdParmClass cmd(cmdTable, KCAPCMD_PARM_COUNT, &rc1);
+  xqpubParms server(srvTable, XQPUB_PARM_COUNT, &rc2);
+  ASSERT_EQ(rc1, 0);
+  ASSERT_EQ(rc2, 0);
+  cmd.setServerParms(&server);
+  ASSERT_EQ(cmd.addChgParm(30, "1000"), 0);
+  ASSERT_EQ(cmd.addChgParm(16, "200"), 0);
+  klpParmClass* before = klpGetCurrentParms();
+  klpSetCurrentParms(&cmd);
+
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(2, [](const IpcMsgView& req) {
+    if (req.header.func != 20) return 64;
+    // The request is echoed back, its subFunc naming the parameter.
+    std::vector<char> text(req.payload, req.payload + req.payloadLen);
+    return FakeServer::reply(req, text);
+  });
+  klpMsgCapture cap{};
+  int rc = cmdAPIFunc("S1.KLP.KCAP", 20, nullptr, nullptr, &cap);
+  klpSetCurrentParms(before);
+  EXPECT_EQ(rc, 0) << cap.text;
+  EXPECT_EQ(srv.finish(), 0);
+  std::string text(cap.text);
+  size_t a = text.find("COMMIT_INTERVAL"), b = text.find("SLEEP_INTERVAL");
+  EXPECT_NE(a, std::string::npos) << text;
+  EXPECT_NE(b, std::string::npos) << text;
+  EXPECT_NE(text.find("1000"), std::string::npos) << text;
+  EXPECT_NE(text.find("200"), std::string::npos) << text;
+}
+
+TEST_F(CmdApiExchange, ReplySenderCutsLongRepliesIntoPieces) {
+  // Our own reply queue, named as the reply sender forms it with no prefix.
+  char path[2048];
+  ASSERT_EQ(ipcReplyQueuePath(path, sizeof(path), getEnvIPCDir(klpGetEnv()), nullptr, 4711), 0);
+  HSVResID id;
+  ASSERT_EQ(hsvIPCGetQueResID(path, HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+  HSVHIPCQueue q;
+  ASSERT_EQ(q.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK);
+
+  IpcMsg* msg = nullptr;
+  ASSERT_EQ(createReplyMsg(&msg, IPC_HEADER_SIZE + 4053, 17, getpid()), 0);
+  for (int i = 0; i < 4053; ++i) msg->payload()[i] = static_cast<char>(i % 251);
+  EXPECT_EQ(KLPResponseFunc(4711, msg), 0);
+
+  char buf[HSV_MAX_MSG_SIZE];
+  size_t got = 0;
+  IpcGather gather;
+  int32_t left = -1;
+  std::vector<size_t> sizes;
+  while (left != 0 && q.get(buf, sizeof(buf), &got, 2000) == ECF_OK) {
+    sizes.push_back(got);
+    IpcMsgView v;
+    ASSERT_EQ(ipcDecodeMsg(buf, got, &v), 0);
+    EXPECT_EQ(v.header.pieceCount, 2);
+    EXPECT_EQ(v.header.totalLength, 4053);
+    ASSERT_EQ(gather.add(v, &left), 0);
+  }
+  ASSERT_EQ(sizes, (std::vector<size_t>{4096, 45}));
+  char* all = gather.release();
+  ASSERT_NE(all, nullptr);
+  EXPECT_EQ(get32(all, 4), 4053);
+  EXPECT_EQ(std::memcmp(all + 8, msg->payload(), 4053), 0);
+  std::free(all);
+  freeIpcMsg(msg);
+  q.destroy();
+}
+
+// ---------------------------------------------------------------------------
+// The control interface's checks
+// ---------------------------------------------------------------------------
+
+TEST_F(CmdApiExchange, ArgumentChecksComeInOrder) {
+  klpResultBlock res;
+  klpReleaseInfo rel{KLP_KIND_CAP, 9, 1, 0};
+  klpStatusRequest req{};
+  std::strcpy(req.serverName, "S1");
+  std::strcpy(req.schema, "KLP");
+
+  EXPECT_EQ(klpStartProgram(), 0);
+  EXPECT_EQ(klpStopProgram(1, "S", "K", 0, nullptr), 2001);
+  EXPECT_EQ(klpStopProgram(0, "S", "K", 0, &res), 2006);
+  EXPECT_EQ(res.rc, 2006);
+  EXPECT_EQ(klpStopProgram(1, "", "K", -1, &res), 2007);
+  EXPECT_EQ(klpStopProgram(1, "S", " ", -1, &res), 2008);
+  EXPECT_EQ(klpStopProgram(1, "S", "K", -1, &res), 2005);
+
+  EXPECT_EQ(klpGetStatusSize(&rel, &req, nullptr), 2001);
+  std::memset(&res, 0x7f, sizeof(res));
+  EXPECT_EQ(klpGetStatusSize(nullptr, &req, &res), 2001);
+  EXPECT_STREQ(res.text, "klpReleaseInfo");
+  EXPECT_EQ(klpGetStatusSize(&rel, nullptr, &res), 2001);
+  EXPECT_STREQ(res.text, "klpGetStatusDataSize");
+  klpReleaseInfo old{KLP_KIND_CAP, 9, 1, 1};
+  EXPECT_EQ(klpGetStatusSize(&old, &req, &res), 2002);
+  klpReleaseInfo bad{6, 9, 1, 0};
+  EXPECT_EQ(klpGetStatusSize(&bad, &req, &res), 2006);
+  klpReleaseInfo kcap{KLP_KIND_KCAP, 9, 1, 0};
+  klpStatusRequest none{};  // no names: KCAP needs no server for its size
+  EXPECT_EQ(klpGetStatusSize(&kcap, &none, &res), 0);
+  EXPECT_EQ(none.statusSize, 2224);
+  klpStatusRequest noSchema{};
+  std::strcpy(noSchema.serverName, "S1");
+  EXPECT_EQ(klpGetStatusSize(&rel, &noSchema, &res), 2008);
+
+  EXPECT_EQ(klpGetStatus(nullptr, &req, &res), 2001);
+  EXPECT_EQ(klpGetStatus(&rel, nullptr, &res), 2001);
+  EXPECT_STREQ(res.text, "klpGetStatusData");
+  EXPECT_EQ(klpGetStatus(&rel, &req, &res), 2003);
+  char buf[64];
+  req.buffer = buf;
+  req.bufferSize = 0;
+  EXPECT_EQ(klpGetStatus(&rel, &req, &res), 2004);
+  req.bufferSize = sizeof(buf);
+  EXPECT_EQ(klpGetStatus(&old, &req, &res), 2002);
+  EXPECT_EQ(klpGetStatus(&bad, &req, &res), 2006);
+  std::strcpy(req.serverName, " ");
+  EXPECT_EQ(klpGetStatus(&rel, &req, &res), 2007);
+}
+
+TEST_F(CmdApiExchange, StatusSizeFromTheThreadCount) {
+  FakeServer srv(tmp_.path(), "S1.KLP.MON");
+  srv.start(1, [](const IpcMsgView& req) {
+    if (req.header.func != 59) return 65;
+    std::vector<char> p(16, 0);
+    std::memcpy(p.data(), "klpSISize: ", 12);
+    put32(p, 12, 3);
+    return FakeServer::reply(req, p);
+  });
+  klpReleaseInfo rel{KLP_KIND_MON, 9, 1, 0};
+  klpStatusRequest req{};
+  std::strcpy(req.serverName, "s1");
+  std::strcpy(req.schema, "klp");
+  klpResultBlock res{};
+  EXPECT_EQ(klpGetStatusSize(&rel, &req, &res), 0) << res.text;
+  EXPECT_EQ(srv.finish(), 0);
+  EXPECT_EQ(req.statusSize, 80);
+}
+
+// A server that is not there: attach fails after five attempts (about 8 s).
+TEST_F(CmdApiExchange, MissingServerIsReportedAndMapped) {
+  klpResultBlock res{};
+  EXPECT_EQ(klpStopProgram(KLP_KIND_KCAP, "nosuch", "klp", 0, &res), 2013);
+  EXPECT_EQ(res.rc, 2013);
+  std::string text(res.text);
+  EXPECT_NE(text.find("KLP0506"), std::string::npos) << text;
+  EXPECT_NE(text.find("K Capture"), std::string::npos) << text;
+  EXPECT_NE(text.find("KLP0597"), std::string::npos) << text;
+  EXPECT_FALSE(klptest::queueExists(replyPath("NOSUCH.KLP.KCAP")));
+}
+
+// A server whose queue exists but that never answers: 16 polls, 15 pauses.
+TEST_F(CmdApiExchange, SilentServerEndsWithNoReply) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 14, nullptr, nullptr, &cap), 824);
+  EXPECT_NE(std::string(cap.text).find("KLP0510"), std::string::npos) << cap.text;
+  EXPECT_FALSE(klptest::queueExists(replyPath("S1.KLP.KCAP")));
+}
+
+// An interrupt while the client waits returns to the recovery point, whose
+// recovery resources destroy the reply queue: nothing is left behind.
+TEST_F(CmdApiExchange, InterruptWhileWaitingDestroysTheReplyQueue) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");  // never answers
+  fflush(stdout);
+  pid_t child = fork();
+  if (child == 0) {
+    klpThread* t = klpMainThread();
+    klpThread::prologue(t);
+    if (KLP_SET_RECOVERY_POINT(t->rcvyMgr) != 0) {
+      recoveryMgr::erRecover(&t->rcvyMgr, t);
+      fflush(stdout);
+      _exit(0);
+    }
+    cmdAPIFunc("S1.KLP.KCAP", 14, nullptr, nullptr, nullptr);
+    _exit(5);
+  }
+  ASSERT_GT(child, 0);
+  std::string path = tmp_.path() + "S1.KLP.KCAP.IPC.CMD" + std::to_string(child);
+  // The request is put after both queues are registered for recovery.
+  bool sent = false;
+  for (int i = 0; i < 1000 && !sent; ++i) {
+    sent = srv.hasRequest();
+    if (!sent) usleep(10000);
+  }
+  ASSERT_TRUE(sent);
+  EXPECT_TRUE(klptest::queueExists(path));
+  kill(child, SIGINT);
+  int status = 0;
+  pid_t done = 0;
+  for (int i = 0; i < 1000 && done == 0; ++i) {
+    done = waitpid(child, &status, WNOHANG);
+    if (done == 0) usleep(10000);
+  }
+  if (done == 0) {
+    kill(child, SIGKILL);
+    waitpid(child, &status, 0);
+  }
+  ASSERT_EQ(done, child);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+  EXPECT_FALSE(klptest::queueExists(path));
+}
+
+}  // namespace
