@@ -56,9 +56,6 @@ int detailedStatus() {
 
 int klpCmdDispatch(int detailsFlag) {
   int rc = detailsFlag ? detailedStatus() : KLPCmdFunc();
-  if (rc != 0) {
-    const char* program = getEnvProgramName(klpGetEnv());
-    logInternalError(program && *program ? program : "klpkccmd", rc, "KLPCmdFunc");
-  }
+  if (rc != 0) logInternalError("klpkccmd", rc, "KLPCmdFunc");
   return rc;
 }

@@ -12,6 +12,10 @@
 #include "common/msg/klplog.h"
 #include "common/msg/msglogger.h"
 #include "common/parms/klpparm.h"
+#include "common/env/klpenv.h"
+#include "common/thread/klpthread.h"
+#include "common/thread/recoverymgr.h"
+#include "common/trace/trace_anchor.h"
 #include "common/util/klprc.h"
 #include "xqpub/dispatch.h"
 #include "xqpub/kcapcmdparms.h"
@@ -34,89 +38,137 @@ int findStatusShowDetails(int argc, char** argv) {
   return 0;
 }
 
+
+// What must survive a jump back to the recovery point lives here, not in
+// the entry routine's frame (locals changed after sigsetjmp are unreliable).
+struct Run {
+  msgLogger* logger = nullptr;
+  kCapCmdParmClass* cmdParms = nullptr;
+  xqpubParms* serverParms = nullptr;
+  std::string usage;
+  int rc = KLP_OK;
+  int recoveries = 0;
+};
+Run g_run;
+
+// Steps 3 to 7: parameter objects, command line, name prefix, dispatch.
+// A nonzero rc on entry (prologue failed, or a trap brought us back) only
+// lets the objects be built and the failure be reported.
+void runCommand(int argc, char** argv) {
+  Run& r = g_run;
+  int detailsFlag = 0;
+
+  // 3. Both parameter objects, always constructed so that the end of the run
+  //    releases them whatever happened (once, even after a trap).
+  int cmdRc = KLP_OK, serverRc = KLP_OK;
+  if (!r.cmdParms) {
+    ParmEntry cmdTable[KCAPCMD_PARM_COUNT];
+    buildKCapCmdParmTable(cmdTable);
+    r.cmdParms = new kCapCmdParmClass(cmdTable, KCAPCMD_PARM_COUNT, &cmdRc);
+    ParmEntry serverTable[XQPUB_PARM_COUNT];
+    buildXqpubParmTable(serverTable);
+    r.serverParms = new xqpubParms(serverTable, XQPUB_PARM_COUNT, &serverRc);
+    r.usage = kCapCmdUsageText;
+  }
+
+  // 4. A failed prologue or a trap, then a refused table, ends the run.
+  if (r.rc) {
+    logInternalError(kProgram, r.rc, "threadPrologue");
+    return;
+  }
+  if (cmdRc) {
+    r.rc = cmdRc;
+    logInternalError(kProgram, r.rc, "kCapCmdParmClass");
+    return;
+  }
+  if (serverRc) {
+    r.rc = serverRc;
+    logInternalError(kProgram, r.rc, "xqpubParms");
+    return;
+  }
+
+  // 5. Publish the command set; record the program and its level.
+  klpSetCurrentParms(r.cmdParms);
+  r.cmdParms->setUsageText(r.usage.c_str());
+  r.cmdParms->setServerParms(r.serverParms);
+  setEnvTovRIB(klpGetEnv(), "xqpubcmd", 9, 7, 8);
+
+  // 6. STATUS SHOW DETAILS: the parser sees STATUS only.
+  int at = findStatusShowDetails(argc, argv);
+  if (at > 0) {
+    detailsFlag = 1;
+    std::vector<char*> shortened;
+    for (int i = 0; i < argc; ++i)
+      if (i != at + 1 && i != at + 2) shortened.push_back(argv[i]);
+    shortened.push_back(nullptr);
+    r.rc = r.cmdParms->processCommandLine(argc - 2, shortened.data());
+  } else {
+    r.rc = r.cmdParms->processCommandLine(argc, argv);
+  }
+  if (r.rc) {
+    logInternalError(kProgram, r.rc, "processCommandLine");
+    return;
+  }
+
+  // 7. Messages from here on carry the schema of the command line.
+  const ParmEntry* schema = r.cmdParms->peekSlot(PARM_IDX_SCHEMA);
+  if (schema && schema->strValue) r.logger->setProgramQualifier(schema->strValue);
+
+  // The server's queue is named by the prefix; a trace may be on for it.
+  klpEnv* env = klpGetEnv();
+  if (setEnvNamePrefix(env, "KCAP") != KLP_OK) {
+    r.rc = KLP_RC_NO_SERVER;
+    logInternalError(kProgram, r.rc, "setEnvNamePrefix");
+    return;
+  }
+  trcAttach(getEnvIPCDir(env), getEnvNamePrefix(env), &env->appVersion, nullptr);
+
+  // 8. Send the command, or fetch and print the detailed status.
+  r.rc = klpCmdDispatch(detailsFlag);
+}
+
 }  // namespace
 
 int klpkccmdMain(int argc, char** argv) {
-  int rc = KLP_OK;
+  Run& r = g_run;
 
   // 1. The logger comes first: every later step reports through it.
-  msgLogger* logger = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
-  if (!logger) {
+  r.logger = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
+  if (!r.logger) {
     printf("Program cannot run\n");
     return -1;
   }
-  klpSetProcessLogger(logger);
+  klpSetProcessLogger(r.logger);
 
   // 2. Built-in message texts.
-  logger->loadBuiltinMsgs(builtinMsgTable);
+  r.logger->loadBuiltinMsgs(builtinMsgTable);
 
-  // [process services: trace anchor, main-thread prologue and the recovery
-  //  point are set up here, before the parameter objects exist]
-
-  // 3. Both parameter objects, always constructed so that the end of the run
-  //    releases them whatever happened.
-  ParmEntry cmdTable[KCAPCMD_PARM_COUNT];
-  buildKCapCmdParmTable(cmdTable);
-  int cmdRc = KLP_OK;
-  auto* cmdParms = new kCapCmdParmClass(cmdTable, KCAPCMD_PARM_COUNT, &cmdRc);
-
-  ParmEntry serverTable[XQPUB_PARM_COUNT];
-  buildXqpubParmTable(serverTable);
-  int serverRc = KLP_OK;
-  auto* serverParms = new xqpubParms(serverTable, XQPUB_PARM_COUNT, &serverRc);
-
-  std::string usage = kCapCmdUsageText;  // owned for the life of the run
-  int detailsFlag = 0;
-
-  // 4. A refused table ends the run.
-  // [process services: a failed prologue or a return to the recovery point
-  //  is reported here, before the constructors' results]
-  if (cmdRc) {
-    rc = cmdRc;
-    logInternalError(kProgram, rc, "kCapCmdParmClass");
-  } else if (serverRc) {
-    rc = serverRc;
-    logInternalError(kProgram, rc, "xqpubParms");
+  // Process services: the trace anchor, the main thread, its recovery point.
+  trcInitAnchor();
+  klpThread* mainThread = klpMainThread();
+  r.rc = klpThread::prologue(mainThread);
+  if (r.rc) {
+    logInternalError("threadPrologue", r.rc, "klpThread::prologue");
+  } else if (KLP_SET_RECOVERY_POINT(mainThread->rcvyMgr) != 0) {
+    // Back from a trap: the command is never sent again. A fourth return
+    // ends the thread at once with 2010.
+    r.rc = recoveryMgr::erRecover(&mainThread->rcvyMgr, mainThread);
+    logInternalError("threadPrologue", r.rc, "setRecoveryPoint");
   }
 
-  if (rc == KLP_OK) {
-    // 5. Publish the command set.
-    klpSetCurrentParms(cmdParms);
-    cmdParms->setUsageText(usage.c_str());
-    cmdParms->setServerParms(serverParms);
-    // [process services: program name and level recorded here]
+  runCommand(argc, argv);
 
-    // 6. STATUS SHOW DETAILS: the parser sees STATUS only.
-    int at = findStatusShowDetails(argc, argv);
-    if (at > 0) {
-      detailsFlag = 1;
-      std::vector<char*> shortened;
-      for (int i = 0; i < argc; ++i)
-        if (i != at + 1 && i != at + 2) shortened.push_back(argv[i]);
-      shortened.push_back(nullptr);
-      rc = cmdParms->processCommandLine(argc - 2, shortened.data());
-    } else {
-      rc = cmdParms->processCommandLine(argc, argv);
-    }
-    if (rc) logInternalError(kProgram, rc, "processCommandLine");
-  }
-
-  if (rc == KLP_OK) {
-    // 7. Messages from here on carry the schema of the command line.
-    const ParmEntry* schema = cmdParms->peekSlot(PARM_IDX_SCHEMA);
-    if (schema && schema->strValue) logger->setProgramQualifier(schema->strValue);
-
-    // [process services: name prefix and trace attach here]
-    rc = klpCmdDispatch(detailsFlag);
-  }
-
-  // 8. End of the run.
-  // [process services: trace detach and the main thread's end here]
+  // 9. Trace detach, release what the run owns, end through the main thread.
+  trcDetach();
+  int rc = r.rc;
   klpSetCurrentParms(nullptr);
-  delete serverParms;
-  delete cmdParms;
+  delete r.serverParms;
+  delete r.cmdParms;
+  r.serverParms = nullptr;
+  r.cmdParms = nullptr;
   fflush(stdout);
   klpSetProcessLogger(nullptr);
-  delete logger;
-  return rc == KLP_OK ? 0 : 12;
+  delete r.logger;
+  r.logger = nullptr;
+  threadEnd(mainThread, rc);
 }

@@ -1,6 +1,7 @@
 // Entry routine of the operator's command program klpkccmd.
 #pragma once
 
-// Runs the program; answers the process exit code: 0 when the command
-// succeeded, 12 otherwise, -1 when the message logger cannot be made.
+// Runs the program and ends the process through the main thread's end:
+// exit code 0 when the command succeeded, 12 otherwise. Returns only when the
+// message logger cannot be made, with -1.
 int klpkccmdMain(int argc, char** argv);
