@@ -1,0 +1,430 @@
+#include "common/thread/klpthread.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cstdlib>
+
+#include "common/thread/thread_testutil.h"
+#include "common/util/klprc.h"
+
+namespace {
+
+// What the thread bodies of a test look at.
+std::atomic<bool> g_release{false};    // the bodies that wait end when set
+std::atomic<int> g_runs{0};
+std::atomic<int> g_endWith{0};         // end code of the "end" body
+std::atomic<klpThread*> g_seenCurrent{nullptr};
+std::atomic<int> g_seenState{0};
+
+void reset() {
+  g_release = false;
+  g_runs = 0;
+  g_endWith = 0;
+  g_seenCurrent = nullptr;
+  g_seenState = 0;
+}
+
+// Ends at once with g_endWith.
+void endBody(klpThread* t) {
+  klpThread::prologue(t);
+  ++g_runs;
+  threadEnd(t, g_endWith);
+}
+
+// Runs (state 4) until released, then ends with 0.
+void workBody(klpThread* t) {
+  klpThread::prologue(t);
+  g_seenState = t->getState();
+  g_seenCurrent = currentThread();
+  logKlpMsg(8006, "workBody", KLP_DEST_SEVERITY, "fromWorker", nullptr, 0);
+  t->setState(KLP_THREAD_RUN);
+  while (!g_release) hsvSleep(2);
+  threadEnd(t, 0);
+}
+
+// Rests in short sleeps, never ending by itself (but cancellable).
+void restBody(klpThread* t) {
+  klpThread::prologue(t);
+  t->setState(KLP_THREAD_REST);
+  for (;;) hsvSleep(5);
+}
+
+// Rests and cannot be cancelled: unstoppable until released.
+void holdBody(klpThread* t) {
+  klpThread::prologue(t);
+  pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, nullptr);
+  t->setState(KLP_THREAD_REST);
+  while (!g_release) hsvSleep(5);
+  threadEnd(t, 0);
+}
+
+// Works on a connection and ends with 5 once its work is interrupted.
+void dbBody(klpThread* t) {
+  klpThread::prologue(t);
+  klpDbConn* c = t->connect('O', "DB1", 1208);
+  t->setState(KLP_THREAD_RUN);
+  for (int i = 0; i < 2000 && __atomic_load_n(&c->interrupts, __ATOMIC_RELAXED) == 0; ++i)
+    hsvSleep(5);
+  threadEnd(t, 5);
+}
+
+// First run ends with 9 (to be restarted), the second with 0.
+void restartBody(klpThread* t) {
+  klpThread::prologue(t);
+  int run = ++g_runs;
+  threadEnd(t, run == 1 ? 9 : 0);
+}
+
+// Returns without ending itself.
+void returningBody(klpThread* t) { klpThread::prologue(t); }
+
+klpThread* make(OrdList* list, klpThreadRoutine body, const char* name, int restart = 1,
+                int critical = 0, void* userData = nullptr) {
+  int code = -1;
+  klpThread* t = createThread(&code, list, body, name, nullptr, restart, userData, 0, critical);
+  EXPECT_EQ(0, code);
+  return t;
+}
+
+bool waitState(klpThread* t, int32_t s) {
+  return thrtest::waitFor([&] { return t->getState() == s; });
+}
+
+// A thread that could not be stopped stays on its list, withdrawn: take it
+// off and free it once it is really gone.
+void reapWithdrawn(klpThread* t) {
+  if (t->hasHandle) pthread_join(t->handle, nullptr);
+  ordListDeChain(&t->ole);
+  ordListDeChain(&t->tid);
+  if (t->cmdList && t->cmdList != t->sharedCmdList) delete t->cmdList;
+  delete t;
+}
+
+bool onIdList(klpThread* t) { return t->tid.oleAnchor == klpThreadIdList(); }
+
+TEST(KlpThread, NamesAreCutTo14AndNewThreadsWantStopResumeSuspend) {
+  thrtest::LogCapture cap;
+  klpThread t;
+  t.setName("BehinderWorkerThread");
+  EXPECT_STREQ("BehinderWorker", t.name);
+  EXPECT_STREQ("KlpThrd", t.ole.eyeCatcher);
+  EXPECT_STREQ("KlpThID", t.tid.eyeCatcher);
+  EXPECT_EQ(&t, t.tid.object);
+  EXPECT_EQ(KLP_THREAD_EXIST, t.state);
+  EXPECT_EQ(1, t.restart);
+  for (int code = 0; code < KLP_CMD_CODES; ++code)
+    EXPECT_EQ(code == 14 || code == 18 || code == 19 ? 1 : 0, interestedInCmd(&t, code)) << code;
+  EXPECT_EQ(0, interestedInCmd(&t, 64));
+  EXPECT_EQ(0, interestedInCmd(&t, -1));
+  setCmdInterest(&t, 64, 1);
+  setCmdInterest(&t, 20, 1);
+  EXPECT_EQ(1, interestedInCmd(&t, 20));
+  EXPECT_TRUE(cap.issuedWith(8006, {"64"})) << cap.log();
+  EXPECT_TRUE(cap.issuedWith(8006, {"-1"})) << cap.log();
+  EXPECT_EQ(3u, cap.issued(8006).size());
+}
+
+TEST(KlpThread, PrintShowsNameStateCodeAndRestart) {
+  thrtest::LogCapture cap;
+  auto c = thrtest::inChild(cap.dir(), [] {
+    klpThread t;
+    t.setName("Printer");
+    t.restart = 0;
+    t.endCode = 42;
+    klpThread::print(&t);
+    return 0;
+  });
+  ASSERT_TRUE(c.exited);
+  EXPECT_EQ("klpThread::print  Thread with name Printer and state 1 and RC 42 and RESTART FALSE"
+            " and handle  0000000000000000\n",
+            c.out);
+}
+
+TEST(KlpThread, TheMainThreadEndsTheProcessWith12Or0) {
+  thrtest::mainReady();
+  thrtest::LogCapture cap;
+  auto bad = thrtest::inChild(cap.dir(), [] {
+    threadEnd(klpMainThread(), 5);
+    return 99;
+  });
+  EXPECT_TRUE(bad.exited);
+  EXPECT_EQ(12, bad.exitCode);
+  auto good = thrtest::inChild(cap.dir(), [] {
+    threadEnd(klpMainThread(), 0);
+    return 99;
+  });
+  EXPECT_EQ(0, good.exitCode);
+}
+
+TEST(KlpThread, TheFirstPrologueNamesTheMainThreadInitial) {
+  klpThread* m = thrtest::mainReady();
+  EXPECT_STREQ("Initial", m->name);
+  EXPECT_EQ(KLP_THREAD_RUN, m->getState());
+  EXPECT_EQ(m, currentThread());
+  EXPECT_STREQ("KlpThreadIDList", klpThreadIdList()->qName);
+  EXPECT_EQ(1, klpThreadIdList()->locked);
+  EXPECT_EQ(0, klpThreadIdList()->ownerCheck());
+  EXPECT_EQ(nullptr, m->cmdList);
+  EXPECT_EQ(klpSharedCmdList(), m->sharedCmdList);
+}
+
+// ---------------------------------------------------------------------------
+// With real threads
+// ---------------------------------------------------------------------------
+TEST(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
+  thrtest::mainReady();
+  thrtest::LogCapture cap;
+  reset();
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  void* data = malloc(64);  // freed by the thread's end
+  klpThread* t = make(&list, workBody, "Worker", 1, 0, data);
+  ASSERT_NE(nullptr, t);
+  ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
+  EXPECT_EQ(t, g_seenCurrent.load());
+  EXPECT_EQ(KLP_THREAD_INIT, g_seenState.load());
+  EXPECT_EQ(KLP_THREAD_RUN, threadStateByName(&list, "Worker"));
+  EXPECT_EQ(0, threadStateByName(&list, "Work"));
+  EXPECT_STREQ("Worker", t->cmdList->qName);
+  EXPECT_EQ(1, t->cmdList->locked);
+  EXPECT_EQ(&t->dbCtx.ole, t->dbCtxList.olHead);
+  EXPECT_TRUE(onIdList(t));
+  EXPECT_EQ(1, list.count);
+  g_release = true;
+  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());  // 0 is stored as 2011
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));
+  EXPECT_EQ(0, list.count);
+  // The logger names the thread that issued the message.
+  std::string log = cap.log();
+  size_t at = log.find("fromWorker");
+  ASSERT_NE(std::string::npos, at) << log;
+  EXPECT_NE(std::string::npos, log.rfind("Worker\"", at)) << log;
+}
+
+TEST(MtThread, ABodyThatReturnsEndsAs2011AndTheSharedCommandListCanBeUsed) {
+  thrtest::mainReady();
+  OrdList list;
+  list.makeShared("Threads", 1);
+  int code = -1;
+  klpThread* t = createThread(&code, &list, returningBody, "Returner", "MYDB", 1, nullptr, 1, 0);
+  ASSERT_EQ(0, code);
+  EXPECT_EQ(klpSharedCmdList(), t->cmdList);
+  EXPECT_EQ(0, strncmp(t->dbCtx.dbAlias, "MYDB    ", 8));
+  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));  // the shared list survives
+  EXPECT_EQ(1, klpSharedCmdList()->locked);
+}
+
+TEST(MtThread, StopOfAnEndedThreadReturnsItsEndCodeAndRemovesIt) {
+  thrtest::mainReady();
+  thrtest::LogCapture cap;
+  reset();
+  g_endWith = 77;
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* t = make(&list, endBody, "Ender");
+  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
+  EXPECT_FALSE(onIdList(t));  // an ended thread's id may be reused
+  EXPECT_EQ(77, klpThread::stop(t));
+  EXPECT_EQ(0, list.count);
+  EXPECT_EQ(nullptr, list.olHead);
+  EXPECT_TRUE(cap.issuedWith(590, {"Initial", "77", "Ender"})) << cap.log();
+}
+
+TEST(MtThread, StopInterruptsTheDbWorkOfAWorkingThread) {
+  thrtest::mainReady();
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* t = make(&list, dbBody, "DbWorker");
+  ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
+  ASSERT_TRUE(thrtest::waitFor([&] { return t->getCurDbConn() != nullptr; }));
+  EXPECT_EQ(5, klpThread::stop(t));  // it ended during the stop's wait
+  EXPECT_EQ(0, list.count);
+}
+
+TEST(MtThread, AThreadThatCannotBeBroughtToAnEndIsWithdrawn) {
+  thrtest::mainReady();
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* t = make(&list, restBody, "Rester");
+  ASSERT_TRUE(waitState(t, KLP_THREAD_REST));
+  EXPECT_EQ(KLP_RC_RECOVERED, klpThread::stop(t));
+  EXPECT_EQ(1, t->ole.withdrawn);
+  EXPECT_EQ(1, list.count);
+  EXPECT_EQ(nullptr, list.browseHead());
+  EXPECT_EQ(0, threadStateByName(&list, "Rester"));
+  void* ret = nullptr;
+  ASSERT_EQ(0, pthread_join(t->handle, &ret));  // it was cancelled
+  t->hasHandle = 0;
+  EXPECT_EQ(PTHREAD_CANCELED, ret);
+  EXPECT_FALSE(onIdList(t));
+  reapWithdrawn(t);
+}
+
+TEST(MtThread, StopAllToleratesOneUnstoppableHoldLThread) {
+  thrtest::mainReady();
+  reset();
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* hold = make(&list, holdBody, "HoldLThread");
+  klpThread* done = make(&list, endBody, "Done");
+  ASSERT_TRUE(waitState(hold, KLP_THREAD_REST));
+  ASSERT_TRUE(waitState(done, KLP_THREAD_STOP));
+  EXPECT_EQ(0, stopAll(&list));
+  EXPECT_EQ(1, list.count);  // only the withdrawn HoldLThread is left
+  EXPECT_EQ(&hold->ole, list.olHead);
+  g_release = true;
+  reapWithdrawn(hold);
+}
+
+TEST(MtThread, StopAllFailsForAnyOtherUnstoppableThread) {
+  thrtest::mainReady();
+  reset();
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* other = make(&list, holdBody, "HoldOn");
+  ASSERT_TRUE(waitState(other, KLP_THREAD_REST));
+  EXPECT_EQ(KLP_RC_RECOVERED, stopAll(&list));
+  EXPECT_EQ(1, other->ole.withdrawn);
+  g_release = true;
+  reapWithdrawn(other);
+}
+
+TEST(MtThread, SupervisionOfEmptyAndMissingLists) {
+  thrtest::mainReady();
+  OrdList list("Threads");
+  int highest = 0;
+  EXPECT_EQ(0, supervise(nullptr, 0, &highest));
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));
+}
+
+TEST(MtThread, SupervisionSeesCriticalAndNonCriticalLiveThreads) {
+  thrtest::mainReady();
+  reset();
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* plain = make(&list, workBody, "Plain");
+  ASSERT_TRUE(waitState(plain, KLP_THREAD_RUN));
+  int highest = 0;
+  EXPECT_EQ(KLP_RC_NO_CRITICAL, supervise(&list, 0, &highest));
+  klpThread* crit = make(&list, workBody, "Critical", 1, 1);
+  ASSERT_TRUE(waitState(crit, KLP_THREAD_RUN));
+  EXPECT_EQ(0, supervise(&list, 0, &highest));
+  g_release = true;
+  ASSERT_TRUE(waitState(plain, KLP_THREAD_STOP));
+  ASSERT_TRUE(waitState(crit, KLP_THREAD_STOP));
+  // Both ended with 0 (2011) and restart set: removed, nothing alive.
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));
+  EXPECT_EQ(0, list.count);
+}
+
+TEST(MtThread, SupervisionReportsAFinishedThreadWhileOthersLive) {
+  thrtest::mainReady();
+  reset();
+  g_endWith = 9;
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* crit = make(&list, workBody, "Critical", 1, 1);
+  klpThread* gone = make(&list, endBody, "Gone", 0);
+  ASSERT_TRUE(waitState(crit, KLP_THREAD_RUN));
+  ASSERT_TRUE(waitState(gone, KLP_THREAD_STOP));
+  int highest = 3;
+  EXPECT_EQ(KLP_RC_THREAD_FINISHED, supervise(&list, 0, &highest));
+  EXPECT_EQ(9, highest);
+  EXPECT_EQ(1, list.count);
+  g_release = true;
+  ASSERT_TRUE(waitState(crit, KLP_THREAD_STOP));
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(crit));
+}
+
+TEST(MtThread, SupervisionKeepsA2001ThreadOnePassThenRemovesIt) {
+  thrtest::mainReady();
+  reset();
+  g_endWith = KLP_RC_TERMINATED;
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* t = make(&list, endBody, "Terminated");
+  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
+  int highest = 0;
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));
+  EXPECT_EQ(1, list.count);
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));
+  EXPECT_EQ(0, list.count);
+  EXPECT_EQ(0, highest);
+  EXPECT_EQ(1, g_runs.load());  // never started again
+}
+
+TEST(MtThread, SupervisionRestartsAThreadThatEndedWithAnotherCode) {
+  thrtest::mainReady();
+  reset();
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* t = make(&list, restartBody, "Restarted");
+  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
+  ASSERT_EQ(9, t->getEndCode());
+  int highest = 0;
+  EXPECT_EQ(KLP_RC_NO_CRITICAL, supervise(&list, 0, &highest));  // restarted: alive
+  ASSERT_TRUE(thrtest::waitFor([&] { return g_runs == 2 && t->getState() == KLP_THREAD_STOP; }));
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));  // 2011: removed
+  EXPECT_EQ(0, list.count);
+}
+
+TEST(MtThread, SupervisionPassesOnAShutdownCode) {
+  thrtest::mainReady();
+  reset();
+  g_endWith = KLP_RC_SHUTDOWN;
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  klpThread* t = make(&list, endBody, "Shutdown", 0);
+  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
+  int highest = 0;
+  EXPECT_EQ(KLP_RC_SHUTDOWN, supervise(&list, 0, &highest));
+  EXPECT_EQ(KLP_RC_SHUTDOWN, highest);
+  EXPECT_EQ(0, list.count);
+}
+
+TEST(MtThread, SleepingShowsRestingUnlessWaitingForDb) {
+  thrtest::mainReady();
+  klpThread* m = klpMainThread();
+  std::atomic<int> seen{0};
+  std::atomic<bool> sleeping{false};
+  std::thread watcher([&] {
+    thrtest::waitFor([&] { return sleeping.load(); });
+    thrtest::waitFor([&] { return m->getState() == KLP_THREAD_REST; }, 1000);
+    seen = m->getState();
+  });
+  sleeping = true;
+  klpRestingSleep(300);
+  watcher.join();
+  EXPECT_EQ(KLP_THREAD_REST, seen.load());
+  EXPECT_EQ(KLP_THREAD_RUN, m->getState());  // restored
+  m->setState(KLP_THREAD_DBWAIT);
+  klpRestingSleep(10);
+  EXPECT_EQ(KLP_THREAD_DBWAIT, m->getState());
+  m->setState(KLP_THREAD_RUN);
+}
+
+TEST(KlpThread, ConnectionLookupCreatesOnlyForKindO) {
+  klpThread t;
+  klpDbConn* o = t.getThrdCtlConn('O', "ORCL", 1208);
+  ASSERT_NE(nullptr, o);
+  EXPECT_EQ(o, t.getThrdCtlConn('O', "ORCL", 1208));
+  EXPECT_NE(o, t.getThrdCtlConn('O', "ORCL", 819));  // another code page
+  EXPECT_EQ(nullptr, t.getThrdCtlConn('D', "SAMPLE", 1208));
+  klpDbConn* d = t.connect('D', "SAMPLE", 1208);
+  EXPECT_EQ(d, t.getThrdCtlConn('D', "SAMPLE", 1208));
+  EXPECT_EQ(0, t.interruptDbWork());  // the current connection
+  EXPECT_EQ(1, d->interrupts);
+  t.detachCurrentConn();
+  EXPECT_EQ(0, t.interruptDbWork());  // none: the database context
+  EXPECT_EQ(1, t.dbCtx.interrupts);
+  t.cleanupConns();  // the sanitizer build reports a leak if one is left
+  EXPECT_EQ(nullptr, t.conns);
+}
+
+}  // namespace
