@@ -306,12 +306,12 @@ class RestingState {
  public:
   RestingState() : t_(currentThread()) {
     if (t_) {
-      saved_ = t_->state;
-      if (saved_ != KLP_THREAD_DBWAIT) t_->state = KLP_THREAD_REST;
+      saved_ = t_->getState();
+      if (saved_ != KLP_THREAD_DBWAIT) t_->setState(KLP_THREAD_REST);
     }
   }
   ~RestingState() {
-    if (t_) t_->state = saved_;
+    if (t_) t_->setState(saved_);
   }
   RestingState(const RestingState&) = delete;
   RestingState& operator=(const RestingState&) = delete;
@@ -694,7 +694,7 @@ void klpEnsureMainThread() {
   // A caller of the control interface may never have run a prologue; the
   // thread list and the recovery manager must know the calling thread.
   klpThread* main = klpMainThread();
-  if (main && main->state == KLP_THREAD_EXIST) klpThread::prologue(main);
+  if (main && main->getState() == KLP_THREAD_EXIST) klpThread::prologue(main);
 }
 
 static bool releaseOk(const klpReleaseInfo* r) {

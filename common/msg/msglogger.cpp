@@ -200,6 +200,7 @@ void msgLogger::stopLogging() {
       msgFreeRecord(r);
     }
   }
+  std::lock_guard<std::recursive_mutex> hold(logFileLock_);
   if (logStream_ != nullptr) {
     fclose(logStream_);
     logStream_ = nullptr;
@@ -230,6 +231,7 @@ const char* msgLogger::setMsgTableName(const char* schema, const char* table) {
 }
 
 void msgLogger::clearLog() {
+  std::lock_guard<std::recursive_mutex> hold(logFileLock_);
   if (logStream_ != nullptr) {
     fclose(logStream_);
     logStream_ = nullptr;
@@ -302,6 +304,7 @@ void msgLogger::writeLogFile(logMsg* r) {
   if (r->doneMask & MSG_DEST_LOGFILE) return;
   r->doneMask |= MSG_DEST_LOGFILE;
   if (logFileName_[0] == '\0') return;
+  std::lock_guard<std::recursive_mutex> hold(logFileLock_);
   if (logStream_ == nullptr) openLog();
   if (logStream_ == nullptr) return;
   const char* text = r->text != nullptr ? r->text : "";

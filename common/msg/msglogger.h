@@ -7,6 +7,7 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <mutex>
 
 #include "common/msg/klplog.h"
 #include "common/thread/ordlist.h"
@@ -227,6 +228,9 @@ class msgLogger {
   uint16_t routingWords_[4];  // 'I', 'W', 'E', other
   char openMode_[4];
   FILE* logStream_ = nullptr;
+  // Threads of a server log at once: one line's open, write and close must
+  // not interleave with another's on the shared stream pointer.
+  std::recursive_mutex logFileLock_;
   int32_t catalogFailureReported_ = 0;
   int32_t openFailureReported_ = 0;
   char logFileName_[MSG_LOG_FILE_NAME_MAX + 1];
