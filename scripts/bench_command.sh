@@ -1,0 +1,79 @@
+#!/usr/bin/env bash
+# Command round-trip time: runs `klpkccmd CAPTURE_SERVER=BENCH STATUS` against
+# an idle sample server N times and /bin/true N times in the same run
+# (alternating, so both see the same machine load), and prints the median
+# whole-process time of each and their ratio. The target is a ratio within 2.
+#
+#   scripts/bench_command.sh BUILD_DIR [N]      (N defaults to 200)
+set -euo pipefail
+
+BUILD_DIR=${1:-build}
+RUNS=${2:-200}
+BIN="$BUILD_DIR/bin"
+for p in klpkcap klpkccmd; do
+  if [[ ! -x "$BIN/$p" ]]; then
+    echo "bench: $BIN/$p not found; build first" >&2
+    exit 2
+  fi
+done
+
+SERVER=BENCH
+DIR=$(mktemp -d "${TMPDIR:-/tmp}/klpbench.XXXXXX")
+export TMPDIR="$DIR/"
+SERVER_PID=""
+
+cleanup() {
+  trap - EXIT INT TERM
+  if [[ -n "$SERVER_PID" ]] && kill -0 "$SERVER_PID" 2>/dev/null; then
+    kill -TERM "$SERVER_PID" 2>/dev/null || true
+    for i in $(seq 1 150); do
+      kill -0 "$SERVER_PID" 2>/dev/null || break
+      sleep 0.1
+    done
+    kill -KILL "$SERVER_PID" 2>/dev/null || true
+    wait "$SERVER_PID" 2>/dev/null || true
+  fi
+  rm -rf "$DIR"
+}
+trap cleanup EXIT
+trap 'exit 130' INT TERM
+
+"$BIN/klpkcap" "CAPTURE_SERVER=$SERVER" "CAPTURE_PATH=$DIR/" >"$DIR/klpkcap.out" 2>&1 &
+SERVER_PID=$!
+for i in $(seq 1 100); do
+  grep -q KLP0594I "$DIR/$SERVER.KLP.KCAP.log" 2>/dev/null && break
+  sleep 0.1
+done
+
+python3 - "$BIN/klpkccmd" "$SERVER" "$RUNS" <<'EOF'
+import os, statistics, subprocess, sys, time
+
+cmd = [sys.argv[1], "CAPTURE_SERVER=" + sys.argv[2], "STATUS"]
+true = ["/bin/true"]
+runs = int(sys.argv[3])
+
+def once(argv):
+    start = time.perf_counter()
+    rc = subprocess.call(argv, stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+    return time.perf_counter() - start, rc
+
+# One of each first, unmeasured, so that both come from the page cache.
+once(cmd)
+once(true)
+t_cmd, t_true, failed = [], [], 0
+for _ in range(runs):
+    t, rc = once(cmd)
+    t_cmd.append(t)
+    failed += rc != 0
+    t_true.append(once(true)[0])
+
+m_cmd = statistics.median(t_cmd) * 1000
+m_true = statistics.median(t_true) * 1000
+print(f"klpkccmd STATUS : median {m_cmd:8.3f} ms over {runs} runs")
+print(f"/bin/true       : median {m_true:8.3f} ms over {runs} runs")
+print(f"ratio           : {m_cmd / m_true:8.2f} (target: within 2)")
+if failed:
+    print(f"klpkccmd failed {failed} of {runs} times: the times above do not measure a command",
+          file=sys.stderr)
+    sys.exit(1)
+EOF

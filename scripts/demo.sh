@@ -1,0 +1,120 @@
+#!/usr/bin/env bash
+# Demonstration: starts the sample K Capture server under a private TMPDIR,
+# commands it with klpkccmd (STATUS, STATUS SHOW DETAILS, QRYPARMS, CHGPARMS,
+# QRYPARMS again, STOP), waits for it to end and shows the end of its log.
+# Leaves no process, queue or file behind, also when interrupted.
+#
+#   scripts/demo.sh BUILD_DIR      (e.g. scripts/demo.sh build)
+set -euo pipefail
+
+BUILD_DIR=${1:-build}
+BIN="$BUILD_DIR/bin"
+for p in klpkcap klpkccmd; do
+  if [[ ! -x "$BIN/$p" ]]; then
+    echo "demo: $BIN/$p not found; build first (make build)" >&2
+    exit 2
+  fi
+done
+
+SERVER=DEMO
+DIR=$(mktemp -d "${TMPDIR:-/tmp}/klpdemo.XXXXXX")
+export TMPDIR="$DIR/"
+LOG="$DIR/$SERVER.KLP.KCAP.log"
+SERVER_QUEUE="$DIR/$SERVER.KLP.KCAP.IPC"
+SERVER_PID=""
+CLIENT_PID=""
+
+# Removes the POSIX message queue of a path (named as docs/ipc-names.md says),
+# for the case where a process had to be killed before it could do so.
+unlink_queue() {
+  python3 - "$1" <<'EOF' 2>/dev/null || true
+import ctypes, ctypes.util, sys
+h = 0xcbf29ce484222325
+for b in sys.argv[1].encode():
+    h = ((h ^ b) * 0x100000001b3) & 0xFFFFFFFFFFFFFFFF
+rt = ctypes.CDLL(ctypes.util.find_library("rt") or "librt.so.1")
+rt.mq_unlink(("/klpq.%016x" % h).encode())
+EOF
+}
+
+# Ends a process we started: politely first, then for sure.
+end_process() {
+  local pid=$1 i
+  [[ -n "$pid" ]] || return 0
+  kill -0 "$pid" 2>/dev/null || return 0
+  kill -TERM "$pid" 2>/dev/null || true
+  for i in $(seq 1 150); do
+    kill -0 "$pid" 2>/dev/null || break
+    sleep 0.1
+  done
+  if kill -0 "$pid" 2>/dev/null; then kill -KILL "$pid" 2>/dev/null || true; fi
+  wait "$pid" 2>/dev/null || true
+}
+
+cleanup() {
+  trap - EXIT INT TERM
+  end_process "$CLIENT_PID"
+  [[ -n "$CLIENT_PID" ]] && unlink_queue "$SERVER_QUEUE.CMD$CLIENT_PID"
+  end_process "$SERVER_PID"
+  unlink_queue "$SERVER_QUEUE"
+  rm -rf "$DIR"
+}
+trap cleanup EXIT
+trap 'echo; echo "demo: interrupted"; exit 130' INT TERM
+
+echo "IPC directory: $TMPDIR"
+echo "\$ klpkcap CAPTURE_SERVER=$SERVER CAPTURE_PATH=$DIR/ &"
+"$BIN/klpkcap" "CAPTURE_SERVER=$SERVER" "CAPTURE_PATH=$DIR/" >"$DIR/klpkcap.out" 2>&1 &
+SERVER_PID=$!
+
+# The server is ready once its log says that it created its queue.
+for i in $(seq 1 100); do
+  grep -q KLP0594I "$LOG" 2>/dev/null && break
+  if ! kill -0 "$SERVER_PID" 2>/dev/null; then
+    echo "demo: klpkcap did not start:" >&2
+    cat "$DIR/klpkcap.out" >&2
+    exit 1
+  fi
+  sleep 0.1
+done
+
+failures=0
+command() {
+  echo
+  echo "\$ klpkccmd CAPTURE_SERVER=$SERVER $*"
+  "$BIN/klpkccmd" "CAPTURE_SERVER=$SERVER" "$@" &
+  CLIENT_PID=$!
+  local rc=0
+  wait "$CLIENT_PID" || rc=$?
+  CLIENT_PID=""
+  echo "(exit code $rc)"
+  [[ $rc -eq 0 ]] || failures=$((failures + 1))
+}
+
+command STATUS
+command STATUS SHOW DETAILS
+command QRYPARMS
+command CHGPARMS COMMIT_INTERVAL=1000
+command QRYPARMS
+command STOP
+
+echo
+rc=0
+for i in $(seq 1 300); do
+  kill -0 "$SERVER_PID" 2>/dev/null || break
+  sleep 0.1
+done
+if kill -0 "$SERVER_PID" 2>/dev/null; then
+  echo "klpkcap did not stop; ending it"
+  end_process "$SERVER_PID"
+  failures=$((failures + 1))
+else
+  wait "$SERVER_PID" || rc=$?
+  echo "klpkcap ended with exit code $rc"
+fi
+SERVER_PID=""
+
+echo
+echo "--- the last lines of $LOG"
+tail -n 12 "$LOG"
+exit $((failures > 0 ? 1 : 0))

@@ -1,0 +1,312 @@
+// The command engine inside this process: requests handed to its per-message
+// step and to the loop itself, with thread objects that run no OS thread, so
+// that what each thread received can be looked at directly.
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "common/env/klpenv.h"
+#include "common/ipc/cmdsengine.h"
+#include "common/ipc/ipcmsg.h"
+#include "common/msg/klplog.h"
+#include "common/msg/msglogger.h"
+#include "common/parms/klpparm.h"
+#include "common/thread/klpthread.h"
+#include "common/thread/ordlist.h"
+#include "tests/e2e/e2e_support.h"
+#include "xqpub/xqpubparms.h"
+
+namespace {
+
+constexpr int kStop = 14, kStatus = 15, kChgparms = 20, kPrune = 22, kReinitq = 23;
+constexpr int kTerm = 5, kCommitInterval = 30;
+
+int g_dbRc = 0;
+int testDbCheck(char* text, size_t len) {
+  snprintf(text, len, "%s", g_dbRc == 0 ? "AVAILABLE" : "DOWN");
+  return g_dbRc;
+}
+
+class Engine : public ::testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    if (klpGetProcessLogger() == nullptr) {
+      msgLogger* logger = createMsgLoggerU(5, 0);
+      logger->loadBuiltinMsgs(builtinMsgTable);
+      klpSetProcessLogger(logger);
+    }
+    if (klpMainThread()->getState() == KLP_THREAD_EXIST) klpThread::prologue(klpMainThread());
+  }
+
+  void SetUp() override {
+    dir_ = std::make_unique<klptest::TmpDir>();
+    ParmEntry table[XQPUB_PARM_COUNT];
+    buildXqpubParmTable(table);
+    int rc = 0;
+    parms_ = std::make_unique<xqpubParms>(table, XQPUB_PARM_COUNT, &rc);
+    ASSERT_EQ(rc, 0);
+    parms_->setParm(0, "ENG", PARM_SRC_COMMANDLINE);
+    klpSetCurrentParms(parms_.get());
+    klpEnv* env = klpGetEnv();
+    klpEnvClear(env);
+    ASSERT_EQ(setEnvNamePrefix(env, "KCAP"), 0);
+    g_dbRc = 0;
+    cmdsSetDbStatusCheck(testDbCheck);
+    threads_.makeShared("EngThreads", 1);
+    cmdsInitState(&st_, CMDS_MODE_NORMAL, &stopFlag_);
+
+    replyPath_ = e2e::replyQueuePath(*dir_, "ENG", getpid());
+    HSVResID id;
+    ASSERT_EQ(hsvIPCGetQueResID(replyPath_.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+    ASSERT_EQ(reply_.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK);
+  }
+
+  void TearDown() override {
+    while (OrdListElement* e = threads_.getHead()) {
+      klpThread* t = klpThreadOf(e);
+      if (t->cmdList != nullptr) {
+        t->cmdList->delList();
+        delete t->cmdList;
+      }
+      delete t;
+    }
+    reply_.destroy();
+    EXPECT_FALSE(klptest::queueExists(replyPath_));
+    delEnvIpcQRcvHdl(klpGetEnv());
+    klpEnvClear(klpGetEnv());
+    cmdsSetDbStatusCheck(nullptr);
+    klpSetCurrentParms(nullptr);
+    parms_.reset();
+    dir_.reset();
+  }
+
+  // A thread object with its own command list, on the engine's list, that
+  // runs nothing.
+  klpThread* addThread(const char* name, int32_t state, std::vector<int> interests = {}) {
+    klpThread* t = new klpThread();
+    t->setName(name);
+    t->setState(state);
+    t->critical = 1;
+    for (int code : {14, 18, 19}) setCmdInterest(t, code, 1);
+    for (int code : interests) setCmdInterest(t, code, 1);
+    t->cmdList = new OrdList();
+    t->cmdList->makeShared(name, 1);
+    threads_.putTail(&t->ole);
+    return t;
+  }
+
+  int handle(const std::vector<char>& m) {
+    return cmdsHandleMessage(&st_, &threads_, m.data(), m.size());
+  }
+
+  bool receive(e2e::Reply* r, int timeoutMs = 2000) {
+    if (reply_.waitForMessage(timeoutMs) != ECF_OK) return false;
+    char buf[HSV_MAX_MSG_SIZE];
+    size_t got = 0;
+    if (reply_.get(buf, sizeof buf, &got, 100) != ECF_OK) return false;
+    memcpy(&r->header, buf, IPC_HEADER_SIZE);
+    r->raw.assign(buf, buf + got);
+    r->payload.assign(buf + IPC_HEADER_SIZE, buf + got);
+    return true;
+  }
+
+  static MsgQe* takeQe(klpThread* t) { return reinterpret_cast<MsgQe*>(t->cmdList->getHead()); }
+
+  std::unique_ptr<klptest::TmpDir> dir_;
+  std::unique_ptr<xqpubParms> parms_;
+  OrdList threads_;
+  cmdsState st_;
+  int32_t stopFlag_ = 0;
+  HSVHIPCQueue reply_;
+  std::string replyPath_;
+};
+
+TEST_F(Engine, StatusOfThreeThreadsIs136BytesInListOrder) {
+  addThread("First", KLP_THREAD_REST);
+  addThread("BehinderWorkerThread", KLP_THREAD_RUN);
+  addThread("Third", KLP_THREAD_DBWAIT);
+  ASSERT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
+  e2e::Reply r;
+  ASSERT_TRUE(receive(&r));
+  EXPECT_EQ(r.header.msgLength, 136);
+  EXPECT_EQ(r.raw.size(), 136u);
+  EXPECT_EQ(r.header.func, kStatus);
+  EXPECT_EQ(r.header.senderPid, getpid());
+  EXPECT_EQ(e2e::rd32(r.payload, 0), 0);
+  EXPECT_EQ(e2e::rd32(r.payload, 8), 3);
+  EXPECT_STREQ(r.payload.data() + 12, "First");
+  EXPECT_STREQ(r.payload.data() + 32, "BehinderWorker");
+  EXPECT_STREQ(r.payload.data() + 52, "Third");
+  EXPECT_EQ(e2e::rd32(r.payload, 12 + 16), KLP_THREAD_REST);
+  EXPECT_EQ(e2e::rd32(r.payload, 32 + 16), KLP_THREAD_RUN);
+  EXPECT_EQ(e2e::rd32(r.payload, 52 + 16), KLP_THREAD_DBWAIT);
+}
+
+TEST_F(Engine, OnlyInterestedThreadsReceiveAndARequestWithoutRequesterIsNotAnswered) {
+  klpThread* pruner = addThread("PruneThread", KLP_THREAD_REST, {kPrune});
+  klpThread* other = addThread("Other", KLP_THREAD_REST);
+  ASSERT_EQ(handle(e2e::RawClient::request(kPrune, 0, nullptr, 0)), 0);
+  EXPECT_EQ(pruner->cmdList->count, 1);
+  EXPECT_EQ(other->cmdList->count, 0);
+  MsgQe* qe = takeQe(pruner);
+  ASSERT_NE(qe, nullptr);
+  EXPECT_STREQ(qe->ole.eyeCatcher, "ITC:");
+  EXPECT_EQ(qe->QeFunc, kPrune);
+  EXPECT_EQ(qe->QeResponseId, 0);
+  deleteMsgQe(qe);
+  e2e::Reply r;
+  EXPECT_FALSE(receive(&r, 300));
+
+  // With a requester the request is answered after the thread got it.
+  ASSERT_EQ(handle(e2e::RawClient::request(kPrune, 0, nullptr)), 0);
+  EXPECT_EQ(pruner->cmdList->count, 1);
+  ASSERT_TRUE(receive(&r));
+  EXPECT_EQ(r.header.func, kPrune);
+  EXPECT_EQ(r.header.msgLength, 44);
+}
+
+TEST_F(Engine, APayloadLongerThanTheElementHoldsIsCutAndEnded) {
+  klpThread* admin = addThread("AdminThread", KLP_THREAD_REST, {kReinitq});
+  auto m = e2e::RawClient::request(kReinitq, 0, nullptr);
+  m.resize(4096, 'Z');  // no NUL anywhere
+  int32_t len = 4096;
+  memcpy(m.data() + 12, &len, 4);
+  ASSERT_EQ(handle(m), 0);
+  MsgQe* qe = takeQe(admin);
+  ASSERT_NE(qe, nullptr);
+  EXPECT_EQ(strlen(qe->QeString), 1039u);
+  EXPECT_EQ(qe->QeString[1038], 'Z');
+  deleteMsgQe(qe);
+}
+
+TEST_F(Engine, MessagesThatDisagreeWithWhatWasReceivedCountAsFailedGets) {
+  klpThread* t = addThread("AdminThread", KLP_THREAD_REST, {kReinitq});
+  auto m = e2e::RawClient::request(kReinitq, 0, nullptr);
+  int32_t claim = 4096;  // more than the 44 bytes that came
+  memcpy(m.data() + 12, &claim, 4);
+  ASSERT_EQ(handle(m), 0);
+  EXPECT_EQ(st_.getFailed, 1);
+  std::vector<char> shortOne(m.begin(), m.begin() + 43);
+  ASSERT_EQ(handle(shortOne), 0);
+  EXPECT_EQ(cmdsHandleMessage(&st_, &threads_, nullptr, 0), 0);
+  EXPECT_EQ(t->cmdList->count, 0);
+  e2e::Reply r;
+  EXPECT_FALSE(receive(&r, 200));
+  // The next good message clears the state.
+  ASSERT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
+  EXPECT_EQ(st_.getFailed, 0);
+  EXPECT_TRUE(receive(&r));
+}
+
+TEST_F(Engine, ChgparmsWithMaybeLeavesTheFlagButEchoesTheRequest) {
+  std::string maybe = "MAYBE";
+  auto m = e2e::RawClient::request(kChgparms, kTerm, &maybe);
+  ASSERT_EQ(handle(m), 0);
+  e2e::Reply r;
+  ASSERT_TRUE(receive(&r));
+  ASSERT_EQ(r.raw.size(), m.size());
+  EXPECT_EQ(r.header.subFunc, kTerm);
+  EXPECT_STREQ(r.payload.data(), "MAYBE");
+  EXPECT_EQ(parms_->getParmBool(kTerm), 0);
+  EXPECT_EQ(parms_->getParmSource(kTerm), PARM_SRC_DEFAULT);
+
+  std::string value = "750";
+  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, kCommitInterval, &value)), 0);
+  ASSERT_TRUE(receive(&r));
+  EXPECT_EQ(parms_->getParmInt(kCommitInterval), 750);
+  EXPECT_EQ(parms_->getParmSource(kCommitInterval), PARM_SRC_CHGPARMS);
+  // Out of the parameter's range: refused by the registry, still echoed.
+  value = "50";
+  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, kCommitInterval, &value)), 0);
+  ASSERT_TRUE(receive(&r));
+  EXPECT_EQ(parms_->getParmInt(kCommitInterval), 750);
+  // An index outside the registry changes nothing.
+  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, 4000, &value)), 0);
+  ASSERT_TRUE(receive(&r));
+  EXPECT_EQ(r.header.subFunc, 4000);
+}
+
+TEST_F(Engine, StopIsAnsweredOnceAndTheStopSequenceSkipsStoppedThreads) {
+  klpThread* a = addThread("A", KLP_THREAD_REST);
+  klpThread* b = addThread("B", KLP_THREAD_STOP);
+  ASSERT_EQ(handle(e2e::RawClient::request(kStop, 0, nullptr)), 0);
+  EXPECT_EQ(stopFlag_, 1);
+  EXPECT_EQ(st_.stopping, 1);
+  e2e::Reply r;
+  ASSERT_TRUE(receive(&r));
+  EXPECT_EQ(r.header.func, kStop);
+  EXPECT_EQ(a->cmdList->count, 1);  // the request itself, by interest
+  EXPECT_EQ(b->cmdList->count, 1);
+  // Already stopping: the sequence sends nothing more.
+  EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
+  EXPECT_EQ(a->cmdList->count, 1);
+
+  cmdsState fresh;
+  cmdsInitState(&fresh, CMDS_MODE_NORMAL, nullptr);
+  a->cmdList->delList();
+  b->cmdList->delList();
+  EXPECT_EQ(cmdsStartStop(&fresh, &threads_), 0);
+  EXPECT_EQ(a->cmdList->count, 1);
+  EXPECT_EQ(b->cmdList->count, 0);  // already stopped
+  MsgQe* qe = takeQe(a);
+  ASSERT_NE(qe, nullptr);
+  EXPECT_EQ(qe->QeFunc, kStop);
+  EXPECT_EQ(qe->QeResponseId, 0);
+  deleteMsgQe(qe);
+}
+
+TEST_F(Engine, WithoutAServerQueueTheEngineReports804) {
+  int32_t flag = 0;
+  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_NORMAL, &flag), 804);
+}
+
+TEST_F(Engine, OnePassKeepsTheQueueAndAnUnavailableDatabaseGives929) {
+  klpEnv* env = klpGetEnv();
+  ASSERT_EQ(setEnvIpcQRcvHdl(env), 0);
+  std::string queue = e2e::serverQueuePath(*dir_, "ENG");
+  ASSERT_TRUE(klptest::queueExists(queue));
+  addThread("A", KLP_THREAD_REST);
+  int32_t flag = 0;
+  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_ONE_PASS, &flag), 0);
+  EXPECT_TRUE(klptest::queueExists(queue));
+  g_dbRc = 929;
+  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_ONE_PASS, &flag), 929);
+  EXPECT_TRUE(klptest::queueExists(queue));
+  delEnvIpcQRcvHdl(env);
+  EXPECT_FALSE(klptest::queueExists(queue));
+}
+
+TEST_F(Engine, ThreadsThatDoNotStopEndTheLoopAfterTheGraceAndTheQueueGoes) {
+  klpEnv* env = klpGetEnv();
+  ASSERT_EQ(setEnvIpcQRcvHdl(env), 0);
+  std::string queue = e2e::serverQueuePath(*dir_, "ENG");
+  klpThread* stubborn = addThread("Stubborn", KLP_THREAD_REST);
+  {
+    HSVResID id;
+    HSVHIPCQueue server;
+    ASSERT_EQ(hsvIPCGetQueResID(queue.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+    ASSERT_EQ(server.attach(id), ECF_OK);
+    auto m = e2e::RawClient::request(kStop, 0, nullptr);
+    ASSERT_EQ(server.put(m.data(), m.size()), ECF_OK);
+    server.detach();
+  }
+  auto start = std::chrono::steady_clock::now();
+  int32_t flag = 0;
+  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_NORMAL, &flag), 0);
+  auto secs = std::chrono::duration_cast<std::chrono::seconds>(std::chrono::steady_clock::now() -
+                                                               start)
+                  .count();
+  EXPECT_EQ(flag, 1);
+  EXPECT_GE(secs, 8);
+  e2e::Reply r;
+  ASSERT_TRUE(receive(&r));
+  EXPECT_EQ(r.header.func, kStop);
+  EXPECT_EQ(stubborn->cmdList->count, 1);
+  EXPECT_FALSE(klptest::queueExists(queue));
+}
+
+}  // namespace
