@@ -329,7 +329,8 @@ struct HeldQueue {
   recoveryRes* res = nullptr;
 };
 
-void releaseHeld(HeldQueue* held, bool destroy) {
+// Releases and forgets the queue (held becomes null).
+void releaseHeld(HeldQueue*& held, bool destroy) {
   if (!held) return;
   endRcvyRes(held->res);
   held->res = nullptr;
@@ -342,6 +343,7 @@ void releaseHeld(HeldQueue* held, bool destroy) {
     held->queue = nullptr;
   }
   delete held;
+  held = nullptr;
 }
 
 const char* const kOrigin = "cmdAPIFunc";
@@ -452,6 +454,30 @@ hsvRC createReplyQueue(HSVHIPCQueue* q, const HSVResID& id) {
   return q->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION);
 }
 
+// What one exchange holds. It lives on the heap because a trap jumps past
+// the exchange's frame: the queue actions registered later run first, then
+// this state's own resource frees what is left.
+struct CallState {
+  HeldQueue* server = nullptr;
+  HeldQueue* reply = nullptr;
+  IpcGather gather;
+  char msg[HSV_MAX_MSG_SIZE];
+  recoveryRes* res = nullptr;
+};
+
+void freeCallState(uint64_t arg) {
+  CallState* st = reinterpret_cast<CallState*>(arg);
+  for (HeldQueue* h : {st->server, st->reply}) {
+    if (!h) continue;
+    delete h->queue;  // null when its own action already ran
+    delete h;
+  }
+  delete st;
+}
+
+int exchange(CallState* st, const char* path, const char* serverName, int func,
+             const char* payload, char** replyBuf, klpMsgCapture* cap);
+
 }  // namespace
 
 int cmdAPIFunc(const char* serverName, int func, const char* payload, char** replyBuf,
@@ -467,11 +493,26 @@ int cmdAPIFunc(const char* serverName, int func, const char* payload, char** rep
     return KLP_RC_ATTACH_FAILED;
   }
 
+  CallState* st = new (std::nothrow) CallState;
+  if (!st) return KLP_RC_MSG_NO_MEMORY;
+  st->res = addRcvyRes(freeCallState, reinterpret_cast<uint64_t>(st));
+  int rc = exchange(st, path, serverName, func, payload, replyBuf, cap);
+  endRcvyRes(st->res);
+  delete st;
+  return rc;
+}
+
+namespace {
+
+int exchange(CallState* st, const char* path, const char* serverName, int func,
+             const char* payload, char** replyBuf, klpMsgCapture* cap) {
   // 1-3: the server queue.
-  HeldQueue* server = new (std::nothrow) HeldQueue;
+  HeldQueue*& server = st->server;
+  server = new (std::nothrow) HeldQueue;
   if (server) server->queue = new (std::nothrow) HSVHIPCQueue;
   if (!server || !server->queue) {
     delete server;
+    server = nullptr;
     return KLP_RC_MSG_NO_MEMORY;
   }
   char serverId[160];
@@ -487,12 +528,14 @@ int cmdAPIFunc(const char* serverName, int func, const char* payload, char** rep
   server->res = addRcvyRes(erHSVIPCQdetach, reinterpret_cast<uint64_t>(&server->queue));
 
   // 4: the reply queue.
-  char replyPath[sizeof(path) + 16];
+  char replyPath[KLP_ENV_PATH_MAX + KLP_UNIQUE_NAME_SIZE + 48];
   std::snprintf(replyPath, sizeof(replyPath), "%s.CMD%d", path, hsvProcessID());
-  HeldQueue* reply = new (std::nothrow) HeldQueue;
+  HeldQueue*& reply = st->reply;
+  reply = new (std::nothrow) HeldQueue;
   if (reply) reply->queue = new (std::nothrow) HSVHIPCQueue;
   if (!reply || !reply->queue) {
     delete reply;
+    reply = nullptr;
     releaseHeld(server, false);
     return KLP_RC_MSG_NO_MEMORY;
   }
@@ -511,6 +554,7 @@ int cmdAPIFunc(const char* serverName, int func, const char* payload, char** rep
     issue(cap, 507, kOrigin, KLP_DEST_SEVERITY);
     delete reply->queue;
     delete reply;
+    reply = nullptr;
     releaseHeld(server, false);
     return KLP_RC_QUEUE_UNAVAILABLE;
   }
@@ -535,13 +579,9 @@ int cmdAPIFunc(const char* serverName, int func, const char* payload, char** rep
   }
 
   // 6-7: wait for the replies. Each pause ends as soon as a message arrives.
-  IpcGather gather;
+  IpcGather& gather = st->gather;
   int emptyPolls = 0;
-  char* msgBuf = nullptr;
-  if (rc == 0 && outstanding > 0) {
-    msgBuf = static_cast<char*>(std::malloc(HSV_MAX_MSG_SIZE));
-    if (!msgBuf) rc = KLP_RC_MSG_NO_MEMORY;
-  }
+  char* msgBuf = st->msg;
   while (rc == 0 && outstanding > 0) {
     if (!reply->queue->hasMessage()) {
       if (++emptyPolls >= KLP_CMD_POLLS) {
@@ -609,7 +649,6 @@ int cmdAPIFunc(const char* serverName, int func, const char* payload, char** rep
       std::free(one);
     }
   }
-  std::free(msgBuf);
   if (rc == 0 && replyBuf) *replyBuf = gather.release();
 
   // 8: clean up.
@@ -617,6 +656,8 @@ int cmdAPIFunc(const char* serverName, int func, const char* payload, char** rep
   releaseHeld(reply, true);
   return rc;
 }
+
+}  // namespace
 
 int KLPResponseFunc(int32_t requesterPid, IpcMsg* replyMsg) {
   static const char* const origin = "KLPResponseFunc";
