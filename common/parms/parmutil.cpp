@@ -47,13 +47,15 @@ int parseDecimal(const char* text, int32_t* value) {
 
 namespace {
 
-// Switches the calling thread to the user's default locale for its lifetime;
-// the thread's previous locale comes back on destruction.
+// Switches the calling thread to the user's character classification for
+// its lifetime; the thread's previous locale comes back on destruction.
+// Only LC_CTYPE matters here, and loading the other categories costs a
+// dozen file opens at every start of the command program.
 class UserLocale {
  public:
   UserLocale() {
-    loc_ = newlocale(LC_ALL_MASK, "", static_cast<locale_t>(0));
-    if (!loc_) loc_ = newlocale(LC_ALL_MASK, "C", static_cast<locale_t>(0));
+    loc_ = newlocale(LC_CTYPE_MASK, "", static_cast<locale_t>(0));
+    if (!loc_) loc_ = newlocale(LC_CTYPE_MASK, "C", static_cast<locale_t>(0));
     if (loc_) old_ = uselocale(loc_);
   }
   ~UserLocale() {
@@ -87,8 +89,19 @@ bool schemaChars(const Ch* v, size_t n, Ch quote, IsOk ok, Up up, std::basic_str
 
 bool applySchemaRule(const char* value, std::string* out) {
   if (!value) value = "";
-  UserLocale scope;
   size_t len = strlen(value);
+  // Plain ASCII classifies and upper-cases alike in every locale: no need
+  // to load the user's.
+  bool ascii = true;
+  for (size_t i = 0; i < len && ascii; ++i) ascii = static_cast<unsigned char>(value[i]) < 0x80;
+  if (ascii) {
+    auto ok = [](char c) {
+      return (c >= '0' && c <= '9') || (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || c == '_';
+    };
+    auto up = [](char c) { return (c >= 'a' && c <= 'z') ? static_cast<char>(c - 'a' + 'A') : c; };
+    return schemaChars<char>(value, len, '"', ok, up, out);
+  }
+  UserLocale scope;
   mbstate_t st{};
   const char* src = value;
   size_t wlen = mbsrtowcs(nullptr, &src, 0, &st);

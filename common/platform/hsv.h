@@ -217,6 +217,11 @@ class HSVSharedLib {
 constexpr int HSV_TRAPFILE_OPEN_OPTION = 20;
 constexpr int HSV_TRAPFILE_DUMP_OPTION = 507911;
 
+// The first stack walk loads the unwinder, which allocates: a process that
+// may dump from a signal handler calls this early, outside any handler.
+// Costs a shared-library load, so short-lived programs skip it.
+void hsvTrapFilePrepare();
+
 class HSVTrapFile {
  public:
   HSVTrapFile();

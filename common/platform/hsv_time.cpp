@@ -1,5 +1,4 @@
 // Clocks, sleeping, process and thread ids, one-time initialisation.
-#include <execinfo.h>
 #include <pthread.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -76,12 +75,9 @@ namespace {
 
 pthread_once_t gOnce = PTHREAD_ONCE_INIT;
 
-void initOnce() {
-  // The first backtrace() loads the unwinder, which allocates; doing it now
-  // keeps a later trap dump from a signal handler free of allocation.
-  void* frames[2];
-  (void)backtrace(frames, 2);
-}
+// Nothing needs process-wide set-up yet; the stack walker of trap dumps is
+// prepared separately (hsvTrapFilePrepare), only by programs that run threads.
+void initOnce() {}
 
 }  // namespace
 

@@ -3,6 +3,7 @@
 // built in a fixed buffer with its own formatters and written with write().
 #include <execinfo.h>
 #include <fcntl.h>
+#include <pthread.h>
 #include <signal.h>
 #include <ucontext.h>
 #include <unistd.h>
@@ -146,11 +147,20 @@ HSVTrapFile::HSVTrapFile() = default;
 
 HSVTrapFile::~HSVTrapFile() { close(); }
 
+namespace {
+pthread_once_t gTrapOnce = PTHREAD_ONCE_INIT;
+void prepareStackWalker() {
+  void* frames[2];
+  (void)backtrace(frames, 2);
+}
+}  // namespace
+
+void hsvTrapFilePrepare() { pthread_once(&gTrapOnce, prepareStackWalker); }
+
 hsvRC HSVTrapFile::open(const char* path, int /*option*/) {
   if (!path || !*path) return ECF_INVALID_ARGUMENT;
   close();
-  // Prepares the stack walker now, outside any signal handler.
-  hsvOneTimeOnly();
+  hsvTrapFilePrepare();
   int fd;
   do {
     fd = ::open(path, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);

@@ -329,6 +329,9 @@ int klpThread::start(klpThread* t, OrdList* list) {
   t->check("klpThread::start");
   if (t->hasHandle) return 0;
   trcEntry(kTrcComp, 1);  // "Start thread   "
+  // A program that runs threads may dump from a signal handler: load the
+  // stack walker now, outside any handler.
+  hsvTrapFilePrepare();
   pthread_attr_t attr;
   pthread_attr_init(&attr);
   pthread_attr_setstacksize(&attr, KLP_THREAD_STACK);
