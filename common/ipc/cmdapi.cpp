@@ -1,4 +1,5 @@
 #include "common/ipc/cmdapi.h"
+#include "common/ipc/kcapdetails.h"
 
 #include <cctype>
 #include <cstdio>
@@ -169,28 +170,29 @@ int klpStatusFromThreads(const char* payload, size_t len, char* out, size_t outL
 int klpStatusFromKcap(const char* payload, size_t len, char* out, size_t outLen,
                       int32_t* required) {
   *required = KLP_STATUS_FMT3_SIZE;
-  if (!payload || len < 70) return KLP_API_BAD_REPLY;
+  if (!payload || len < kcapDetails::kMinSize) return KLP_API_BAD_REPLY;
   if (!out || outLen < KLP_STATUS_FMT3_SIZE) return KLP_API_BUFFER_TOO_SMALL;
   klpStatusFmt3 s;
   std::memset(&s, 0, sizeof(s));
   s.format = 3;
-  s.upTime = rd32(payload, 12);
+  s.upTime = rd32(payload, kcapDetails::kUpTime);
   const char* text;
   size_t textLen;
-  if (prefixedText(payload, len, rd16(payload, 16), &text, &textLen))
+  if (prefixedText(payload, len, rd16(payload, kcapDetails::kLogFileRef), &text, &textLen))
     copyText(s.logFile, sizeof(s.logFile), text, textLen);
-  s.activeSubs = rd32(payload, 20);
-  copyText(s.currentLogTime, sizeof(s.currentLogTime), payload + 24, 26);
+  s.activeSubs = rd32(payload, kcapDetails::kActiveSubs);
+  copyText(s.currentLogTime, sizeof(s.currentLogTime), payload + kcapDetails::kLogTime,
+           kcapDetails::kLogTimeLen);
   // The log sequence number in text form, upper case.
-  uint8_t lsn[8];
-  std::memcpy(lsn, payload + 51, sizeof(lsn));
+  uint8_t lsn[kcapDetails::kLsnLen];
+  std::memcpy(lsn, payload + kcapDetails::kLsn, sizeof(lsn));
   char lsnText[50];
   if (formatLsn(lsnText, sizeof(lsnText), "", lsn, "") > 0) {
     for (char* c = lsnText; *c; ++c) *c = static_cast<char>(std::toupper(static_cast<unsigned char>(*c)));
     copyText(s.allPublishedLsn, sizeof(s.allPublishedLsn), lsnText, sizeof(lsnText));
   }
-  s.currentMemory = rd32(payload, 64);
-  size_t sec = rd16(payload, 68);
+  s.currentMemory = rd32(payload, kcapDetails::kMemory);
+  size_t sec = rd16(payload, kcapDetails::kSectionRef);
   if (sec != 0 && sec + 62 <= len) {
     const char* section = payload + sec;
     std::memcpy(s.sectionA, section, 30);

@@ -399,6 +399,17 @@ int msgLogger::putKlpMsg(int number, uint16_t routing, const char* origin, const
                     extra2);
 }
 
+// Stores the caller's values, padded to nine with `pad`, and composes the
+// text; the record's error tells whether it worked.
+void msgLogger::composeWithValues(logMsg* r, int count, const char* const* values,
+                                  const char* pad) {
+  const char* all[MSG_MAX_VALUES];
+  if (count < 0 || values == nullptr) count = 0;
+  for (int i = 0; i < MSG_MAX_VALUES; ++i) all[i] = i < count ? values[i] : pad;
+  setMsgValues(r, MSG_MAX_VALUES, all);
+  if (r->error == 0) composeKlpMsg(r);
+}
+
 int msgLogger::putKlpMsgV(int number, uint16_t routing, const char* origin,
                           const char* threadName, int count, const char* const* values,
                           const char* pad, int32_t extra1, int32_t extra2) {
@@ -410,11 +421,7 @@ int msgLogger::putKlpMsgV(int number, uint16_t routing, const char* origin,
   }
   r->extra[0] = extra1;
   r->extra[1] = extra2;
-  const char* all[MSG_MAX_VALUES];
-  if (count < 0 || values == nullptr) count = 0;
-  for (int i = 0; i < MSG_MAX_VALUES; ++i) all[i] = i < count ? values[i] : pad;
-  setMsgValues(r, MSG_MAX_VALUES, all);
-  if (r->error == 0) composeKlpMsg(r);
+  composeWithValues(r, count, values, pad);
   if (r->error != 0) {
     reportLost(number);
     msgFreeRecord(r);
@@ -441,11 +448,7 @@ int msgLogger::getKlpMsgTextV(int number, const char* origin, const char* thread
     msgFreeRecord(r);
     return -1;
   }
-  const char* all[MSG_MAX_VALUES];
-  if (count < 0 || values == nullptr) count = 0;
-  for (int i = 0; i < MSG_MAX_VALUES; ++i) all[i] = i < count ? values[i] : pad;
-  setMsgValues(r, MSG_MAX_VALUES, all);
-  if (r->error == 0) composeKlpMsg(r);
+  composeWithValues(r, count, values, pad);
   if (r->error != 0) {
     msgFreeRecord(r);
     return -1;

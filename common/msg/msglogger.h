@@ -213,6 +213,7 @@ class msgLogger {
   void setRoutingWord(char severity, uint16_t word);
 
  protected:
+  void composeWithValues(logMsg* r, int count, const char* const* values, const char* pad);
   // Header values by number range, then the 1161 bound.
   void addHeaderValues(logMsg* record);
   void boundValues(logMsg* record);

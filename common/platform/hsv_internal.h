@@ -4,6 +4,8 @@
 #include <cstdint>
 #include <ctime>
 
+#include "common/platform/hsv.h"
+
 namespace hsvint {
 
 // The absolute time timeoutMs from now on the given clock.
@@ -11,5 +13,9 @@ timespec deadlineAfter(clockid_t clock, int64_t timeoutMs);
 // Milliseconds left until deadline on the given clock, rounded up, never
 // negative.
 int64_t msUntil(clockid_t clock, const timespec& deadline);
+
+// The POSIX name of an id, checked: the id may have been copied from
+// anywhere, so its text is not trusted to be NUL-ended or well formed.
+bool posixName(const HSVResID& id, char (&name)[sizeof(HSVResID::part2)]);
 
 }  // namespace hsvint

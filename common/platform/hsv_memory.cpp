@@ -8,18 +8,9 @@
 #include <cstring>
 
 #include "common/platform/hsv.h"
+#include "common/platform/hsv_internal.h"
 
-namespace {
-
-bool posixName(const HSVResID& id, char (&name)[sizeof(HSVResID::part2)]) {
-  size_t n = strnlen(id.part2, sizeof id.part2);
-  if (n < 2 || n >= sizeof id.part2 || id.part2[0] != '/') return false;
-  if (memchr(id.part2 + 1, '/', n - 1)) return false;
-  memcpy(name, id.part2, n + 1);
-  return true;
-}
-
-}  // namespace
+using hsvint::posixName;
 
 HSVHIPCMemory::HSVHIPCMemory() = default;
 

@@ -11,19 +11,7 @@
 #include "common/platform/hsv.h"
 #include "common/platform/hsv_internal.h"
 
-namespace {
-
-// The POSIX name of an id, checked: the id may have been copied from
-// anywhere, so its text is not trusted to be NUL-ended or well formed.
-bool posixName(const HSVResID& id, char (&name)[sizeof(HSVResID::part2)]) {
-  size_t n = strnlen(id.part2, sizeof id.part2);
-  if (n < 2 || n >= sizeof id.part2 || id.part2[0] != '/') return false;
-  if (memchr(id.part2 + 1, '/', n - 1)) return false;
-  memcpy(name, id.part2, n + 1);
-  return true;
-}
-
-}  // namespace
+using hsvint::posixName;
 
 HSVHIPCQueue::HSVHIPCQueue() = default;
 

@@ -6,6 +6,7 @@
 #include <cstring>
 
 #include "common/platform/hsv.h"
+#include "common/platform/hsv_internal.h"
 
 namespace {
 
@@ -50,4 +51,12 @@ void hsvResIDPrintable(const HSVResID& id, char* buf, size_t bufLen) {
   snprintf(buf, bufLen, "(%.*s, %.*s, %.*s)", partLen(id.part1, sizeof id.part1), id.part1,
            partLen(id.part2, sizeof id.part2), id.part2, partLen(id.part3, sizeof id.part3),
            id.part3);
+}
+
+bool hsvint::posixName(const HSVResID& id, char (&name)[sizeof(HSVResID::part2)]) {
+  size_t n = strnlen(id.part2, sizeof id.part2);
+  if (n < 2 || n >= sizeof id.part2 || id.part2[0] != '/') return false;
+  if (memchr(id.part2 + 1, '/', n - 1)) return false;
+  memcpy(name, id.part2, n + 1);
+  return true;
 }

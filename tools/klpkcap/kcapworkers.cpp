@@ -8,6 +8,7 @@
 #include <ctime>
 
 #include "common/env/klpenv.h"
+#include "common/ipc/kcapdetails.h"
 #include "common/ipc/cmdapi.h"
 #include "common/ipc/ipcmsg.h"
 #include "common/msg/klplog.h"
@@ -23,15 +24,8 @@ namespace {
 constexpr uint32_t kPollMs = 20;
 
 // Payload placement of the detailed status.
-constexpr size_t kUpTimeAt = 12;
-constexpr size_t kLogFileRefAt = 16;
-constexpr size_t kActiveSubsAt = 20;
-constexpr size_t kLogTimeAt = 24;
-constexpr size_t kLogTimeLen = 26;
-constexpr size_t kLsnAt = 51;
-constexpr size_t kMemoryAt = 64;
-constexpr size_t kSectionRefAt = 68;
-constexpr size_t kLogFileAt = 70;
+using namespace kcapDetails;
+constexpr size_t kLogFileAt = kMinSize;  // the log file name follows the fixed part
 constexpr size_t kLogFileMax = 1027;  // the status data's field holds 1027 and a NUL
 
 struct WorkerRole {
@@ -176,9 +170,9 @@ IpcMsg* kcapDetailsReply(int64_t upTime, const char* logFile, int32_t memoryByte
                      hsvProcessID()) != 0)
     return nullptr;
   char* p = reply->payload();
-  put32(p, kUpTimeAt, upTime < 0 ? 0 : upTime > INT32_MAX ? INT32_MAX : static_cast<int32_t>(upTime));
-  put16(p, kLogFileRefAt, static_cast<uint16_t>(kLogFileAt));
-  put32(p, kActiveSubsAt, 0);  // the sample publishes no subscriptions
+  put32(p, kUpTime, upTime < 0 ? 0 : upTime > INT32_MAX ? INT32_MAX : static_cast<int32_t>(upTime));
+  put16(p, kLogFileRef, static_cast<uint16_t>(kLogFileAt));
+  put32(p, kActiveSubs, 0);  // the sample publishes no subscriptions
 
   HSVTimeUTC now = hsvTimeGetUTC();
   struct tm lt;
@@ -188,10 +182,10 @@ IpcMsg* kcapDetailsReply(int64_t upTime, const char* logFile, int32_t memoryByte
     strftime(base, sizeof base, "%Y-%m-%d-%H.%M.%S", &lt);
     snprintf(stamp, sizeof stamp, "%s.%06d", base, static_cast<int>(now.microseconds));
   }
-  memcpy(p + kLogTimeAt, stamp, strnlen(stamp, kLogTimeLen));
-  memset(p + kLsnAt, 0, 8);  // nothing published yet
-  put32(p, kMemoryAt, memoryBytes);
-  put16(p, kSectionRefAt, 0);
+  memcpy(p + kLogTime, stamp, strnlen(stamp, kLogTimeLen));
+  memset(p + kLsn, 0, kLsnLen);  // nothing published yet
+  put32(p, kMemory, memoryBytes);
+  put16(p, kSectionRef, 0);
   put16(p, kLogFileAt, static_cast<uint16_t>(nameLen));
   if (nameLen > 0) memcpy(p + kLogFileAt + 2, logFile, nameLen);
   return reply;
