@@ -107,15 +107,15 @@ int reap(pid_t pid) {
 TEST_F(Env, ProgramLevelRecordedAndSchemaPutBack) {
   klptest::TmpDir dir;
   LogFile log(dir.path());
-  ServerParms parms("MYDB", "ASN2");
+  ServerParms parms("MYDB", "QRS2");
   int32_t sourceBefore = parms.get()->getParmSource(2);
   int64_t before = hsvTimeGetUTC().seconds;
   setEnvTovRIB(env_, "xqpubcmd", 9, 7, 8);
   EXPECT_STREQ("xqpubcmd 9.7.8", env_->programLevel);
   EXPECT_GE(env_->startTime, before);
-  EXPECT_STREQ("ASN2", parms.get()->getParmString(2));
+  EXPECT_STREQ("QRS2", parms.get()->getParmString(2));
   EXPECT_EQ(sourceBefore, parms.get()->getParmSource(2));
-  EXPECT_STREQ("ASN2", log.logger()->getProgramQualifier());
+  EXPECT_STREQ("QRS2", log.logger()->getProgramQualifier());
   std::string text = log.text();
   EXPECT_EQ(1u, countOf(text, "KLP0600")) << text;
   EXPECT_NE(std::string::npos, text.find("xqpubcmd 9.7.8")) << text;

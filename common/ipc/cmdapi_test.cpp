@@ -124,8 +124,8 @@ TEST(CmdApiNames, ServerNameIsUpperCasedAndJoined) {
   char out[KLP_UNIQUE_NAME_SIZE];
   ASSERT_EQ(klpBuildServerName(KLP_KIND_KCAP, "mydb", "klp.", out, sizeof(out)), 0);
   EXPECT_STREQ(out, "MYDB.KLP.KCAP");
-  ASSERT_EQ(klpBuildServerName(KLP_KIND_APP, "db1 junk", "asn\0junk", out, sizeof(out)), 0);
-  EXPECT_STREQ(out, "DB1.ASN.APP");
+  ASSERT_EQ(klpBuildServerName(KLP_KIND_APP, "db1 junk", "qrs\0junk", out, sizeof(out)), 0);
+  EXPECT_STREQ(out, "DB1.QRS.APP");
   EXPECT_EQ(klpBuildServerName(KLP_KIND_MON, " x", "s", out, sizeof(out)), KLP_API_NO_SERVER);
   EXPECT_EQ(klpBuildServerName(KLP_KIND_MON, "x", "", out, sizeof(out)), KLP_API_NO_SCHEMA);
   EXPECT_EQ(klpBuildServerName(6, "x", "s", out, sizeof(out)), KLP_API_BAD_KIND);
