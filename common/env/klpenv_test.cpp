@@ -10,6 +10,7 @@
 #include <cstddef>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <string>
 
 #include "common/ipc/ipcmsg.h"
@@ -23,9 +24,9 @@
 
 namespace {
 
-// A server-like parameter set: server name, DEBUG and schema.
-class ServerParms {
- public:
+// A server-like parameter set made current: server name, DEBUG and schema.
+struct ServerParms {
+  std::unique_ptr<klpParmClass> p;
   ServerParms(const char* server, const char* schema, bool debug = false) {
     const ParmEntry table[3] = {
         makeParmEntry(0, "CAPTURE_SERVER", 0, PARM_STRING, -1, 128, -1, "", 0, 1, 0),
@@ -33,41 +34,27 @@ class ServerParms {
         makeParmEntry(2, "CAPTURE_SCHEMA", 0, PARM_STRING, -1, 128, -1, "KLP", 0, 1, 0),
     };
     int rc = 0;
-    parms_ = new klpParmClass(table, 3, &rc);
-    parms_->setParm(0, server, PARM_SRC_COMMANDLINE);
-    if (schema) parms_->setParm(2, schema, PARM_SRC_COMMANDLINE);
-    if (debug) parms_->setParmBool(1, 1, PARM_SRC_COMMANDLINE);
-    klpSetCurrentParms(parms_);
+    p = std::make_unique<klpParmClass>(table, 3, &rc);
+    p->setParm(0, server, PARM_SRC_COMMANDLINE);
+    if (schema) p->setParm(2, schema, PARM_SRC_COMMANDLINE);
+    if (debug) p->setParmBool(1, 1, PARM_SRC_COMMANDLINE);
+    klpSetCurrentParms(p.get());
   }
-  ~ServerParms() {
-    klpSetCurrentParms(nullptr);
-    delete parms_;
-  }
-  klpParmClass* get() { return parms_; }
-
- private:
-  klpParmClass* parms_;
+  ~ServerParms() { klpSetCurrentParms(nullptr); }
 };
 
-// A process logger writing its log file into the test's directory.
-class LogFile {
- public:
-  explicit LogFile(const std::string& dir) : file_(dir + "env.log") {
-    logger_ = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
-    logger_->loadBuiltinMsgs(builtinMsgTable);
-    logger_->setLogFileName(dir.c_str(), "env.log");
-    klpSetProcessLogger(logger_);
+// A process logger writing the log file env.log into dir.
+struct LogFile {
+  msgLogger* logger = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
+  explicit LogFile(const std::string& dir) {
+    logger->loadBuiltinMsgs(builtinMsgTable);
+    logger->setLogFileName(dir.c_str(), "env.log");
+    klpSetProcessLogger(logger);
   }
   ~LogFile() {
     klpSetProcessLogger(nullptr);
-    delete logger_;
+    delete logger;
   }
-  std::string text() const { return klptest::readFile(file_); }
-  msgLogger* logger() { return logger_; }
-
- private:
-  std::string file_;
-  msgLogger* logger_;
 };
 
 // Every test starts from a cleared environment and leaves one behind.
@@ -79,6 +66,8 @@ class Env : public ::testing::Test {
     klpEnvClear(env_);
   }
   klpEnv* env_ = klpGetEnv();
+  klptest::TmpDir dir_;
+  std::string logText() const { return klptest::readFile(dir_.path() + "env.log"); }
 };
 
 size_t countOf(const std::string& text, const std::string& what) {
@@ -99,24 +88,39 @@ int reap(pid_t pid) {
   return -1;
 }
 
+// A process that puts one request on the queue at path, creating the queue
+// first (an earlier server) or attaching to it (a client), and ends.
+[[noreturn]] void putRequestAndExit(const char* path, bool create, int32_t func, int32_t subFunc,
+                                    const char* text) {
+  HSVResID id;
+  HSVHIPCQueue q;
+  IpcMsg* msg = nullptr;
+  hsvRC prc;
+  if (hsvIPCGetQueResID(path, HSV_QUEUE_RESID_OPTION, &id) != ECF_OK ||
+      (create ? q.create(id, IPC_MAX_MSG_SIZE, HSV_CREATE_OPTION) : q.attach(id)) != ECF_OK ||
+      createRequestMsg(&msg, func, subFunc, text) != 0 || putIpcMsg(&q, msg, &prc) != 0)
+    _exit(1);
+  if (!create) {  // an earlier server ends without cleaning up
+    freeIpcMsg(msg);
+    q.detach();
+  }
+  _exit(0);
+}
+
 }  // namespace
 
-// ---------------------------------------------------------------------------
-// Program level
-// ---------------------------------------------------------------------------
 TEST_F(Env, ProgramLevelRecordedAndSchemaPutBack) {
-  klptest::TmpDir dir;
-  LogFile log(dir.path());
+  LogFile log(dir_.path());
   ServerParms parms("MYDB", "QRS2");
-  int32_t sourceBefore = parms.get()->getParmSource(2);
+  int32_t sourceBefore = parms.p->getParmSource(2);
   int64_t before = hsvTimeGetUTC().seconds;
   setEnvTovRIB(env_, "xqpubcmd", 9, 7, 8);
   EXPECT_STREQ("xqpubcmd 9.7.8", env_->programLevel);
   EXPECT_GE(env_->startTime, before);
-  EXPECT_STREQ("QRS2", parms.get()->getParmString(2));
-  EXPECT_EQ(sourceBefore, parms.get()->getParmSource(2));
-  EXPECT_STREQ("QRS2", log.logger()->getProgramQualifier());
-  std::string text = log.text();
+  EXPECT_STREQ("QRS2", parms.p->getParmString(2));
+  EXPECT_EQ(sourceBefore, parms.p->getParmSource(2));
+  EXPECT_STREQ("QRS2", log.logger->getProgramQualifier());
+  std::string text = logText();
   EXPECT_EQ(1u, countOf(text, "KLP0600")) << text;
   EXPECT_NE(std::string::npos, text.find("xqpubcmd 9.7.8")) << text;
 
@@ -129,19 +133,12 @@ TEST_F(Env, ProgramLevelRecordedAndSchemaPutBack) {
   EXPECT_EQ(0, memcmp(reinterpret_cast<const char*>(&env_->appVersion) + 178, "0801", 4));
 }
 
-// ---------------------------------------------------------------------------
-// Name prefix
-// ---------------------------------------------------------------------------
 TEST_F(Env, NamePrefixJoinsServerSchemaAndWord) {
   EXPECT_EQ(KLP_RC_NO_SERVER, setEnvNamePrefix(env_, "KCAP"));  // no parameter set yet
   EXPECT_EQ(nullptr, getEnvNamePrefix(env_));
-  {
-    ServerParms parms("MYDB", nullptr);  // the schema's default KLP
-    ASSERT_EQ(0, setEnvNamePrefix(env_, "KCAP"));
-    EXPECT_STREQ("MYDB.KLP.KCAP", getEnvNamePrefix(env_));
-  }
-  {
-    ServerParms parms("MYDB", "KLP.");  // a trailing dot is dropped
+  for (const char* schema : {static_cast<const char*>(nullptr), "KLP."}) {
+    // The schema's default KLP; a trailing dot is dropped.
+    ServerParms parms("MYDB", schema);
     ASSERT_EQ(0, setEnvNamePrefix(env_, "KCAP"));
     EXPECT_STREQ("MYDB.KLP.KCAP", getEnvNamePrefix(env_));
   }
@@ -156,36 +153,30 @@ TEST_F(Env, NamePrefixJoinsServerSchemaAndWord) {
   // A prefix longer than its 160 characters is refused whole.
   ServerParms parms("MYDB", nullptr);
   ASSERT_EQ(0, setEnvNamePrefix(env_, "KCAP"));
-  parms.get()->setParm(0, std::string(128, 'S').c_str(), PARM_SRC_COMMANDLINE);
-  parms.get()->setParm(2, std::string(40, 'C').c_str(), PARM_SRC_COMMANDLINE);
+  parms.p->setParm(0, std::string(128, 'S').c_str(), PARM_SRC_COMMANDLINE);
+  parms.p->setParm(2, std::string(40, 'C').c_str(), PARM_SRC_COMMANDLINE);
   EXPECT_EQ(KLP_RC_TOO_LONG, setEnvNamePrefix(env_, "KCAP"));
   EXPECT_STREQ("MYDB.KLP.KCAP", getEnvNamePrefix(env_));  // the old one stays
   // Exactly 160 characters still fit.
-  parms.get()->setParm(2, std::string(26, 'C').c_str(), PARM_SRC_COMMANDLINE);
+  parms.p->setParm(2, std::string(26, 'C').c_str(), PARM_SRC_COMMANDLINE);
   ASSERT_EQ(0, setEnvNamePrefix(env_, "KCAP"));
   EXPECT_EQ(160u, strlen(getEnvNamePrefix(env_)));
 }
 
-// ---------------------------------------------------------------------------
-// IPC directory
-// ---------------------------------------------------------------------------
 TEST_F(Env, IpcDirectoryFromTmpdirFilledOnce) {
-  klptest::TmpDir dir;  // restores TMPDIR afterwards
   setenv("TMPDIR", "/x/tmp", 1);
   EXPECT_STREQ("/x/tmp/", getEnvIPCDir(env_));
   setenv("TMPDIR", "/somewhere/else/", 1);
   EXPECT_STREQ("/x/tmp/", getEnvIPCDir(env_));  // kept for the process
-  klpEnvClear(env_);
-  EXPECT_STREQ("/somewhere/else/", getEnvIPCDir(env_));
-  klpEnvClear(env_);
-  unsetenv("TMPDIR");
-  EXPECT_STREQ("/tmp/", getEnvIPCDir(env_));
-  klpEnvClear(env_);
-  setenv("TMPDIR", "", 1);
-  EXPECT_STREQ("/tmp/", getEnvIPCDir(env_));
-  klpEnvClear(env_);
-  setenv("TMPDIR", std::string(2000, 'd').c_str(), 1);
-  EXPECT_STREQ("/tmp/", getEnvIPCDir(env_));
+  // Unset, empty or too long: the default.
+  std::string tooLong(2000, 'd');
+  const char* cases[][2] = {{"/somewhere/else/", "/somewhere/else/"},
+                            {nullptr, "/tmp/"}, {"", "/tmp/"}, {tooLong.c_str(), "/tmp/"}};
+  for (const auto& c : cases) {
+    klpEnvClear(env_);
+    c[0] ? setenv("TMPDIR", c[0], 1) : unsetenv("TMPDIR");
+    EXPECT_STREQ(c[1], getEnvIPCDir(env_)) << (c[0] ? c[0] : "(unset)");
+  }
 
   klpEnvClear(env_);
   setenv("TMPDIR", "/d/t", 1);
@@ -198,9 +189,6 @@ TEST_F(Env, IpcDirectoryFromTmpdirFilledOnce) {
   EXPECT_STREQ("/d/t/MYDB.KLP.KCAP.IPC.CMD4711", path);
 }
 
-// ---------------------------------------------------------------------------
-// Module list
-// ---------------------------------------------------------------------------
 TEST_F(Env, ModuleListHoldsTheTableThenTheAddedRecords) {
   klpModuleRecord added[2] = {};
   strcpy(added[0].name, "server.cpp");
@@ -209,32 +197,25 @@ TEST_F(Env, ModuleListHoldsTheTableThenTheAddedRecords) {
   klpModuleList* list = env_->moduleList;
   ASSERT_NE(nullptr, list);
   EXPECT_EQ(0, memcmp(list->eyeCatcher, "KLPSMODL\0", 9));
-  EXPECT_EQ(23, list->count);
+  EXPECT_EQ(KLP_MODULE_TABLE_COUNT + 2, list->count);
   klpModuleRecord* rec = klpModuleRecords(list);
-  int filled = 0;
-  for (int i = 0; i < KLP_MODULE_TABLE_COUNT; ++i) filled += rec[i].name[0] != 0;
-  EXPECT_EQ(18, filled);
   EXPECT_EQ(20u, strlen(rec[0].compileStamp));  // "Mon dd yyyy hh:mm:ss"
-  EXPECT_STREQ("server.cpp", rec[21].name);
-  EXPECT_STREQ("other.cpp", rec[22].name);
+  EXPECT_STREQ("server.cpp", rec[KLP_MODULE_TABLE_COUNT].name);
+  EXPECT_STREQ("other.cpp", rec[KLP_MODULE_TABLE_COUNT + 1].name);
   setEnvModServ(env_, nullptr, 0);  // replaces the list
-  EXPECT_EQ(21, env_->moduleList->count);
+  EXPECT_EQ(KLP_MODULE_TABLE_COUNT, env_->moduleList->count);
 }
 
-// ---------------------------------------------------------------------------
-// The server's receiving queue
-// ---------------------------------------------------------------------------
 TEST_F(Env, ReceivingQueueCreatedAndDestroyed) {
-  klptest::TmpDir dir;
-  std::string path = dir.path() + "MYDB.KLP.KCAP.IPC";
-  std::string outFile = dir.path() + "server.out";
+  std::string path = dir_.path() + "MYDB.KLP.KCAP.IPC";
+  std::string outFile = dir_.path() + "server.out";
   fflush(stdout);
   // A server process: its main thread is registered, so the queue is also
   // a recovery resource of that thread.
   pid_t pid = fork();
   if (pid == 0) {
     if (!freopen(outFile.c_str(), "w", stdout)) _exit(90);
-    LogFile log(dir.path());
+    LogFile log(dir_.path());
     ServerParms parms("MYDB", nullptr, /*debug=*/true);
     klpThread* self = klpMainThread();
     if (klpThread::prologue(self) != 0) _exit(91);
@@ -254,18 +235,15 @@ TEST_F(Env, ReceivingQueueCreatedAndDestroyed) {
   EXPECT_FALSE(klptest::queueExists(path));
   std::string out = klptest::readFile(outFile);
   EXPECT_EQ(0u, out.find("keyPath to contruct IPC = " + path + "\n")) << out;
-  std::string text = klptest::readFile(dir.path() + "env.log");
-  EXPECT_EQ(1u, countOf(text, "KLP0594")) << text;
-  EXPECT_EQ(1u, countOf(text, "KLP0595")) << text;
-  EXPECT_EQ(0u, countOf(text, "KLP0592")) << text;
-  EXPECT_EQ(0u, countOf(text, "KLP0589")) << text;
+  std::string text = logText();
+  for (auto [id, n] : {std::pair{"KLP0594", 1u}, {"KLP0595", 1u}, {"KLP0592", 0u}, {"KLP0589", 0u}})
+    EXPECT_EQ(n, countOf(text, id)) << id << "\n" << text;
   EXPECT_NE(std::string::npos, text.find("<Klpenv:delEnvIpcQRcvHdl>")) << text;
   EXPECT_NE(std::string::npos, text.find("(mqueue, ")) << text;
 }
 
 TEST_F(Env, ReceivingQueueDestroyedWhenTheServerTraps) {
-  klptest::TmpDir dir;
-  std::string path = dir.path() + "MYDB.KLP.KCAP.IPC";
+  std::string path = dir_.path() + "MYDB.KLP.KCAP.IPC";
   pid_t pid = fork();
   if (pid == 0) {
     ServerParms parms("MYDB", nullptr);
@@ -286,32 +264,21 @@ TEST_F(Env, ReceivingQueueDestroyedWhenTheServerTraps) {
 }
 
 TEST_F(Env, StaleQueueOfAnEarlierRunIsReplaced) {
-  klptest::TmpDir dir;
   ServerParms parms("MYDB", nullptr);
   ASSERT_EQ(0, setEnvNamePrefix(env_, "KCAP"));
-  std::string path = dir.path() + "MYDB.KLP.KCAP.IPC";
+  std::string path = dir_.path() + "MYDB.KLP.KCAP.IPC";
 
   // An earlier server process created the queue, left a request on it and
   // ended without cleaning up.
   pid_t pid = fork();
-  if (pid == 0) {
-    HSVResID id;
-    HSVHIPCQueue q;
-    IpcMsg* msg = nullptr;
-    hsvRC prc;
-    if (hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id) != ECF_OK ||
-        q.create(id, IPC_MAX_MSG_SIZE, HSV_CREATE_OPTION) != ECF_OK ||
-        createRequestMsg(&msg, IPC_FUNC_STOP, 0, nullptr) != 0 || putIpcMsg(&q, msg, &prc) != 0)
-      _exit(1);
-    _exit(0);
-  }
+  if (pid == 0) putRequestAndExit(path.c_str(), true, IPC_FUNC_STOP, 0, nullptr);
   ASSERT_EQ(0, reap(pid));
   ASSERT_TRUE(klptest::queueExists(path));
 
   // The next run of the server.
   pid = fork();
   if (pid == 0) {
-    LogFile log(dir.path());
+    LogFile log(dir_.path());
     klpThread* self = klpMainThread();
     if (klpThread::prologue(self) != 0) _exit(91);
     if (setEnvIpcQRcvHdl(env_) != 0) _exit(92);
@@ -321,19 +288,16 @@ TEST_F(Env, StaleQueueOfAnEarlierRunIsReplaced) {
   }
   ASSERT_EQ(0, reap(pid));
   EXPECT_FALSE(klptest::queueExists(path));
-  std::string text = klptest::readFile(dir.path() + "env.log");
+  std::string text = logText();
   size_t attached = text.find("KLP0592"), destroyed = text.find("KLP0595"),
          created = text.find("KLP0594");
-  ASSERT_NE(std::string::npos, attached) << text;
-  ASSERT_NE(std::string::npos, destroyed) << text;
-  ASSERT_NE(std::string::npos, created) << text;
+  ASSERT_NE(std::string::npos, created) << text;  // the last of the three
   EXPECT_LT(attached, destroyed);
   EXPECT_LT(destroyed, created);
   EXPECT_EQ(2u, countOf(text, "KLP0595")) << "replaced, then destroyed at the end\n" << text;
 }
 
 TEST_F(Env, AnotherProcessReachesTheReceivingQueue) {
-  klptest::TmpDir dir;
   EXPECT_EQ(KLP_RC_NO_SERVER, setEnvIpcQRcvHdl(env_));  // no name: no ".IPC" for everyone
   EXPECT_EQ(nullptr, getEnvIpcQRcvHdl(env_));
   ServerParms parms("S1", "A");
@@ -344,17 +308,8 @@ TEST_F(Env, AnotherProcessReachesTheReceivingQueue) {
   if (pid == 0) {
     // A client: attaches by the path alone and sends a CHGPARMS request.
     char path[512];
-    HSVResID id;
-    HSVHIPCQueue q;
-    IpcMsg* msg = nullptr;
-    hsvRC prc;
     ipcServerQueuePath(path, sizeof path, getenv("TMPDIR"), "S1.A.KCAP");
-    if (hsvIPCGetQueResID(path, HSV_QUEUE_RESID_OPTION, &id) != ECF_OK || q.attach(id) != ECF_OK ||
-        createRequestMsg(&msg, IPC_FUNC_CHGPARMS, 7, "Y") != 0 || putIpcMsg(&q, msg, &prc) != 0)
-      _exit(1);
-    freeIpcMsg(msg);
-    q.detach();
-    _exit(0);
+    putRequestAndExit(path, false, IPC_FUNC_CHGPARMS, 7, "Y");
   }
   char buf[IPC_MAX_MSG_SIZE];
   size_t len = 0;
@@ -369,8 +324,6 @@ TEST_F(Env, AnotherProcessReachesTheReceivingQueue) {
   char text[8];
   ipcPayloadText(view, text, sizeof text);
   EXPECT_STREQ("Y", text);
-
-  std::string path = dir.path() + "S1.A.KCAP.IPC";
   delEnvIpcQRcvHdl(env_);
-  EXPECT_FALSE(klptest::queueExists(path));
+  EXPECT_FALSE(klptest::queueExists(dir_.path() + "S1.A.KCAP.IPC"));
 }

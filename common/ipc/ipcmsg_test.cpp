@@ -7,7 +7,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstddef>
 #include <cstdlib>
 #include <cstring>
 #include <string>
@@ -23,6 +22,13 @@ int32_t wordAt(const void* base, size_t offset) {
   int32_t v;
   memcpy(&v, static_cast<const char*>(base) + offset, 4);
   return v;
+}
+
+// The nine header words after the eye-catcher.
+std::vector<int32_t> headerWords(const void* msg) {
+  std::vector<int32_t> w;
+  for (size_t off = 8; off < IPC_HEADER_SIZE; off += 4) w.push_back(wordAt(msg, off));
+  return w;
 }
 
 // Raw bytes of a message with the given header words and payload.
@@ -44,13 +50,12 @@ std::string pattern(size_t n) {
 }
 
 // Builds a reply with the payload and cuts it into pieces.
-std::vector<std::vector<char>> split(const std::string& payload, int32_t func = 61) {
+std::vector<std::vector<char>> split(const std::string& payload) {
   IpcMsg* reply = nullptr;
-  EXPECT_EQ(0, createReplyMsg(&reply, IPC_HEADER_SIZE + payload.size(), func, 4242));
+  EXPECT_EQ(0, createReplyMsg(&reply, IPC_HEADER_SIZE + payload.size(), 61, 4242));
   memcpy(reply->payload(), payload.data(), payload.size());
   std::vector<std::vector<char>> pieces;
-  int32_t n = ipcPieceCount(payload.size());
-  for (int32_t k = 1; k <= n; ++k) {
+  for (int32_t k = 1; k <= ipcPieceCount(payload.size()); ++k) {
     std::vector<char> piece(IPC_MAX_MSG_SIZE);
     size_t len = 0;
     EXPECT_EQ(0, ipcBuildPiece(reply, k, piece.data(), piece.size(), &len));
@@ -64,33 +69,37 @@ std::vector<std::vector<char>> split(const std::string& payload, int32_t func = 
 int addRaw(IpcGather& g, const std::vector<char>& raw, int32_t* left) {
   IpcMsgView v;
   int rc = ipcDecodeMsg(raw.data(), raw.size(), &v);
-  if (rc != 0) return rc;
-  return g.add(v, left);
+  return rc != 0 ? rc : g.add(v, left);
 }
 
 void setWord(std::vector<char>& raw, size_t offset, int32_t v) { memcpy(raw.data() + offset, &v, 4); }
 
+// A queue of its own under dir, for one test.
+struct OwnQueue {
+  std::string path;
+  HSVResID id;
+  HSVHIPCQueue q;
+  explicit OwnQueue(const std::string& p) : path(p) {
+    EXPECT_EQ(ECF_OK, hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id));
+    EXPECT_EQ(ECF_OK, q.create(id, IPC_MAX_MSG_SIZE, HSV_CREATE_OPTION));
+  }
+  ~OwnQueue() {
+    EXPECT_EQ(ECF_OK, q.destroy());
+    EXPECT_FALSE(klptest::queueExists(path));
+  }
+};
+
 }  // namespace
 
-// ---------------------------------------------------------------------------
-// Layout and building
-// ---------------------------------------------------------------------------
-TEST(IpcMsgLayout, RequestBytesAtTheirOffsets) {
+TEST(IpcMsgLayout, RequestAndReplyHeaderBytes) {
   IpcMsg* req = nullptr;
   ASSERT_EQ(0, createRequestMsg(&req, IPC_FUNC_CHGPARMS, 12, "ab"));
   req->reserved = 99;
   stampIpcMsg(req);
   const char* b = reinterpret_cast<const char*>(req);
   EXPECT_EQ(0, memcmp(b, "IPC:\0\0\0\0", 8));
-  EXPECT_EQ(1, wordAt(b, 8));
-  EXPECT_EQ(47, wordAt(b, 12));  // header, two characters and the NUL
-  EXPECT_EQ(20, wordAt(b, 16));
-  EXPECT_EQ(12, wordAt(b, 20));
-  EXPECT_EQ(hsvProcessID(), wordAt(b, 24));
-  EXPECT_EQ(0, wordAt(b, 28));
-  EXPECT_EQ(0, wordAt(b, 32));  // requests carry no piece count
-  EXPECT_EQ(0, wordAt(b, 36));
-  EXPECT_EQ(0, wordAt(b, 40));
+  // Header, two characters and the NUL; requests carry no piece count.
+  EXPECT_EQ((std::vector<int32_t>{1, 47, 20, 12, hsvProcessID(), 0, 0, 0, 0}), headerWords(b));
   EXPECT_EQ(0, memcmp(b + 44, "ab", 3));
   freeIpcMsg(req);
 
@@ -103,23 +112,17 @@ TEST(IpcMsgLayout, RequestBytesAtTheirOffsets) {
   ASSERT_EQ(0, createRequestMsg(&req, IPC_FUNC_REINITQ, 0, std::string(4051, 'q').c_str()));
   EXPECT_EQ(4096, req->msgLength);
   freeIpcMsg(req);
-}
 
-TEST(IpcMsgLayout, ReplyHeader) {
   IpcMsg* reply = nullptr;
   ASSERT_EQ(0, createReplyMsg(&reply, 60, IPC_FUNC_STATUS_SIZE, 321));
-  const int32_t words[9] = {1, 60, 59, 0, 321, 0, 1, 0, 0};
   EXPECT_EQ(0, memcmp(reply, "IPC:\0\0\0\0", 8));
-  EXPECT_EQ(0, memcmp(reinterpret_cast<char*>(reply) + 8, words, sizeof words));
+  EXPECT_EQ((std::vector<int32_t>{1, 60, 59, 0, 321, 0, 1, 0, 0}), headerWords(reply));
   EXPECT_EQ(std::string(16, '\0'), std::string(reply->payload(), 16));
   freeIpcMsg(reply);
   EXPECT_EQ(KLP_RC_BAD_PARM, createReplyMsg(&reply, 43, 14, 1));
   EXPECT_EQ(nullptr, reply);
 }
 
-// ---------------------------------------------------------------------------
-// Decoding received bytes
-// ---------------------------------------------------------------------------
 TEST(IpcMsgDecode, RefusesWhatCannotBeTrusted) {
   IpcMsgView v;
   auto good = rawMsg(47, std::string("ab\0", 3));
@@ -142,45 +145,38 @@ TEST(IpcMsgDecode, RefusesWhatCannotBeTrusted) {
     EXPECT_EQ(KLP_RC_GET_FAILED, ipcDecodeMsg(bad.data(), bad.size(), &v)) << claimed;
     EXPECT_EQ(0u, v.payloadLen);
   }
-  auto bare = rawMsg(44, "");
-  ASSERT_EQ(0, ipcDecodeMsg(bare.data(), bare.size(), &v));
-  EXPECT_EQ(nullptr, v.payload);
   // Unknown codes pass: the engine answers them.
   auto odd = rawMsg(44, "", 1, 0, 0, 0, 77);
   EXPECT_EQ(0, ipcDecodeMsg(odd.data(), odd.size(), &v));
+  EXPECT_EQ(nullptr, v.payload);
 }
 
 TEST(IpcMsgDecode, PayloadTextIsBoundedByPayloadAndDestination) {
-  IpcMsgView v;
-  auto noNul = rawMsg(50, "abcdef");
-  ASSERT_EQ(0, ipcDecodeMsg(noNul.data(), noNul.size(), &v));
-  char dst[16];
-  EXPECT_EQ(6u, ipcPayloadText(v, dst, sizeof dst));
-  EXPECT_STREQ("abcdef", dst);
-  EXPECT_EQ(3u, ipcPayloadText(v, dst, 4));
-  EXPECT_STREQ("abc", dst);
-  auto embedded = rawMsg(49, std::string("ab\0cd", 5));
-  ASSERT_EQ(0, ipcDecodeMsg(embedded.data(), embedded.size(), &v));
-  EXPECT_EQ(2u, ipcPayloadText(v, dst, sizeof dst));
-  auto bare = rawMsg(44, "");
-  ASSERT_EQ(0, ipcDecodeMsg(bare.data(), bare.size(), &v));
-  EXPECT_EQ(0u, ipcPayloadText(v, dst, sizeof dst));
-  EXPECT_STREQ("", dst);
+  struct Case {
+    std::string payload;
+    size_t room;
+    size_t len;
+    const char* text;
+  } cases[] = {{"abcdef", 16, 6, "abcdef"},
+               {"abcdef", 4, 3, "abc"},  // no NUL in the payload
+               {std::string("ab\0cd", 5), 16, 2, "ab"},
+               {"", 16, 0, ""}};
+  for (const Case& c : cases) {
+    auto raw = rawMsg(static_cast<int32_t>(44 + c.payload.size()), c.payload);
+    IpcMsgView v;
+    ASSERT_EQ(0, ipcDecodeMsg(raw.data(), raw.size(), &v));
+    char dst[16];
+    EXPECT_EQ(c.len, ipcPayloadText(v, dst, c.room)) << c.text;
+    EXPECT_STREQ(c.text, dst);
+  }
 }
 
-// ---------------------------------------------------------------------------
-// MsgQe
-// ---------------------------------------------------------------------------
-TEST(MsgQeElement, BuiltFromARequest) {
-  EXPECT_EQ(64u, offsetof(MsgQe, QeFunc));
-  EXPECT_EQ(80u, offsetof(MsgQe, QeString));
-  EXPECT_EQ(1120u, offsetof(MsgQe, replyTag));
-
+TEST(MsgQeElement, BuiltFromARequestAndCutToTheField) {
   auto raw = rawMsg(49, std::string("ab\0cd", 5), 1, 0, 0, 0, IPC_FUNC_CHGPARMS, 4711);
   setWord(raw, 20, 9);
   IpcMsgView v;
-  ASSERT_EQ(0, ipcDecodeMsg(raw.data(), raw.size(), &v));
   MsgQe* qe = nullptr;
+  ASSERT_EQ(0, ipcDecodeMsg(raw.data(), raw.size(), &v));
   ASSERT_EQ(0, createMsgQe(&qe, v));
   EXPECT_STREQ("ITC:", qe->ole.eyeCatcher);
   EXPECT_EQ(64u, qe->ole.size);
@@ -196,34 +192,29 @@ TEST(MsgQeElement, BuiltFromARequest) {
   setMsgQeReplyTag(qe, 0x1122334455667788ull);
   EXPECT_EQ(0x1122334455667788ull, qe->replyTag);
   deleteMsgQe(qe);
-
   // Without a requester only the text up to its NUL.
   setWord(raw, 24, 0);
   ASSERT_EQ(0, ipcDecodeMsg(raw.data(), raw.size(), &v));
   ASSERT_EQ(0, createMsgQe(&qe, v));
   EXPECT_EQ(0, memcmp(qe->QeString, "ab\0\0\0", 5));
   deleteMsgQe(qe);
-}
 
-TEST(MsgQeElement, LongPayloadIsCutToTheField) {
-  std::string big(4052, 'x');
   for (int32_t pid : {4711, 0}) {
-    auto raw = rawMsg(4096, big, 1, 0, 0, 0, IPC_FUNC_REINITQ, pid);
-    IpcMsgView v;
-    ASSERT_EQ(0, ipcDecodeMsg(raw.data(), raw.size(), &v));
-    MsgQe* qe = nullptr;
+    auto big = rawMsg(4096, std::string(4052, 'x'), 1, 0, 0, 0, IPC_FUNC_REINITQ, pid);
+    ASSERT_EQ(0, ipcDecodeMsg(big.data(), big.size(), &v));
     ASSERT_EQ(0, createMsgQe(&qe, v));
     EXPECT_EQ(1039u, strlen(qe->QeString)) << pid;
     EXPECT_EQ(0u, qe->replyTag) << "the field after the text was overwritten";
     deleteMsgQe(qe);
   }
+}
+
+TEST(MsgQeElement, StopElementAndItsPrint) {
   MsgQe* stop = createMsgQeFunc(IPC_FUNC_STOP);
   ASSERT_NE(nullptr, stop);
   EXPECT_EQ(14, stop->QeFunc);
   EXPECT_EQ(0, stop->QeResponseId);
   EXPECT_STREQ("", stop->QeString);
-  EXPECT_STREQ("ITC:", stop->ole.eyeCatcher);
-
   testing::internal::CaptureStdout();
   printMsgQe(stop);
   std::string out = testing::internal::GetCapturedStdout();
@@ -235,10 +226,7 @@ TEST(MsgQeElement, LongPayloadIsCutToTheField) {
   deleteMsgQe(stop);
 }
 
-// ---------------------------------------------------------------------------
-// Queue names and program words
-// ---------------------------------------------------------------------------
-TEST(QueueNames, ServerAndReplyPaths) {
+TEST(QueueNames, PathsResIdTextAndProgramWords) {
   char path[64];
   ASSERT_EQ(0, ipcServerQueuePath(path, sizeof path, "/tmp/", "S1.A.KCAP"));
   EXPECT_STREQ("/tmp/S1.A.KCAP.IPC", path);
@@ -256,12 +244,9 @@ TEST(QueueNames, ServerAndReplyPaths) {
   HSVResID id;
   ASSERT_EQ(ECF_OK, hsvIPCGetQueResID("/tmp/S1.A.KCAP.IPC", HSV_QUEUE_RESID_OPTION, &id));
   text = ipcNewResIDText(&id);
-  std::string t = text;
+  EXPECT_EQ("(" + std::string(id.part1) + ", " + id.part2 + ", " + id.part3 + ")", text);
   free(text);
-  EXPECT_EQ("(" + std::string(id.part1) + ", " + id.part2 + ", " + id.part3 + ")", t);
-}
 
-TEST(QueueNames, ProgramWordsByTheLastPart) {
   EXPECT_STREQ("K Capture", ipcProgramWord("S1.A.KCAP"));
   EXPECT_STREQ("Monitor Commands", ipcProgramCmdWord("S1.A.MON"));
   for (const char* unknown : {"S1.A.XYZ", "KCAP", "S1.A.kcap"}) {
@@ -270,15 +255,7 @@ TEST(QueueNames, ProgramWordsByTheLastPart) {
   }
 }
 
-// ---------------------------------------------------------------------------
-// Multi-piece replies
-// ---------------------------------------------------------------------------
 TEST(Pieces, SplitAtTheMessageBound) {
-  EXPECT_EQ(1, ipcPieceCount(0));
-  EXPECT_EQ(1, ipcPieceCount(4052));
-  EXPECT_EQ(2, ipcPieceCount(4053));
-  EXPECT_EQ(3, ipcPieceCount(3 * 4052));
-
   auto one = split(pattern(4052));
   ASSERT_EQ(1u, one.size());
   EXPECT_EQ(4096u, one[0].size());
@@ -286,16 +263,9 @@ TEST(Pieces, SplitAtTheMessageBound) {
 
   auto two = split(pattern(4053));
   ASSERT_EQ(2u, two.size());
-  EXPECT_EQ(4096u, two[0].size());
+  EXPECT_EQ((std::vector<int32_t>{1, 4096, 61, 0, 4242, 0, 2, 1, 4053}), headerWords(two[0].data()));
+  EXPECT_EQ((std::vector<int32_t>{1, 45, 61, 0, 4242, 0, 2, 2, 4053}), headerWords(two[1].data()));
   EXPECT_EQ(45u, two[1].size());
-  for (int k = 0; k < 2; ++k) {
-    EXPECT_EQ(static_cast<int32_t>(two[k].size()), wordAt(two[k].data(), 12));
-    EXPECT_EQ(61, wordAt(two[k].data(), 16));
-    EXPECT_EQ(4242, wordAt(two[k].data(), 24));
-    EXPECT_EQ(2, wordAt(two[k].data(), 32));
-    EXPECT_EQ(k + 1, wordAt(two[k].data(), 36));
-    EXPECT_EQ(4053, wordAt(two[k].data(), 40));
-  }
   EXPECT_EQ(pattern(4053).back(), two[1][44]);
 
   IpcMsg* reply = nullptr;
@@ -308,7 +278,7 @@ TEST(Pieces, SplitAtTheMessageBound) {
   freeIpcMsg(reply);
 }
 
-TEST(Pieces, ReassemblyRoundTrip) {
+TEST(Pieces, ReassemblyRoundTripAndAppendedReplies) {
   for (size_t n : {size_t(0), size_t(1), size_t(4052), size_t(4053), size_t(3 * 4052), size_t(20000)}) {
     std::string payload = pattern(n);
     auto pieces = split(payload);
@@ -326,17 +296,13 @@ TEST(Pieces, ReassemblyRoundTrip) {
     EXPECT_EQ('\0', buf[8 + n]);
     free(buf);
   }
-}
 
-TEST(Pieces, SeparateRepliesAreAppended) {
   // CHGPARMS with two changed parameters: two single replies, one buffer.
   IpcGather g;
   int32_t left = -1;
-  auto r1 = rawMsg(47, std::string("ab\0", 3), 1, 1, 0, 0, 20, 100);
-  auto r2 = rawMsg(48, std::string("cde\0", 4), 1, 1, 0, 0, 20, 200);
-  ASSERT_EQ(0, addRaw(g, r1, &left));
+  ASSERT_EQ(0, addRaw(g, rawMsg(47, std::string("ab\0", 3), 1, 1, 0, 0, 20, 100), &left));
   EXPECT_EQ(0, left);
-  ASSERT_EQ(0, addRaw(g, r2, &left));
+  ASSERT_EQ(0, addRaw(g, rawMsg(48, std::string("cde\0", 4), 1, 1, 0, 0, 20, 200), &left));
   char* buf = g.release();
   ASSERT_NE(nullptr, buf);
   EXPECT_EQ(100, wordAt(buf, 0));  // the first reply's sender
@@ -348,10 +314,8 @@ TEST(Pieces, SeparateRepliesAreAppended) {
 }
 
 TEST(Pieces, CorruptedPieceHeadersFailCleanly) {
-  std::string payload = pattern(3 * 4052 + 10);
-  auto pieces = split(payload);
+  auto pieces = split(pattern(3 * 4052 + 10));
   ASSERT_EQ(4u, pieces.size());
-
   struct Damage {
     const char* what;
     size_t piece;   // which piece is damaged
@@ -393,62 +357,47 @@ TEST(Pieces, CorruptedPieceHeadersFailCleanly) {
   }
 
   // Pieces whose own length disagrees with the count and total.
-  {
+  auto shortPiece = pieces[1];
+  shortPiece.resize(shortPiece.size() - 1);
+  setWord(shortPiece, 12, static_cast<int32_t>(shortPiece.size()));
+  auto longLast = rawMsg(44 + 100, std::string(100, 'z'), 1, 4, 4, 3 * 4052 + 10);
+  for (auto [good, bad] : {std::pair{1, shortPiece}, {3, longLast}}) {
     IpcGather g;
     int32_t left = 0;
-    ASSERT_EQ(0, addRaw(g, pieces[0], &left));
-    auto shortPiece = pieces[1];
-    shortPiece.resize(shortPiece.size() - 1);
-    setWord(shortPiece, 12, static_cast<int32_t>(shortPiece.size()));
-    EXPECT_EQ(KLP_RC_GET_FAILED, addRaw(g, shortPiece, &left));
+    for (int k = 0; k < good; ++k) ASSERT_EQ(0, addRaw(g, pieces[k], &left));
+    EXPECT_EQ(4 - good, left);
+    EXPECT_EQ(KLP_RC_GET_FAILED, addRaw(g, bad, &left)) << good;
   }
-  {
-    IpcGather g;
-    int32_t left = 0;
-    for (int k = 0; k < 3; ++k) ASSERT_EQ(0, addRaw(g, pieces[k], &left));
-    auto longLast = rawMsg(44 + 100, std::string(100, 'z'), 1, 4, 4, 3 * 4052 + 10);
-    EXPECT_EQ(KLP_RC_GET_FAILED, addRaw(g, longLast, &left));
-  }
-  {
-    // A reply that ends early leaves pieces outstanding; it is not complete.
-    IpcGather g;
-    int32_t left = 0;
-    ASSERT_EQ(0, addRaw(g, pieces[0], &left));
-    EXPECT_EQ(3, left);
-    EXPECT_EQ(3, g.outstanding());
-  }
+  // A reply that ends early leaves pieces outstanding; it is not complete.
+  IpcGather early;
+  int32_t left = 0;
+  ASSERT_EQ(0, addRaw(early, pieces[0], &left));
+  EXPECT_EQ(3, early.outstanding());
 }
 
-// ---------------------------------------------------------------------------
-// Between processes
-// ---------------------------------------------------------------------------
 TEST(Pieces, LongReplyTravelsBetweenProcesses) {
   klptest::TmpDir dir;
   char path[256];
   ASSERT_EQ(0, ipcReplyQueuePath(path, sizeof path, dir.path().c_str(), "S1.A.KAPP", hsvProcessID()));
-  HSVResID id;
-  ASSERT_EQ(ECF_OK, hsvIPCGetQueResID(path, HSV_QUEUE_RESID_OPTION, &id));
-  HSVHIPCQueue replyQueue;
-  ASSERT_EQ(ECF_OK, replyQueue.create(id, IPC_MAX_MSG_SIZE, HSV_CREATE_OPTION));
-
+  OwnQueue reply(path);
   const std::string payload = pattern(10000);
   pid_t pid = fork();
   if (pid == 0) {
     // The answering server: attaches to the requester's queue and sends
     // the reply in pieces.
     HSVHIPCQueue q;
-    if (q.attach(id) != ECF_OK) _exit(1);
-    IpcMsg* reply = nullptr;
-    if (createReplyMsg(&reply, 44 + payload.size(), 61, hsvProcessID()) != 0) _exit(2);
-    memcpy(reply->payload(), payload.data(), payload.size());
+    if (q.attach(reply.id) != ECF_OK) _exit(1);
+    IpcMsg* msg = nullptr;
+    if (createReplyMsg(&msg, 44 + payload.size(), 61, hsvProcessID()) != 0) _exit(2);
+    memcpy(msg->payload(), payload.data(), payload.size());
     char piece[IPC_MAX_MSG_SIZE];
     for (int32_t k = 1; k <= ipcPieceCount(payload.size()); ++k) {
       size_t len = 0;
       hsvRC prc;
-      if (ipcBuildPiece(reply, k, piece, sizeof piece, &len) != 0) _exit(3);
+      if (ipcBuildPiece(msg, k, piece, sizeof piece, &len) != 0) _exit(3);
       if (putIpcMsg(&q, reinterpret_cast<IpcMsg*>(piece), &prc) != 0) _exit(4);
     }
-    freeIpcMsg(reply);
+    freeIpcMsg(msg);
     q.detach();
     _exit(0);
   }
@@ -459,7 +408,7 @@ TEST(Pieces, LongReplyTravelsBetweenProcesses) {
   do {
     char buf[IPC_MAX_MSG_SIZE];
     size_t len = 0;
-    ASSERT_EQ(ECF_OK, replyQueue.get(buf, sizeof buf, &len, 20000));
+    ASSERT_EQ(ECF_OK, reply.q.get(buf, sizeof buf, &len, 20000));
     IpcMsgView v;
     ASSERT_EQ(0, ipcDecodeMsg(buf, len, &v));
     EXPECT_EQ(pid, v.header.senderPid);
@@ -476,27 +425,18 @@ TEST(Pieces, LongReplyTravelsBetweenProcesses) {
   EXPECT_EQ(10000, wordAt(buf, 4));
   EXPECT_EQ(payload, std::string(buf + 8, 10000));
   free(buf);
-
-  ASSERT_EQ(ECF_OK, replyQueue.destroy());
-  EXPECT_FALSE(klptest::queueExists(path));
 }
 
 TEST(Pieces, PutRefusesLengthsOutsideOneMessage) {
   klptest::TmpDir dir;
-  std::string path = dir.path() + "X.Y.KCAP.IPC";
-  HSVResID id;
-  ASSERT_EQ(ECF_OK, hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id));
-  HSVHIPCQueue q;
-  ASSERT_EQ(ECF_OK, q.create(id, IPC_MAX_MSG_SIZE, HSV_CREATE_OPTION));
+  OwnQueue own(dir.path() + "X.Y.KCAP.IPC");
   IpcMsg* msg = nullptr;
   ASSERT_EQ(0, createReplyMsg(&msg, 5000, 61, 1));
   hsvRC prc = 0;
-  EXPECT_EQ(IPC_RC_PUT_FAILED, putIpcMsg(&q, msg, &prc));
+  EXPECT_EQ(IPC_RC_PUT_FAILED, putIpcMsg(&own.q, msg, &prc));
   EXPECT_EQ(ECF_INVALID_ARGUMENT, prc);
   msg->msgLength = 20;
-  EXPECT_EQ(IPC_RC_PUT_FAILED, putIpcMsg(&q, msg, &prc));
-  EXPECT_FALSE(q.hasMessage());
+  EXPECT_EQ(IPC_RC_PUT_FAILED, putIpcMsg(&own.q, msg, &prc));
+  EXPECT_FALSE(own.q.hasMessage());
   freeIpcMsg(msg);
-  ASSERT_EQ(ECF_OK, q.destroy());
-  EXPECT_FALSE(klptest::queueExists(path));
 }

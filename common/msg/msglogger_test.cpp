@@ -10,21 +10,31 @@
 #include <string>
 #include <thread>
 
-#include "common/msg/msg_testing.h"
 #include "common/msg/msglogger.h"
+#include "tests/testing/klptest.h"
 
 namespace {
 
 const char* kStamp = "\\d{4}-\\d\\d-\\d\\d-\\d\\d\\.\\d\\d\\.\\d\\d\\.\\d{6}";
 
-bool matches(const std::string& line, const std::string& pattern) {
-  return std::regex_match(line, std::regex(pattern));
+// The line is a time stamp, a blank and then the pattern.
+bool stamped(const std::string& line, const std::string& pattern) {
+  return std::regex_match(line, std::regex(std::string(kStamp) + " " + pattern));
 }
+
+using klptest::lines;
 
 struct LoggerTest : ::testing::Test {
   klptest::TmpDir tmp;
   std::string logPath() const { return tmp.path() + "test.log"; }
   std::string log() const { return klptest::readFile(logPath()); }
+  klptest::Child inChild(const std::function<int()>& body) { return klptest::inChild(tmp.path(), body); }
+  // Builtin table, optionally the "KLP" qualifier and the log file test.log.
+  void prepare(msgLogger& l, bool qualifier = true, bool logFile = true) {
+    l.loadBuiltinMsgs(builtinMsgTable);
+    if (qualifier) l.setProgramQualifier("KLP");
+    if (logFile) l.setLogFileName(tmp.path().c_str(), "test.log");
+  }
 };
 
 // A logger whose catalogue hands out fixed texts, to drive the severity and
@@ -38,8 +48,8 @@ struct FixedTextLogger : msgLogger {
   }
 };
 
-TEST_F(LoggerTest, RoutingBySeverityAndConsoleFlag) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
+TEST_F(LoggerTest, RoutingBySeverityAndConsoleFlagAndLineFormats) {
+  auto c = inChild([&] {
     FixedTextLogger error("KLP0700E error text");
     error.setLogFileName(tmp.path().c_str(), "test.log");
     FixedTextLogger info("KLP0700I info text");
@@ -51,43 +61,47 @@ TEST_F(LoggerTest, RoutingBySeverityAndConsoleFlag) {
     info.setConsoleFlag(0);
     info.putKlpMsg(700, MSG_DEST_STDOUT_IF, "o", "t");      // nothing at all
     info.putKlpMsg(700, MSG_DEST_STDOUT, "o", "t");         // console only
+    // Origin and thread name cut to 30 and 15 characters.
+    msgLogger l(MSG_APP_KLPKCCMD, 0);
+    prepare(l);
+    l.putKlpMsg(8006, MSG_DEST_LOGFILE, "0123456789012345678901234567890123456789",
+                "01234567890123456789", "X");
     return 0;
   });
-  ASSERT_TRUE(c.finished);
-  auto out = msgtest::lines(c.out);
+  ASSERT_TRUE(c.exited);
+  auto out = lines(c.out);
   ASSERT_EQ(3u, out.size()) << c.out;
-  EXPECT_TRUE(matches(out[0], std::string(kStamp) + " KLP0700E error text")) << out[0];
-  EXPECT_TRUE(matches(out[1], std::string(kStamp) + " KLP0700I info text")) << out[1];
-  EXPECT_TRUE(matches(out[2], std::string(kStamp) + " KLP0700I info text")) << out[2];
-  auto file = msgtest::lines(log());
-  ASSERT_EQ(3u, file.size()) << log();
-  EXPECT_TRUE(matches(file[0], std::string(kStamp) + " <o> KLP0700E error text")) << file[0];
+  EXPECT_TRUE(stamped(out[0], "KLP0700E error text")) << out[0];
+  EXPECT_TRUE(stamped(out[1], "KLP0700I info text")) << out[1];
+  EXPECT_TRUE(stamped(out[2], "KLP0700I info text")) << out[2];
   EXPECT_EQ("", c.err);
+  std::string text = log();
+  ASSERT_FALSE(text.empty());
+  EXPECT_EQ('\n', text.back());
+  auto file = lines(text);
+  ASSERT_EQ(4u, file.size()) << text;
+  EXPECT_TRUE(stamped(file[0], "<o> KLP0700E error text")) << file[0];
+  EXPECT_TRUE(stamped(file[3], "<012345678901234567890123456789> KLP8006D  \"KlpKCcmd\" : "
+                               "\"KLP\" : \"012345678901234\" : Element \"X\" is out of range\\."))
+      << file[3];
 }
 
 TEST_F(LoggerTest, SeverityIsReadBackFromTheText) {
-  struct Case {
-    const char* text;
-    char severity;
-    const char* shown;
-  } cases[] = {
-      {"KLP0700w lower", 'W', "KLP0700W lower"},
-      {"KLP0700i lower", 'I', "KLP0700I lower"},
-      {"KLP0700X odd", 'D', "KLP0700X odd"},
-      {"no id at all", ' ', "no id at all"},
-      {"prefix KLP0700E later", 'E', "prefix KLP0700E later"},
-      {"KLP0701E another id", ' ', "KLP0701E another id"},
-  };
-  for (const Case& k : cases) {
-    SCOPED_TRACE(k.text);
-    FixedTextLogger l(k.text);
+  // Text given, text shown (a lower-case severity letter shown upper case).
+  for (auto [text, shown] : {std::pair{"KLP0700w lower", "KLP0700W lower"},
+                             {"KLP0700i lower", "KLP0700I lower"},
+                             {"KLP0700X odd", "KLP0700X odd"},
+                             {"no id at all", "no id at all"},
+                             {"prefix KLP0700E later", "prefix KLP0700E later"},
+                             {"KLP0701E another id", "KLP0701E another id"}}) {
+    FixedTextLogger l(text);
     char buf[128];
     l.getKlpMsgText(700, "o", "t", buf, sizeof buf);
-    EXPECT_STREQ(k.shown, buf);
+    EXPECT_STREQ(shown, buf);
   }
   // Blank severity routes by the "other" word: with it set to console
   // only, such a text shows on standard output.
-  auto c = msgtest::inChild(tmp.path(), [&] {
+  auto c = inChild([&] {
     FixedTextLogger noId("no id at all");
     noId.setRoutingWord(' ', MSG_DEST_STDOUT);
     noId.putKlpMsg(700, MSG_ROUTE_BY_SEVERITY, "o", "t");
@@ -96,51 +110,17 @@ TEST_F(LoggerTest, SeverityIsReadBackFromTheText) {
     lower.putKlpMsg(700, MSG_ROUTE_BY_SEVERITY, "o", "t");
     return 0;
   });
-  auto out = msgtest::lines(c.out);
+  auto out = lines(c.out);
   ASSERT_EQ(2u, out.size()) << c.out;
   EXPECT_NE(std::string::npos, out[0].find(" no id at all"));
   EXPECT_NE(std::string::npos, out[1].find(" KLP0700W lower"));
 }
 
-TEST_F(LoggerTest, LogLineFormatAndCutOrigin) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
+TEST_F(LoggerTest, NoLogFileNameWritesNothingAndOpenFailureIsReportedOncePerStreak) {
+  auto c = inChild([&] {
     msgLogger l(MSG_APP_KLPKCCMD, 0);
-    l.loadBuiltinMsgs(builtinMsgTable);
-    l.setProgramQualifier("KLP");
-    l.setLogFileName(tmp.path().c_str(), "test.log");
-    l.putKlpMsg(8006, MSG_DEST_LOGFILE, "0123456789012345678901234567890123456789",
-                "01234567890123456789", "X");
-    return 0;
-  });
-  ASSERT_TRUE(c.finished);
-  EXPECT_EQ("", c.out);
-  std::string file = log();
-  ASSERT_FALSE(file.empty());
-  EXPECT_EQ('\n', file.back());
-  EXPECT_TRUE(matches(msgtest::lines(file)[0],
-                      std::string(kStamp) +
-                          " <012345678901234567890123456789> KLP8006D  \"KlpKCcmd\" : "
-                          "\"KLP\" : \"012345678901234\" : Element \"X\" is out of range\\."))
-      << file;
-}
-
-TEST_F(LoggerTest, NoLogFileNameWritesAndReportsNothing) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
-    msgLogger l(MSG_APP_KLPKCCMD, 0);
-    l.loadBuiltinMsgs(builtinMsgTable);
-    return l.putKlpMsg(8999, MSG_DEST_LOGFILE, "o", "t", "hello");
-  });
-  ASSERT_TRUE(c.finished);
-  EXPECT_EQ(0, c.exitCode);
-  EXPECT_EQ("", c.out);
-  EXPECT_EQ("", c.err);
-}
-
-TEST_F(LoggerTest, OpenFailureIsReportedOncePerStreak) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
-    msgLogger l(MSG_APP_KLPKCCMD, 0);
-    l.loadBuiltinMsgs(builtinMsgTable);
-    l.setProgramQualifier("KLP");
+    prepare(l, true, false);
+    if (l.putKlpMsg(8999, MSG_DEST_LOGFILE, "o", "t", "nowhere") != 0) return 1;
     std::string bad = tmp.path() + "missing-dir";
     l.setLogFileName(bad.c_str(), "x.log");
     l.putKlpMsg(8999, MSG_DEST_LOGFILE, "o", "t", "lost 1");
@@ -151,26 +131,24 @@ TEST_F(LoggerTest, OpenFailureIsReportedOncePerStreak) {
     l.putKlpMsg(8999, MSG_DEST_LOGFILE, "o", "t", "lost 3");
     return 0;
   });
-  ASSERT_TRUE(c.finished);
-  auto err = msgtest::lines(c.err);
+  ASSERT_TRUE(c.exited);
+  EXPECT_EQ(0, c.exitCode);
+  EXPECT_EQ("", c.out);
+  auto err = lines(c.err);
   ASSERT_EQ(2u, err.size()) << c.err;
-  std::string expected = std::string(kStamp) +
-                         " KLP0514E \"KlpKCcmd\" : \"KLP\" : \"Initial\" :  The program could "
+  std::string expected = "KLP0514E \"KlpKCcmd\" : \"KLP\" : \"Initial\" :  The program could "
                          "not open the log file named \"" +
-                         tmp.path() + "missing-dir/x\\.log\", reason: \"No such file or "
-                         "directory\"";
-  EXPECT_TRUE(matches(err[0], expected)) << err[0];
-  EXPECT_TRUE(matches(err[1], expected)) << err[1];
-  EXPECT_EQ(std::string::npos, c.err.find("lost"));
-  auto file = msgtest::lines(log());
+                         tmp.path() + "missing-dir/x\\.log\", reason: \"No such file or directory\"";
+  EXPECT_TRUE(stamped(err[0], expected)) << err[0];
+  EXPECT_TRUE(stamped(err[1], expected)) << err[1];
+  auto file = lines(log());
   ASSERT_EQ(1u, file.size());
   EXPECT_NE(std::string::npos, file[0].find("KLP8999D written"));
 }
 
 TEST_F(LoggerTest, LogFileIsNotKeptOpenBetweenLines) {
   msgLogger l(MSG_APP_KLPKCCMD, 0);
-  l.loadBuiltinMsgs(builtinMsgTable);
-  l.setLogFileName(tmp.path().c_str(), "test.log");
+  prepare(l, false);
   l.putKlpMsg(8999, MSG_DEST_LOGFILE, "o", "t", "one");
   // Moving the file away between lines: the next line starts a new file.
   ASSERT_EQ(0, rename(logPath().c_str(), (tmp.path() + "moved.log").c_str()));
@@ -197,32 +175,28 @@ TEST_F(LoggerTest, LogFileNameJoining) {
 }
 
 TEST_F(LoggerTest, StopAndRestartLogging) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
+  auto c = inChild([&] {
     msgLogger l(MSG_APP_KLPKCCMD, 0);
-    l.loadBuiltinMsgs(builtinMsgTable);
-    l.setLogFileName(tmp.path().c_str(), "test.log");
+    prepare(l, false);
     l.stopLogging();
     l.putKlpMsg(8999, MSG_DEST_LOGFILE | MSG_DEST_STDOUT, "o", "t", "while stopped");
     l.restartLogging("restarter");
     l.putKlpMsg(8999, MSG_DEST_LOGFILE, "o", "t", "after");
     return 0;
   });
-  ASSERT_TRUE(c.finished);
+  ASSERT_TRUE(c.exited);
   EXPECT_NE(std::string::npos, c.out.find("KLP8999D while stopped"));  // console still served
-  auto file = msgtest::lines(log());
+  auto file = lines(log());
   ASSERT_EQ(2u, file.size()) << log();
-  EXPECT_TRUE(matches(file[0], std::string(kStamp) +
-                                   " <restarter> KLP8999D Message logging re-enabled"))
+  EXPECT_TRUE(stamped(file[0], "<restarter> KLP8999D Message logging re-enabled"))
       << file[0];
   EXPECT_NE(std::string::npos, file[1].find("KLP8999D after"));
 }
 
 TEST_F(LoggerTest, ProcessWideFunctions) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
+  auto c = inChild([&] {
     msgLogger* l = new msgLogger(MSG_APP_KLPKCCMD, 0);
-    l->loadBuiltinMsgs(builtinMsgTable);
-    l->setProgramQualifier("KLP");
-    l->setLogFileName(tmp.path().c_str(), "test.log");
+    prepare(*l);
     klpSetProcessLogger(l);
     logKlpMsg(-1, "free", KLP_DEST_CONSOLE, "just text", nullptr, 0);
     logKlpMsg(8006, "elem", KLP_DEST_LOG, "X", nullptr, 0);  // file only, console flag off
@@ -234,11 +208,11 @@ TEST_F(LoggerTest, ProcessWideFunctions) {
     delete l;
     return logKlpMsg(8999, "o", 1, "x", nullptr, 0) == 0 ? 1 : 0;  // no logger: refused
   });
-  ASSERT_TRUE(c.finished);
+  ASSERT_TRUE(c.exited);
   EXPECT_EQ(0, c.exitCode);
-  auto out = msgtest::lines(c.out);
+  auto out = lines(c.out);
   ASSERT_EQ(2u, out.size()) << c.out;
-  EXPECT_TRUE(matches(out[0], std::string(kStamp) + " KLP8999D just text")) << out[0];
+  EXPECT_TRUE(stamped(out[0], "KLP8999D just text")) << out[0];
   EXPECT_NE(std::string::npos,
             out[1].find("KLP8005D  \"KlpKCcmd\" : \"KLP\" : \"\" : Thread \"thr\" is in "
                         "un-expected state \"7\"."));
@@ -276,7 +250,7 @@ TEST_F(LoggerTest, CaptureContextStaysInsideItsBuffer) {
   EXPECT_EQ(strlen(big + 2), len);
 
   char alsoBuf[2 + 64];
-  auto c = msgtest::inChild(tmp.path(), [&] {
+  auto c = inChild([&] {
     return logKlpMsgAndText(-1, "o", 2, alsoBuf, 64, "both ways", 0) == 0 &&
                    std::string(alsoBuf + 2) == "KLP8999D both ways"
                ? 0
@@ -288,7 +262,7 @@ TEST_F(LoggerTest, CaptureContextStaysInsideItsBuffer) {
 }
 
 TEST_F(LoggerTest, SqlAndQueueErrors) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
+  auto c = inChild([&] {
     msgLogger l(MSG_APP_KLPKCCMD, 0);
     l.setProgramQualifier("KLP");
     klpSetProcessLogger(&l);
@@ -308,8 +282,8 @@ TEST_F(LoggerTest, SqlAndQueueErrors) {
     klpSetProcessLogger(nullptr);
     return 0;
   });
-  ASSERT_TRUE(c.finished);
-  auto out = msgtest::lines(c.out);
+  ASSERT_TRUE(c.exited);
+  auto out = lines(c.out);
   ASSERT_EQ(4u, out.size()) << c.out;
   std::string tokens(70, 'T');
   EXPECT_NE(std::string::npos,
@@ -324,7 +298,7 @@ TEST_F(LoggerTest, SqlAndQueueErrors) {
 }
 
 TEST_F(LoggerTest, DefinitionsHeaderAlwaysEndsWithEndif) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
+  auto c = inChild([&] {
     if (chdir(tmp.path().c_str()) != 0) return 2;
     msgLogger l(MSG_APP_KLPKCCMD, 0);
     l.loadBuiltinMsgs(builtinMsgTable);
@@ -337,7 +311,7 @@ TEST_F(LoggerTest, DefinitionsHeaderAlwaysEndsWithEndif) {
     msgCloseMsgHeader();
     return first.size() > 7 && first.compare(first.size() - 7, 7, "#endif\n") == 0 ? 0 : 3;
   });
-  ASSERT_TRUE(c.finished);
+  ASSERT_TRUE(c.exited);
   EXPECT_EQ(0, c.exitCode);
   std::string h = klptest::readFile(tmp.path() + "klpmsgd.h");
   ASSERT_GT(h.size(), 7u);
@@ -362,7 +336,7 @@ TEST_F(LoggerTest, DefinitionsHeaderAlwaysEndsWithEndif) {
 }
 
 TEST_F(LoggerTest, DefinitionsHeaderOpenFailureReportedOnce) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
+  auto c = inChild([&] {
     if (chdir(tmp.path().c_str()) != 0) return 2;
     if (mkdir("klpmsgd.h", 0700) != 0) return 3;  // a directory cannot be opened as the file
     msgLogger l(MSG_APP_KLPKCCMD, 0);
@@ -371,9 +345,9 @@ TEST_F(LoggerTest, DefinitionsHeaderOpenFailureReportedOnce) {
     l.putKlpMsg(8999, MSG_DEST_HEADER, "o", "t", "two");
     return 0;
   });
-  ASSERT_TRUE(c.finished);
+  ASSERT_TRUE(c.exited);
   EXPECT_EQ(0, c.exitCode);
-  auto err = msgtest::lines(c.err);
+  auto err = lines(c.err);
   ASSERT_EQ(3u, err.size()) << c.err;
   EXPECT_EQ(0u, err[0].find("KLP0514E \"KlpKCcmd\" : \"\" : \"t\" :  The program could not open "
                             "the log file named \"klpmsgd.h\", reason: \""))
@@ -383,10 +357,9 @@ TEST_F(LoggerTest, DefinitionsHeaderOpenFailureReportedOnce) {
 }
 
 TEST_F(LoggerTest, AsynchronousModeQueuesFileOutput) {
-  auto c = msgtest::inChild(tmp.path(), [&] {
+  auto c = inChild([&] {
     msgLogger l(MSG_APP_KLPKCCMD, 1);
-    l.loadBuiltinMsgs(builtinMsgTable);
-    l.setLogFileName(tmp.path().c_str(), "test.log");
+    prepare(l, false);
     l.putKlpMsg(8999, MSG_DEST_LOGFILE | MSG_DEST_STDOUT, "o", "t", "first");
     l.putKlpMsg(8999, MSG_DEST_LOGFILE, "o", "t", "second");
     // The console was served at once; the file waits for the logger thread.
@@ -411,12 +384,12 @@ TEST_F(LoggerTest, AsynchronousModeQueuesFileOutput) {
     l.stopLogging();
     return served == 40 ? 0 : 6;
   });
-  ASSERT_TRUE(c.finished);
+  ASSERT_TRUE(c.exited);
   EXPECT_EQ(0, c.exitCode);
-  auto out = msgtest::lines(c.out);
+  auto out = lines(c.out);
   ASSERT_EQ(1u, out.size()) << c.out;
   EXPECT_NE(std::string::npos, out[0].find("KLP8999D first"));
-  auto file = msgtest::lines(log());
+  auto file = lines(log());
   ASSERT_EQ(43u, file.size()) << log();
   EXPECT_NE(std::string::npos, file[0].find("KLP8999D first"));
   EXPECT_NE(std::string::npos, file[1].find("KLP8999D second"));

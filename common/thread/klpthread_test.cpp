@@ -17,14 +17,6 @@ std::atomic<int> g_endWith{0};         // end code of the "end" body
 std::atomic<klpThread*> g_seenCurrent{nullptr};
 std::atomic<int> g_seenState{0};
 
-void reset() {
-  g_release = false;
-  g_runs = 0;
-  g_endWith = 0;
-  g_seenCurrent = nullptr;
-  g_seenState = 0;
-}
-
 // Ends at once with g_endWith.
 void endBody(klpThread* t) {
   klpThread::prologue(t);
@@ -79,14 +71,6 @@ void restartBody(klpThread* t) {
 // Returns without ending itself.
 void returningBody(klpThread* t) { klpThread::prologue(t); }
 
-klpThread* make(OrdList* list, klpThreadRoutine body, const char* name, int restart = 1,
-                int critical = 0, void* userData = nullptr) {
-  int code = -1;
-  klpThread* t = createThread(&code, list, body, name, nullptr, restart, userData, 0, critical);
-  EXPECT_EQ(0, code);
-  return t;
-}
-
 bool waitState(klpThread* t, int32_t s) {
   return thrtest::waitFor([&] { return t->getState() == s; });
 }
@@ -102,6 +86,28 @@ void reapWithdrawn(klpThread* t) {
 }
 
 bool onIdList(klpThread* t) { return t->tid.oleAnchor == klpThreadIdList(); }
+
+// Real threads on a shared list, with the main thread registered first.
+struct MtThread : ::testing::Test {
+  klpThread* mainThr = thrtest::mainReady();
+  thrtest::LogCapture cap;
+  OrdList list{"Threads"};
+  int highest = 0;
+  void SetUp() override {
+    g_release = false;
+    g_runs = 0;
+    g_endWith = 0;
+    list.makeShared(nullptr, 1);
+  }
+  klpThread* make(klpThreadRoutine body, const char* name, int restart = 1, int critical = 0,
+                  void* userData = nullptr) {
+    int code = -1;
+    klpThread* t = createThread(&code, &list, body, name, nullptr, restart, userData, 0, critical);
+    EXPECT_EQ(0, code);
+    return t;
+  }
+  int supervise() { return ::supervise(&list, 0, &highest); }
+};
 
 TEST(KlpThread, NamesAreCutTo14AndNewThreadsWantStopResumeSuspend) {
   thrtest::LogCapture cap;
@@ -141,45 +147,27 @@ TEST(KlpThread, PrintShowsNameStateCodeAndRestart) {
             c.out);
 }
 
-TEST(KlpThread, TheMainThreadEndsTheProcessWith12Or0) {
-  thrtest::mainReady();
-  thrtest::LogCapture cap;
-  auto bad = thrtest::inChild(cap.dir(), [] {
-    threadEnd(klpMainThread(), 5);
-    return 99;
-  });
-  EXPECT_TRUE(bad.exited);
-  EXPECT_EQ(12, bad.exitCode);
-  auto good = thrtest::inChild(cap.dir(), [] {
-    threadEnd(klpMainThread(), 0);
-    return 99;
-  });
-  EXPECT_EQ(0, good.exitCode);
-}
-
-TEST(KlpThread, TheFirstPrologueNamesTheMainThreadInitial) {
-  klpThread* m = thrtest::mainReady();
-  EXPECT_STREQ("Initial", m->name);
-  EXPECT_EQ(KLP_THREAD_RUN, m->getState());
-  EXPECT_EQ(m, currentThread());
+TEST_F(MtThread, TheMainThreadIsInitialAndEndsTheProcessWith12Or0) {
+  EXPECT_STREQ("Initial", mainThr->name);
+  EXPECT_EQ(KLP_THREAD_RUN, mainThr->getState());
+  EXPECT_EQ(mainThr, currentThread());
   EXPECT_STREQ("KlpThreadIDList", klpThreadIdList()->qName);
   EXPECT_EQ(1, klpThreadIdList()->locked);
   EXPECT_EQ(0, klpThreadIdList()->ownerCheck());
-  EXPECT_EQ(nullptr, m->cmdList);
-  EXPECT_EQ(klpSharedCmdList(), m->sharedCmdList);
+  EXPECT_EQ(klpSharedCmdList(), mainThr->sharedCmdList);
+  for (int end : {5, 0}) {
+    auto c = thrtest::inChild(cap.dir(), [end] {
+      threadEnd(klpMainThread(), end);
+      return 99;
+    });
+    EXPECT_TRUE(c.exited);
+    EXPECT_EQ(end ? 12 : 0, c.exitCode);
+  }
 }
 
-// ---------------------------------------------------------------------------
-// With real threads
-// ---------------------------------------------------------------------------
-TEST(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
-  thrtest::mainReady();
-  thrtest::LogCapture cap;
-  reset();
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
+TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
   void* data = malloc(64);  // freed by the thread's end
-  klpThread* t = make(&list, workBody, "Worker", 1, 0, data);
+  klpThread* t = make(workBody, "Worker", 1, 0, data);
   ASSERT_NE(nullptr, t);
   ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
   EXPECT_EQ(t, g_seenCurrent.load());
@@ -188,7 +176,6 @@ TEST(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
   EXPECT_EQ(0, threadStateByName(&list, "Work"));
   EXPECT_STREQ("Worker", t->cmdList->qName);
   EXPECT_EQ(1, t->cmdList->locked);
-  EXPECT_EQ(&t->dbCtx.ole, t->dbCtxList.olHead);
   EXPECT_TRUE(onIdList(t));
   EXPECT_EQ(1, list.count);
   g_release = true;
@@ -203,10 +190,7 @@ TEST(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
   EXPECT_NE(std::string::npos, log.rfind("Worker\"", at)) << log;
 }
 
-TEST(MtThread, ABodyThatReturnsEndsAs2011AndTheSharedCommandListCanBeUsed) {
-  thrtest::mainReady();
-  OrdList list;
-  list.makeShared("Threads", 1);
+TEST_F(MtThread, ABodyThatReturnsEndsAs2011AndTheSharedCommandListCanBeUsed) {
   int code = -1;
   klpThread* t = createThread(&code, &list, returningBody, "Returner", "MYDB", 1, nullptr, 1, 0);
   ASSERT_EQ(0, code);
@@ -218,14 +202,9 @@ TEST(MtThread, ABodyThatReturnsEndsAs2011AndTheSharedCommandListCanBeUsed) {
   EXPECT_EQ(1, klpSharedCmdList()->locked);
 }
 
-TEST(MtThread, StopOfAnEndedThreadReturnsItsEndCodeAndRemovesIt) {
-  thrtest::mainReady();
-  thrtest::LogCapture cap;
-  reset();
+TEST_F(MtThread, StopOfAnEndedThreadReturnsItsEndCodeAndRemovesIt) {
   g_endWith = 77;
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* t = make(&list, endBody, "Ender");
+  klpThread* t = make(endBody, "Ender");
   ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
   EXPECT_FALSE(onIdList(t));  // an ended thread's id may be reused
   EXPECT_EQ(77, klpThread::stop(t));
@@ -234,22 +213,16 @@ TEST(MtThread, StopOfAnEndedThreadReturnsItsEndCodeAndRemovesIt) {
   EXPECT_TRUE(cap.issuedWith(590, {"Initial", "77", "Ender"})) << cap.log();
 }
 
-TEST(MtThread, StopInterruptsTheDbWorkOfAWorkingThread) {
-  thrtest::mainReady();
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* t = make(&list, dbBody, "DbWorker");
+TEST_F(MtThread, StopInterruptsTheDbWorkOfAWorkingThread) {
+  klpThread* t = make(dbBody, "DbWorker");
   ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
   ASSERT_TRUE(thrtest::waitFor([&] { return t->getCurDbConn() != nullptr; }));
   EXPECT_EQ(5, klpThread::stop(t));  // it ended during the stop's wait
   EXPECT_EQ(0, list.count);
 }
 
-TEST(MtThread, AThreadThatCannotBeBroughtToAnEndIsWithdrawn) {
-  thrtest::mainReady();
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* t = make(&list, restBody, "Rester");
+TEST_F(MtThread, AThreadThatCannotBeBroughtToAnEndIsWithdrawn) {
+  klpThread* t = make(restBody, "Rester");
   ASSERT_TRUE(waitState(t, KLP_THREAD_REST));
   EXPECT_EQ(KLP_RC_RECOVERED, klpThread::stop(t));
   EXPECT_EQ(1, t->ole.withdrawn);
@@ -264,75 +237,48 @@ TEST(MtThread, AThreadThatCannotBeBroughtToAnEndIsWithdrawn) {
   reapWithdrawn(t);
 }
 
-TEST(MtThread, StopAllToleratesOneUnstoppableHoldLThread) {
-  thrtest::mainReady();
-  reset();
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* hold = make(&list, holdBody, "HoldLThread");
-  klpThread* done = make(&list, endBody, "Done");
-  ASSERT_TRUE(waitState(hold, KLP_THREAD_REST));
-  ASSERT_TRUE(waitState(done, KLP_THREAD_STOP));
-  EXPECT_EQ(0, stopAll(&list));
-  EXPECT_EQ(1, list.count);  // only the withdrawn HoldLThread is left
-  EXPECT_EQ(&hold->ole, list.olHead);
-  g_release = true;
-  reapWithdrawn(hold);
+TEST_F(MtThread, StopAllToleratesOnlyAnUnstoppableHoldLThread) {
+  for (const char* name : {"HoldLThread", "HoldOn"}) {
+    SCOPED_TRACE(name);
+    g_release = false;
+    klpThread* hold = make(holdBody, name);
+    klpThread* done = make(endBody, "Done");
+    ASSERT_TRUE(waitState(hold, KLP_THREAD_REST));
+    ASSERT_TRUE(waitState(done, KLP_THREAD_STOP));
+    EXPECT_EQ(std::string(name) == "HoldLThread" ? 0 : KLP_RC_RECOVERED, stopAll(&list));
+    EXPECT_EQ(1, hold->ole.withdrawn);
+    EXPECT_EQ(1, list.count);  // only the withdrawn one is left
+    EXPECT_EQ(&hold->ole, list.olHead);
+    g_release = true;
+    reapWithdrawn(hold);
+  }
 }
 
-TEST(MtThread, StopAllFailsForAnyOtherUnstoppableThread) {
-  thrtest::mainReady();
-  reset();
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* other = make(&list, holdBody, "HoldOn");
-  ASSERT_TRUE(waitState(other, KLP_THREAD_REST));
-  EXPECT_EQ(KLP_RC_RECOVERED, stopAll(&list));
-  EXPECT_EQ(1, other->ole.withdrawn);
-  g_release = true;
-  reapWithdrawn(other);
-}
-
-TEST(MtThread, SupervisionOfEmptyAndMissingLists) {
-  thrtest::mainReady();
-  OrdList list("Threads");
-  int highest = 0;
-  EXPECT_EQ(0, supervise(nullptr, 0, &highest));
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));
-}
-
-TEST(MtThread, SupervisionSeesCriticalAndNonCriticalLiveThreads) {
-  thrtest::mainReady();
-  reset();
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* plain = make(&list, workBody, "Plain");
+TEST_F(MtThread, SupervisionSeesCriticalAndNonCriticalLiveThreads) {
+  EXPECT_EQ(0, ::supervise(nullptr, 0, &highest));
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());
+  klpThread* plain = make(workBody, "Plain");
   ASSERT_TRUE(waitState(plain, KLP_THREAD_RUN));
-  int highest = 0;
-  EXPECT_EQ(KLP_RC_NO_CRITICAL, supervise(&list, 0, &highest));
-  klpThread* crit = make(&list, workBody, "Critical", 1, 1);
+  EXPECT_EQ(KLP_RC_NO_CRITICAL, supervise());
+  klpThread* crit = make(workBody, "Critical", 1, 1);
   ASSERT_TRUE(waitState(crit, KLP_THREAD_RUN));
-  EXPECT_EQ(0, supervise(&list, 0, &highest));
+  EXPECT_EQ(0, supervise());
   g_release = true;
   ASSERT_TRUE(waitState(plain, KLP_THREAD_STOP));
   ASSERT_TRUE(waitState(crit, KLP_THREAD_STOP));
   // Both ended with 0 (2011) and restart set: removed, nothing alive.
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());
   EXPECT_EQ(0, list.count);
 }
 
-TEST(MtThread, SupervisionReportsAFinishedThreadWhileOthersLive) {
-  thrtest::mainReady();
-  reset();
+TEST_F(MtThread, SupervisionReportsAFinishedThreadWhileOthersLive) {
   g_endWith = 9;
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* crit = make(&list, workBody, "Critical", 1, 1);
-  klpThread* gone = make(&list, endBody, "Gone", 0);
+  klpThread* crit = make(workBody, "Critical", 1, 1);
+  klpThread* gone = make(endBody, "Gone", 0);
   ASSERT_TRUE(waitState(crit, KLP_THREAD_RUN));
   ASSERT_TRUE(waitState(gone, KLP_THREAD_STOP));
-  int highest = 3;
-  EXPECT_EQ(KLP_RC_THREAD_FINISHED, supervise(&list, 0, &highest));
+  highest = 3;
+  EXPECT_EQ(KLP_RC_THREAD_FINISHED, supervise());
   EXPECT_EQ(9, highest);
   EXPECT_EQ(1, list.count);
   g_release = true;
@@ -340,73 +286,56 @@ TEST(MtThread, SupervisionReportsAFinishedThreadWhileOthersLive) {
   EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(crit));
 }
 
-TEST(MtThread, SupervisionKeepsA2001ThreadOnePassThenRemovesIt) {
-  thrtest::mainReady();
-  reset();
+TEST_F(MtThread, SupervisionKeepsA2001ThreadOnePassThenRemovesIt) {
   g_endWith = KLP_RC_TERMINATED;
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* t = make(&list, endBody, "Terminated");
+  klpThread* t = make(endBody, "Terminated");
   ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  int highest = 0;
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());
   EXPECT_EQ(1, list.count);
   EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());
   EXPECT_EQ(0, list.count);
   EXPECT_EQ(0, highest);
   EXPECT_EQ(1, g_runs.load());  // never started again
 }
 
-TEST(MtThread, SupervisionRestartsAThreadThatEndedWithAnotherCode) {
-  thrtest::mainReady();
-  reset();
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* t = make(&list, restartBody, "Restarted");
+TEST_F(MtThread, SupervisionRestartsAThreadThatEndedWithAnotherCode) {
+  klpThread* t = make(restartBody, "Restarted");
   ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
   ASSERT_EQ(9, t->getEndCode());
-  int highest = 0;
-  EXPECT_EQ(KLP_RC_NO_CRITICAL, supervise(&list, 0, &highest));  // restarted: alive
+  EXPECT_EQ(KLP_RC_NO_CRITICAL, supervise());  // restarted: alive
   ASSERT_TRUE(thrtest::waitFor([&] { return g_runs == 2 && t->getState() == KLP_THREAD_STOP; }));
   EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise(&list, 0, &highest));  // 2011: removed
+  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());  // 2011: removed
   EXPECT_EQ(0, list.count);
 }
 
-TEST(MtThread, SupervisionPassesOnAShutdownCode) {
-  thrtest::mainReady();
-  reset();
+TEST_F(MtThread, SupervisionPassesOnAShutdownCode) {
   g_endWith = KLP_RC_SHUTDOWN;
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  klpThread* t = make(&list, endBody, "Shutdown", 0);
+  klpThread* t = make(endBody, "Shutdown", 0);
   ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  int highest = 0;
-  EXPECT_EQ(KLP_RC_SHUTDOWN, supervise(&list, 0, &highest));
+  EXPECT_EQ(KLP_RC_SHUTDOWN, supervise());
   EXPECT_EQ(KLP_RC_SHUTDOWN, highest);
   EXPECT_EQ(0, list.count);
 }
 
-TEST(MtThread, SleepingShowsRestingUnlessWaitingForDb) {
-  thrtest::mainReady();
-  klpThread* m = klpMainThread();
+TEST_F(MtThread, SleepingShowsRestingUnlessWaitingForDb) {
   std::atomic<int> seen{0};
   std::atomic<bool> sleeping{false};
   std::thread watcher([&] {
     thrtest::waitFor([&] { return sleeping.load(); });
-    thrtest::waitFor([&] { return m->getState() == KLP_THREAD_REST; }, 1000);
-    seen = m->getState();
+    thrtest::waitFor([&] { return mainThr->getState() == KLP_THREAD_REST; }, 1000);
+    seen = mainThr->getState();
   });
   sleeping = true;
   klpRestingSleep(300);
   watcher.join();
   EXPECT_EQ(KLP_THREAD_REST, seen.load());
-  EXPECT_EQ(KLP_THREAD_RUN, m->getState());  // restored
-  m->setState(KLP_THREAD_DBWAIT);
+  EXPECT_EQ(KLP_THREAD_RUN, mainThr->getState());  // restored
+  mainThr->setState(KLP_THREAD_DBWAIT);
   klpRestingSleep(10);
-  EXPECT_EQ(KLP_THREAD_DBWAIT, m->getState());
-  m->setState(KLP_THREAD_RUN);
+  EXPECT_EQ(KLP_THREAD_DBWAIT, mainThr->getState());
+  mainThr->setState(KLP_THREAD_RUN);
 }
 
 TEST(KlpThread, ConnectionLookupCreatesOnlyForKindO) {

@@ -35,39 +35,28 @@ void expectSound(OrdList& l) {
   EXPECT_EQ(n, l.count);
 }
 
-TEST(OrdList, PutTailComesOutOfTheHeadInOrderWithCounts) {
+TEST(OrdList, BothEndsTakeAndGiveInOrderWithCounts) {
   OrdList l;
   Item a(1), b(2), c(3);
-  ASSERT_EQ(0, l.putTail(&a.ole));
-  ASSERT_EQ(0, l.putTail(&b.ole));
-  ASSERT_EQ(0, l.putTail(&c.ole));
+  for (Item* i : {&a, &b, &c}) ASSERT_EQ(0, l.putTail(&i->ole));
   EXPECT_EQ(3, l.count);
   expectSound(l);
   EXPECT_EQ(1, valueOf(l.getHead()));
   EXPECT_EQ(2, l.count);
-  EXPECT_EQ(2, valueOf(l.getHead()));
-  EXPECT_EQ(1, l.count);
+  EXPECT_EQ(3, valueOf(l.getTail()));
   OrdListElement* last = l.getHead();
-  EXPECT_EQ(3, valueOf(last));
-  EXPECT_EQ(0, l.count);
+  EXPECT_EQ(2, valueOf(last));
+  expectSound(l);
   EXPECT_EQ(nullptr, l.olHead);
-  EXPECT_EQ(nullptr, l.olTail);
   EXPECT_EQ(nullptr, last->oleAnchor);
   EXPECT_EQ(nullptr, l.getHead());
   EXPECT_EQ(nullptr, l.getTail());
-}
-
-TEST(OrdList, PutHeadReversesAndGetTailTakesTheOtherEnd) {
-  OrdList l;
-  Item a(1), b(2), c(3);
-  l.putHead(&a.ole);
-  l.putHead(&b.ole);
-  l.putHead(&c.ole);
+  // putHead reverses.
+  for (Item* i : {&a, &b, &c}) ASSERT_EQ(0, l.putHead(&i->ole));
   expectSound(l);
-  EXPECT_EQ(1, valueOf(l.getTail()));
   EXPECT_EQ(3, valueOf(l.getHead()));
+  EXPECT_EQ(1, valueOf(l.getTail()));
   EXPECT_EQ(2, valueOf(l.getHead()));
-  EXPECT_EQ(0, l.count);
 }
 
 TEST(OrdList, BrowsingSkipsWithdrawnElementsInBothDirections) {
@@ -95,22 +84,16 @@ TEST(OrdList, DeChainFromEveryPositionKeepsTheChainSound) {
   OrdList l;
   Item a(1), b(2), c(3), d(4);
   for (Item* i : {&a, &b, &c, &d}) l.putTail(&i->ole);
-  EXPECT_EQ(0, ordListDeChain(&b.ole));  // middle
-  expectSound(l);
-  EXPECT_EQ(0, ordListDeChain(&a.ole));  // head
-  expectSound(l);
-  EXPECT_EQ(0, ordListDeChain(&d.ole));  // tail
-  expectSound(l);
+  for (Item* i : {&b, &a, &d}) {  // middle, head, tail
+    EXPECT_EQ(0, ordListDeChain(&i->ole));
+    expectSound(l);
+  }
   EXPECT_EQ(3, valueOf(l.olHead));
   EXPECT_EQ(0, ordListDeChain(&c.ole));  // the only one
+  expectSound(l);
   EXPECT_EQ(nullptr, l.olHead);
-  EXPECT_EQ(nullptr, l.olTail);
-  EXPECT_EQ(0, l.count);
-  for (Item* i : {&a, &b, &c, &d}) {
-    EXPECT_EQ(nullptr, i->ole.oleAnchor);
-    EXPECT_EQ(nullptr, i->ole.olePrev);
-    EXPECT_EQ(nullptr, i->ole.oleNext);
-  }
+  for (Item* i : {&a, &b, &c, &d})
+    EXPECT_TRUE(!i->ole.oleAnchor && !i->ole.olePrev && !i->ole.oleNext) << i->value;
   EXPECT_EQ(0, ordListDeChain(&a.ole));  // on no list: nothing
   EXPECT_EQ(0, ordListDeChain(nullptr));
 }
@@ -176,52 +159,41 @@ TEST(OrdList, PrintShowsNamesAndSixteenDigitAddresses) {
     return 0;
   });
   ASSERT_TRUE(c.exited);
-  EXPECT_NE(std::string::npos, c.out.find("OrdList:print entered for list PrintMe\n")) << c.out;
-  EXPECT_NE(std::string::npos, c.out.find(" qName=PrintMe\n"));
-  EXPECT_NE(std::string::npos, c.out.find("OrdList:print exit for list PrintMe\n"));
-  EXPECT_NE(std::string::npos, c.out.find(" olTail=0000"));  // 16 digits, zero-padded
-  EXPECT_NE(std::string::npos, c.out.find(" oleName=PrintMe\n"));
-  EXPECT_NE(std::string::npos, c.out.find(" olePrev=0000000000000000\n"));
+  for (const char* part : {"OrdList:print entered for list PrintMe\n", " qName=PrintMe\n",
+                           "OrdList:print exit for list PrintMe\n",
+                           " olTail=0000",  // 16 digits, zero-padded
+                           " oleName=PrintMe\n", " olePrev=0000000000000000\n"})
+    EXPECT_NE(std::string::npos, c.out.find(part)) << part << " in\n" << c.out;
 }
 
-TEST(OrdList, ADamagedEyeCatcherIsFatalWithDiagnosticsOnStandardOutput) {
+TEST(OrdList, ADamagedElementOrListIsFatalWithDiagnosticsOnStandardOutput) {
   thrtest::LogCapture cap;
-  auto c = thrtest::inChild(cap.dir(), [] {
-    OrdList l;
-    Item a(1);
-    memset(a.ole.eyeCatcher, 0x01, sizeof a.ole.eyeCatcher);
-    l.putTail(&a.ole);
-    return 0;  // not reached
-  });
-  EXPECT_FALSE(c.exited);
-  EXPECT_EQ(SIGABRT, c.signal);
-  EXPECT_NE(std::string::npos, c.out.find("KLP fatal error in OrdList::putTail")) << c.out;
+  for (bool damageList : {false, true}) {
+    auto c = thrtest::inChild(cap.dir(), [damageList] {
+      OrdList l("Shared");
+      Item a(1);
+      if (damageList) {  // a locked list whose self pointer is wrong
+        l.makeShared(nullptr, 1);
+        l.self = nullptr;
+      } else {
+        memset(a.ole.eyeCatcher, 0x01, sizeof a.ole.eyeCatcher);
+      }
+      l.putTail(&a.ole);
+      return 0;  // not reached
+    });
+    EXPECT_FALSE(c.exited);
+    EXPECT_EQ(SIGABRT, c.signal);
+    EXPECT_NE(std::string::npos, c.out.find(damageList ? "OrdList" : "KLP fatal error in OrdList::putTail"))
+        << c.out;
+  }
 }
 
-TEST(OrdList, ALockedListWhoseSelfPointerIsWrongIsFatal) {
-  thrtest::LogCapture cap;
-  auto c = thrtest::inChild(cap.dir(), [] {
-    OrdList l("Shared");
-    l.makeShared(nullptr, 1);
-    l.self = nullptr;
-    Item a(1);
-    l.putTail(&a.ole);
-    return 0;
-  });
-  EXPECT_EQ(SIGABRT, c.signal);
-  EXPECT_NE(std::string::npos, c.out.find("OrdList")) << c.out;
-}
-
-// ---------------------------------------------------------------------------
-// The lock, with real threads
-// ---------------------------------------------------------------------------
+// The lock, with real threads.
 TEST(MtOrdList, TheOwnerReentersThreeDeepAndOthersWaitForTheLastRelease) {
   thrtest::mainReady();
   OrdList l("Reentry");
   l.makeShared(nullptr, 1);
-  ASSERT_EQ(0, l.lockList());
-  ASSERT_EQ(0, l.lockList());
-  ASSERT_EQ(0, l.lockList());
+  for (int i = 0; i < 3; ++i) ASSERT_EQ(0, l.lockList());
   EXPECT_EQ(3, l.depth());
   EXPECT_EQ(klpMainThread(), l.owner());
   Item a(1);
@@ -236,8 +208,7 @@ TEST(MtOrdList, TheOwnerReentersThreeDeepAndOthersWaitForTheLastRelease) {
   });
   hsvSleep(100);
   EXPECT_FALSE(entered);
-  EXPECT_EQ(0, l.unlockList());
-  EXPECT_EQ(0, l.unlockList());
+  for (int i = 0; i < 2; ++i) EXPECT_EQ(0, l.unlockList());
   hsvSleep(100);
   EXPECT_FALSE(entered) << "entered before the owner's last release";
   EXPECT_EQ(0, l.unlockList());

@@ -6,7 +6,6 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <functional>
@@ -86,16 +85,9 @@ class LogCapture {
   // The value lines of message `number` ("#n|..." each).
   std::vector<std::string> issued(int number) const {
     std::vector<std::string> out;
-    std::string all = klptest::readFile(tmp_.path() + "values.txt");
     std::string key = "#" + std::to_string(number) + "|";
-    size_t start = 0;
-    while (start < all.size()) {
-      size_t nl = all.find('\n', start);
-      if (nl == std::string::npos) nl = all.size();
-      std::string line = all.substr(start, nl - start);
+    for (const std::string& line : klptest::lines(klptest::readFile(tmp_.path() + "values.txt")))
       if (line.compare(0, key.size(), key) == 0) out.push_back(line);
-      start = nl + 1;
-    }
     return out;
   }
   // True when message `number` was issued with every one of the values.
@@ -103,9 +95,7 @@ class LogCapture {
     for (const std::string& line : issued(number)) {
       bool all = true;
       for (const std::string& v : values)
-        if (line.find("|" + v + "|") == std::string::npos &&
-            line.compare(line.size() - v.size() - 1, v.size() + 1, "|" + v) != 0)
-          all = false;
+        if ((line + "|").find("|" + v + "|") == std::string::npos) all = false;
       if (all) return true;
     }
     return false;
@@ -120,61 +110,14 @@ class LogCapture {
 // Standard output without the logger's console lines.
 inline std::string withoutMessages(const std::string& out) {
   std::string kept;
-  size_t start = 0;
-  while (start < out.size()) {
-    size_t nl = out.find('\n', start);
-    if (nl == std::string::npos) nl = out.size() - 1;
-    std::string line = out.substr(start, nl - start + 1);
-    if (line.find(" KLP") == std::string::npos || line.compare(0, 2, "20") != 0) kept += line;
-    start = nl + 1;
-  }
+  for (const std::string& line : klptest::lines(out))
+    if (line.find(" KLP") == std::string::npos || line.compare(0, 2, "20") != 0) kept += line + "\n";
   return kept;
 }
 
-struct Child {
-  bool exited = false;  // ended by exit (not a signal, not timed out)
-  int exitCode = -1;
-  int signal = 0;       // terminating signal
-  std::string out;
-};
-
-// Runs body in a forked child with standard output in a file under dir; the
-// child exits with body's answer. Waits at most timeoutMs, then kills it.
-inline Child inChild(const std::string& dir, const std::function<int()>& body,
-                     int timeoutMs = 10000) {
-  static int serial = 0;
-  std::string outFile = dir + "child" + std::to_string(++serial) + ".out";
-  fflush(stdout);
-  fflush(stderr);
-  Child c;
-  pid_t pid = fork();
-  if (pid == 0) {
-    int o = open(outFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    if (o < 0) _exit(99);
-    dup2(o, 1);
-    int rc = body();
-    fflush(stdout);
-    _exit(rc);
-  }
-  if (pid < 0) return c;
-  int status = 0;
-  for (int waited = 0;; waited += 10) {
-    if (waitpid(pid, &status, WNOHANG) == pid) {
-      c.exited = WIFEXITED(status);
-      c.exitCode = c.exited ? WEXITSTATUS(status) : -1;
-      c.signal = WIFSIGNALED(status) ? WTERMSIG(status) : 0;
-      break;
-    }
-    if (waited >= timeoutMs) {
-      kill(pid, SIGKILL);
-      waitpid(pid, &status, 0);
-      break;
-    }
-    hsvSleep(10);
-  }
-  c.out = klptest::readFile(outFile);
-  return c;
-}
+// Forked children with their output and exit status.
+using klptest::Child;
+using klptest::inChild;
 
 // Polls cond every 5 ms for at most ms milliseconds.
 inline bool waitFor(const std::function<bool()>& cond, int ms = 5000) {

@@ -26,8 +26,8 @@ class Fmt : public ::testing::Test {
  protected:
   void SetUp() override {
     const char* tz = getenv("TZ");
-    oldTz_ = tz ? tz : "";
     hadTz_ = tz != nullptr;
+    oldTz_ = tz ? tz : "";
     setenv("TZ", "UTC", 1);
     tzset();
   }
@@ -75,6 +75,11 @@ TEST_F(Fmt, IdentifiersAndTheirBufferBounds) {
   const uint8_t high[10] = {0xff, 0xfe, 0, 0, 0, 0, 0, 0, 0x80, 0x01};
   formatLogPosWords(buf, sizeof buf, "<", high, ">");
   EXPECT_STREQ("<fffe:0000:0000:0000:8001>", buf);
+  EXPECT_EQ(9, formatNumPair(buf, sizeof buf, "", 12, 345, ""));
+  EXPECT_STREQ("0012:0345", buf);
+  const uint8_t lsn[8] = {0x01, 0x23, 0x45, 0x67, 0x89, 0xab, 0xcd, 0xef};
+  EXPECT_EQ(16, formatLsn(buf, 50, "", lsn, ""));
+  EXPECT_STREQ("0123456789abcdef", buf);
 
   // Too small: nothing below 17 characters, else the notice; never a part.
   memset(buf, 'x', sizeof buf);
@@ -87,10 +92,11 @@ TEST_F(Fmt, IdentifiersAndTheirBufferBounds) {
   EXPECT_EQ(27, formatLogPosWords(buf, 40, "ab", kLogPos, "c"));
   EXPECT_EQ(15, formatLogPosBytes(buf, 41, "", kLogPos, ""));
   EXPECT_EQ(24, formatLogPosBytes(buf, 42, "", kLogPos, ""));
+  EXPECT_EQ(15, formatLsn(buf, 18, "ab", lsn, ""));
+  EXPECT_EQ(16, formatLsn(buf, 19, "ab", lsn, ""));
 
   // Variable identifiers: bytes past the count are not the identifier's.
-  auto five = varId({1, 2, 3, 4, 5}, 5);
-  EXPECT_EQ(14, formatVarId(buf, sizeof buf, "", five.data(), ""));
+  EXPECT_EQ(14, formatVarId(buf, sizeof buf, "", varId({1, 2, 3, 4, 5}, 5).data(), ""));
   EXPECT_STREQ("0102:0304:0500", buf);
   formatVarId(buf, sizeof buf, "<", varId({0x7f}, 1).data(), ">");
   EXPECT_STREQ("<7f00>", buf);
@@ -100,14 +106,6 @@ TEST_F(Fmt, IdentifiersAndTheirBufferBounds) {
   EXPECT_EQ(15, formatVarId(buf, 25, "", four.data(), ""));  // 2 x 4 + 4 / 2 + 15
   EXPECT_EQ(9, formatVarId(buf, 26, "", four.data(), ""));
   EXPECT_STREQ("dead:beef", buf);
-
-  EXPECT_EQ(9, formatNumPair(buf, sizeof buf, "", 12, 345, ""));
-  EXPECT_STREQ("0012:0345", buf);
-  const uint8_t lsn[8] = {0x01, 0x23, 0x45, 0x67, 0x89, 0xab, 0xcd, 0xef};
-  EXPECT_EQ(16, formatLsn(buf, 50, "", lsn, ""));
-  EXPECT_STREQ("0123456789abcdef", buf);
-  EXPECT_EQ(15, formatLsn(buf, 18, "ab", lsn, ""));
-  EXPECT_EQ(16, formatLsn(buf, 19, "ab", lsn, ""));
 
   testing::internal::CaptureStdout();
   printLogPosWords("[", kLogPos, "]");
@@ -139,7 +137,8 @@ TEST_F(Fmt, HexTextAndDump) {
   std::string line1 = "41420744 45464748 494A4B4C 4D4E4F50 51525354  AB.DEFGHIJKLMNOPQRST\n";
   std::string line2 = "55565758 59       " + std::string(27, ' ') + " UVWXY\n";
   char addr[32];
-  snprintf(addr, sizeof addr, " %08lx ", static_cast<unsigned long>(reinterpret_cast<uintptr_t>(data.data())));
+  snprintf(addr, sizeof addr, " %08lx ",
+           static_cast<unsigned long>(reinterpret_cast<uintptr_t>(data.data())));
   std::string line3 = std::string(addr) + "41420744 " + std::string(36, ' ') + " AB.D\n";
   EXPECT_EQ(line1 + line2 + line3, std::string(out, len));
   free(out);
@@ -167,14 +166,13 @@ TEST_F(Fmt, TimestampsParseAndPrint) {
   EXPECT_STREQ("1970-01-02T01:01:01.000005", buf);
   formatLocalTimestamp(90061, 0, buf, sizeof buf, false);
   EXPECT_STREQ("01-02-1970 01:01:01", buf);
-  formatUtcTimestamp(0, 0, buf, sizeof buf, 'C');
-  EXPECT_STREQ("Un-initialized", buf);
-  formatUtcTimestamp(90061, 42, buf, sizeof buf, 'C');
-  EXPECT_STREQ("01-02-1970 01:01:01.000042", buf);
-  formatUtcTimestamp(90061, 0, buf, sizeof buf, 'X');
-  EXPECT_STREQ("1970-01-02T01:01:01", buf);
-  formatUtcTimestamp(90061, 42, buf, sizeof buf, 'D');
-  EXPECT_STREQ("1970-01-02-01.01.01", buf);
+  struct Utc { int64_t s; int32_t us; char style; const char* text; };
+  for (const Utc& c : {Utc{0, 0, 'C', "Un-initialized"}, {90061, 0, 'X', "1970-01-02T01:01:01"},
+                       {90061, 42, 'C', "01-02-1970 01:01:01.000042"},
+                       {90061, 42, 'D', "1970-01-02-01.01.01"}}) {
+    formatUtcTimestamp(c.s, c.us, buf, sizeof buf, c.style);
+    EXPECT_STREQ(c.text, buf) << c.style;
+  }
   EXPECT_EQ(0, formatUtcTimestamp(90061, 0, buf, sizeof buf, 'Q'));
   EXPECT_STREQ("1970-01-02-01.01.01", buf);  // untouched
   char small[8];
@@ -187,16 +185,14 @@ TEST_F(Fmt, TimestampsParseAndPrint) {
   EXPECT_STREQ(" 1h  2m  3.004s", buf);
   formatMillis32(59999, buf, sizeof buf);
   EXPECT_STREQ(" 0h  0m 59.999s", buf);
-}
 
-TEST_F(Fmt, WrongTimestampLengthIsReportedWithTheLength) {
+  // A wrong length is reported with the length.
   LogFile log;
-  int64_t s = 7;
   EXPECT_EQ(-1, timestamp2seconds("2026-12-06-11.43.08.12345", &s, nullptr));
   EXPECT_EQ(-1, timestamp2seconds(nullptr, &s, nullptr));
-  std::string text = log.text();
-  EXPECT_NE(std::string::npos, text.find("<timestamp2seconds> KLP8999D Expected timestamp len of 19 or 26. Received 25"))
-      << text;
+  EXPECT_NE(std::string::npos, log.text().find("<timestamp2seconds> KLP8999D Expected timestamp "
+                                               "len of 19 or 26. Received 25"))
+      << log.text();
 }
 
 TEST_F(Fmt, PackedDecimalDatesAndFractionPrecision) {
@@ -211,7 +207,7 @@ TEST_F(Fmt, PackedDecimalDatesAndFractionPrecision) {
 
   const uint8_t ts[11] = {0x20, 0x26, 0x12, 0x06, 0x11, 0x43, 0x08, 0x12, 0x34, 0x56, 0x78};
   klpReleaseBlock& rel = klpGetEnv()->appVersion.rel;
-  int16_t oldV = rel.version, oldR = rel.release;
+  klpReleaseBlock saved = rel;
   rel.version = 9;
   rel.release = 5;  // before 9.7: six fraction digits at most
   memset(out, '#', sizeof out);
@@ -223,8 +219,7 @@ TEST_F(Fmt, PackedDecimalDatesAndFractionPrecision) {
   EXPECT_EQ(28, bcdTimestampToText(ts, 8, 8, 8, out));  // only the bytes that exist
   EXPECT_EQ("2026-12-06-11.43.08.12000000", std::string(out, 28));
   EXPECT_EQ(-1, bcdTimestampToText(ts, 6, 0, 8, out));
-  rel.version = oldV;
-  rel.release = oldR;
+  rel = saved;
 }
 
 TEST_F(Fmt, StringCopyIdentifiersWordsAndPads) {
@@ -273,7 +268,8 @@ TEST_F(Fmt, ProgramFilesOpenUnderTheirNames) {
   setEnvTovRIB(env, "fmttestprogram", 9, 7, 8);
   FILE* f = nullptr;
   char name[256];
-  ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_WRITE, "dat", name, sizeof name, nullptr, 0));
+  ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_WRITE, "dat", name, sizeof name,
+                             nullptr, 0));
   std::string expected = dir.path() + "fmttestpr." + std::to_string(hsvProcessID()) + ".dat";
   EXPECT_EQ(expected, name);
   fputs("hello", f);
@@ -285,42 +281,35 @@ TEST_F(Fmt, ProgramFilesOpenUnderTheirNames) {
   EXPECT_EQ("hello again", klptest::readFile(expected));
 
   char err[8] = "old";
-  EXPECT_EQ(ENOENT, getFileHandle(&f, KLP_FILE_TEMP, "missing", name, sizeof name, err, sizeof err));
+  EXPECT_EQ(ENOENT,
+            getFileHandle(&f, KLP_FILE_TEMP, "missing", name, sizeof name, err, sizeof err));
   EXPECT_EQ(nullptr, f);
   EXPECT_STREQ("", name);
   EXPECT_STREQ("", err);
   EXPECT_NE(std::string::npos, log.text().find("KLP0626")) << log.text();
   char tiny[8];  // a name that does not fit is not opened at all
-  EXPECT_EQ(ENAMETOOLONG, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_WRITE, "x", tiny, sizeof tiny,
-                                        nullptr, 0));
+  EXPECT_EQ(ENAMETOOLONG, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_WRITE, "x", tiny,
+                                        sizeof tiny, nullptr, 0));
   klpEnvClear(env);
 }
 
 TEST_F(Fmt, WildcardPreparationAndMatching) {
-  struct Case {
-    const char* in;
-    int32_t kind;
-    const char* out;
-  };
-  for (const Case& c : {Case{"AB%", KLP_WILD_PREFIX, "AB%"}, Case{"%%%", KLP_WILD_ALL, "%"},
-                        Case{"A%B%", KLP_WILD_FULL, "A%B%"}, Case{"A\\%B", KLP_WILD_NONE, "A%B"},
-                        Case{"A%%B", KLP_WILD_FULL, "A%B"}, Case{"AB\\%%", KLP_WILD_PREFIX, "AB%%"},
-                        Case{"A\\%%%B", KLP_WILD_FULL, "A\\%%B"}}) {
+  struct Prepared { const char* in; int32_t kind; const char* out; };
+  for (const Prepared& c :
+       {Prepared{"AB%", KLP_WILD_PREFIX, "AB%"}, {"%%%", KLP_WILD_ALL, "%"},
+        {"A%B%", KLP_WILD_FULL, "A%B%"}, {"A\\%B", KLP_WILD_NONE, "A%B"},
+        {"A%%B", KLP_WILD_FULL, "A%B"}, {"AB\\%%", KLP_WILD_PREFIX, "AB%%"},
+        {"A\\%%%B", KLP_WILD_FULL, "A\\%%B"}}) {
     std::string p = c.in;
     EXPECT_EQ(c.kind, prepareIgnTransCriteria(p.data())) << c.in;
     EXPECT_STREQ(c.out, p.c_str()) << c.in;
   }
-  EXPECT_EQ(1, compareIgnTransCriteria("A%C", "ABBC"));
-  EXPECT_EQ(0, compareIgnTransCriteria("A%C", "ABBD"));
-  EXPECT_EQ(1, compareIgnTransCriteria("%", ""));
-  EXPECT_EQ(0, compareIgnTransCriteria("", "x"));
-  EXPECT_EQ(0, compareIgnTransCriteria("a%c", "ABC"));
-  EXPECT_EQ(1, compareIgnTransCriteria("A%B%C", "AxByBzC"));
-  // A later occurrence is tried when the first one leads nowhere.
-  EXPECT_EQ(1, compareIgnTransCriteria("A%C", "ABCC"));
-  EXPECT_EQ(1, compareIgnTransCriteria("A%CD", "ACXCD"));
-  EXPECT_EQ(1, compareIgnTransCriteria("A\\%C", "A%C"));
-  EXPECT_EQ(0, compareIgnTransCriteria("A\\%C", "ABC"));
-  EXPECT_EQ(1, compareIgnTransCriteria("%\\%", "50%"));  // "%" before an escaped character
-  EXPECT_EQ(0, compareIgnTransCriteria("A\\", "A\\"));
+  // A later occurrence is tried when the first one leads nowhere; "%" may
+  // come before an escaped character.
+  struct Match { const char* pattern; const char* text; int result; };
+  for (const Match& m :
+       {Match{"A%C", "ABBC", 1}, {"A%C", "ABBD", 0}, {"%", "", 1}, {"", "x", 0}, {"a%c", "ABC", 0},
+        {"A%B%C", "AxByBzC", 1}, {"A%C", "ABCC", 1}, {"A%CD", "ACXCD", 1}, {"A\\%C", "A%C", 1},
+        {"A\\%C", "ABC", 0}, {"%\\%", "50%", 1}, {"A\\", "A\\", 0}})
+    EXPECT_EQ(m.result, compareIgnTransCriteria(m.pattern, m.text)) << m.pattern << " " << m.text;
 }

@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
@@ -118,6 +119,51 @@ std::string readFile(const std::string& path) {
   std::stringstream ss;
   ss << f.rdbuf();
   return ss.str();
+}
+
+std::vector<std::string> lines(const std::string& text) {
+  std::vector<std::string> out;
+  for (size_t start = 0; start < text.size();) {
+    size_t nl = text.find('\n', start);
+    if (nl == std::string::npos) nl = text.size();
+    out.push_back(text.substr(start, nl - start));
+    start = nl + 1;
+  }
+  return out;
+}
+
+Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs) {
+  static int serial = 0;
+  std::string base = dir + "child" + std::to_string(++serial);
+  std::string outFile = base + ".out", errFile = base + ".err";
+  fflush(stdout);
+  fflush(stderr);
+  Child c;
+  pid_t pid = fork();
+  if (pid == 0) {
+    int o = open(outFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    int e = open(errFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    if (o < 0 || e < 0) _exit(99);
+    dup2(o, 1);
+    dup2(e, 2);
+    int rc = body();
+    fflush(stdout);
+    fflush(stderr);
+    _exit(rc);
+  }
+  if (pid < 0) return c;
+  ProcessResult r;
+  if (reap(pid, timeoutMs, r)) {
+    c.exited = r.signal == 0;
+    c.exitCode = r.exitCode;
+    c.signal = r.signal;
+  } else {
+    ::kill(pid, SIGKILL);
+    reap(pid, 10000, r);
+  }
+  c.out = readFile(outFile);
+  c.err = readFile(errFile);
+  return c;
 }
 
 ProcessResult run(const std::vector<std::string>& argv, const std::vector<std::string>& extraEnv,

@@ -2,6 +2,7 @@
 // processes, and checks that no queue or shared-memory block is left behind.
 #pragma once
 
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -69,5 +70,21 @@ bool memoryExists(const std::string& path);
 
 // Reads a whole file ("" when missing).
 std::string readFile(const std::string& path);
+
+// Lines of a text, without their line feeds.
+std::vector<std::string> lines(const std::string& text);
+
+struct Child {
+  bool exited = false;  // ended by exit (not a signal, not timed out)
+  int exitCode = -1;
+  int signal = 0;       // terminating signal
+  std::string out;      // standard output
+  std::string err;      // standard error
+};
+
+// Runs body in a forked child whose standard output and error go to files
+// under dir (which ends in "/"); the child exits with body's answer. Waits
+// at most timeoutMs, then kills it.
+Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs = 20000);
 
 }  // namespace klptest
