@@ -9,10 +9,10 @@
 #include <string>
 #include <vector>
 
+#include "common/env/klpenv.h"
 #include "common/msg/klplog.h"
 #include "common/msg/msglogger.h"
 #include "common/parms/klpparm.h"
-#include "common/env/klpenv.h"
 #include "common/thread/klpthread.h"
 #include "common/thread/recoverymgr.h"
 #include "common/trace/trace_anchor.h"
@@ -38,7 +38,6 @@ int findStatusShowDetails(int argc, char** argv) {
   return 0;
 }
 
-
 // What must survive a jump back to the recovery point lives here, not in
 // the entry routine's frame (locals changed after sigsetjmp are unreliable).
 struct Run {
@@ -47,7 +46,6 @@ struct Run {
   xqpubParms* serverParms = nullptr;
   std::string usage;
   int rc = KLP_OK;
-  int recoveries = 0;
 };
 Run g_run;
 

@@ -197,6 +197,9 @@ TEST(Klpkccmd, InterruptedWhileWaitingItDestroysItsReplyQueue) {
   client.kill(SIGINT);
   klptest::ProcessResult r = client.wait(30000);
   EXPECT_EQ(r.exitCode, 12) << r.out << r.err;
+  // Back at the recovery point: the signal is reported and the run ends.
+  EXPECT_NE(r.out.find("SIGINT"), std::string::npos) << r.out;
+  EXPECT_NE(r.out.find("\"setRecoveryPoint\""), std::string::npos) << r.out;
   EXPECT_FALSE(klptest::queueExists(reply));
   s.proc().kill(SIGCONT);
   stopServer(dir, s, "INTR");
