@@ -7,6 +7,7 @@
 #include <new>
 
 #include "common/msg/msglogger.h"
+#include "common/platform/hsv.h"
 #include "common/util/klprc.h"
 
 namespace {
@@ -321,10 +322,10 @@ static const char kHeaderFileName[] = "klpmsgd.h";
 static const char kHeaderEnd[] = "#endif\n";
 
 static void writeHeaderBanner(FILE* f) {
-  time_t now = time(nullptr);
   char when[64];
   struct tm local;
-  if (localtime_r(&now, &local) == nullptr || asctime_r(&local, when) == nullptr)
+  HSVTimeUTC now = hsvTimeGetUTC();
+  if (!hsvTimeLocalTime(now.seconds, &local) || asctime_r(&local, when) == nullptr)
     strcpy(when, "(unknown)\n");
   fprintf(f,
           "//  This file is generated. Do not edit it.\n"
@@ -373,6 +374,8 @@ void msgLogger::writeMsgHeader(logMsg* r) {
       return;
     }
     writeHeaderBanner(headerFile);
+    // The record that opened the file gets its definition too: a banner
+    // alone would lose the first message's constant.
   }
   if (r->sourceKind == MSG_SOURCE_NONE || r->text == nullptr) return;
   char prefix[48] = "";

@@ -157,6 +157,29 @@ TEST(Waitpost, DestroyReleasesWaiters) {
   EXPECT_EQ(result.load(), ECF_WAITPOST_NOT_INITIALIZED);
 }
 
+TEST(Waitpost, CallsRacingWithDestroyFindItClosed) {
+  // Waits and posts that run while another thread destroys and re-creates
+  // the object must see it closed or open, never freed state.
+  HSVHIPCWaitpost wp;
+  ASSERT_EQ(wp.create(HSV_CREATE_OPTION), ECF_OK);
+  std::atomic<bool> done{false};
+  std::thread user([&] {
+    while (!done) {
+      hsvRC rc = wp.wait(0);
+      EXPECT_TRUE(rc == ECF_OK || rc == ECF_TIMEOUT || rc == ECF_WAITPOST_NOT_INITIALIZED) << rc;
+      rc = wp.post();
+      EXPECT_TRUE(rc == ECF_OK || rc == ECF_WAITPOST_NOT_INITIALIZED) << rc;
+    }
+  });
+  for (int i = 0; i < 20000; ++i) {
+    wp.destroy();
+    wp.create(HSV_CREATE_OPTION);
+  }
+  done = true;
+  user.join();
+  EXPECT_EQ(wp.create(HSV_CREATE_OPTION), ECF_ALREADY_EXISTS);
+}
+
 TEST(Clock, TimeIdsAndSleep) {
   HSVTimeUTC t = hsvTimeGetUTC();
   EXPECT_LE(std::llabs(t.seconds - static_cast<int64_t>(time(nullptr))), 2);

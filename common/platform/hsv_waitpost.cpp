@@ -9,10 +9,14 @@
 #include "common/platform/hsv.h"
 #include "common/platform/hsv_internal.h"
 
+// The state is allocated by the first create and kept until the object is
+// destructed: a wait or post that races with destroy then finds the object
+// closed instead of freed memory.
 struct HSVHIPCWaitpost::Impl {
   pthread_mutex_t mutex;
   pthread_cond_t cond;      // signalled by post
-  pthread_cond_t drained;   // signalled when the last waiter leaves a destroyed object
+  pthread_cond_t drained;   // signalled when the last waiter leaves a closing object
+  bool live = false;        // between create and destroy
   bool posted = false;
   bool closing = false;
   int waiters = 0;
@@ -20,33 +24,59 @@ struct HSVHIPCWaitpost::Impl {
 
 HSVHIPCWaitpost::HSVHIPCWaitpost() = default;
 
-HSVHIPCWaitpost::~HSVHIPCWaitpost() { destroy(); }
+HSVHIPCWaitpost::~HSVHIPCWaitpost() {
+  destroy();
+  if (Impl* im = impl_) {
+    pthread_cond_destroy(&im->drained);
+    pthread_cond_destroy(&im->cond);
+    pthread_mutex_destroy(&im->mutex);
+    delete im;
+  }
+}
 
-hsvRC HSVHIPCWaitpost::create(int /*option*/) {
-  if (impl_) return ECF_ALREADY_EXISTS;
-  Impl* im = new (std::nothrow) Impl;
-  if (!im) return ECF_NO_MEMORY;
+namespace {
+
+int initImpl(pthread_mutex_t* mutex, pthread_cond_t* cond, pthread_cond_t* drained) {
   pthread_condattr_t ca;
   pthread_condattr_init(&ca);
   // Time-outs run on the monotonic clock: a clock change must not stretch
   // or cut a wait.
   pthread_condattr_setclock(&ca, CLOCK_MONOTONIC);
-  int rc = pthread_mutex_init(&im->mutex, nullptr);
+  int rc = pthread_mutex_init(mutex, nullptr);
   if (rc == 0) {
-    rc = pthread_cond_init(&im->cond, &ca);
+    rc = pthread_cond_init(cond, &ca);
     if (rc == 0) {
-      rc = pthread_cond_init(&im->drained, &ca);
-      if (rc != 0) pthread_cond_destroy(&im->cond);
+      rc = pthread_cond_init(drained, &ca);
+      if (rc != 0) pthread_cond_destroy(cond);
     }
-    if (rc != 0) pthread_mutex_destroy(&im->mutex);
+    if (rc != 0) pthread_mutex_destroy(mutex);
   }
   pthread_condattr_destroy(&ca);
-  if (rc != 0) {
-    delete im;
-    return hsvErrnoToECF(rc);
+  return rc;
+}
+
+}  // namespace
+
+hsvRC HSVHIPCWaitpost::create(int /*option*/) {
+  Impl* im = __atomic_load_n(&impl_, __ATOMIC_ACQUIRE);
+  if (!im) {
+    im = new (std::nothrow) Impl;
+    if (!im) return ECF_NO_MEMORY;
+    int rc = initImpl(&im->mutex, &im->cond, &im->drained);
+    if (rc != 0) {
+      delete im;
+      return hsvErrnoToECF(rc);
+    }
+    __atomic_store_n(&impl_, im, __ATOMIC_RELEASE);
   }
-  __atomic_store_n(&impl_, im, __ATOMIC_RELEASE);
-  return ECF_OK;
+  pthread_mutex_lock(&im->mutex);
+  hsvRC result = im->live ? ECF_ALREADY_EXISTS : ECF_OK;
+  if (!im->live) {
+    im->live = true;
+    im->posted = false;
+  }
+  pthread_mutex_unlock(&im->mutex);
+  return result;
 }
 
 hsvRC HSVHIPCWaitpost::wait(int32_t timeMs) {
@@ -54,6 +84,10 @@ hsvRC HSVHIPCWaitpost::wait(int32_t timeMs) {
   if (!im) return ECF_WAITPOST_NOT_INITIALIZED;
   timespec deadline = hsvint::deadlineAfter(CLOCK_MONOTONIC, timeMs);
   pthread_mutex_lock(&im->mutex);
+  if (!im->live) {
+    pthread_mutex_unlock(&im->mutex);
+    return ECF_WAITPOST_NOT_INITIALIZED;
+  }
   ++im->waiters;
   hsvRC result = ECF_OK;
   for (;;) {
@@ -90,25 +124,32 @@ hsvRC HSVHIPCWaitpost::post() {
   Impl* im = __atomic_load_n(&impl_, __ATOMIC_ACQUIRE);
   if (!im) return ECF_WAITPOST_NOT_INITIALIZED;
   pthread_mutex_lock(&im->mutex);
-  im->posted = true;
-  pthread_cond_signal(&im->cond);
+  hsvRC result = ECF_WAITPOST_NOT_INITIALIZED;
+  if (im->live) {
+    im->posted = true;
+    pthread_cond_signal(&im->cond);
+    result = ECF_OK;
+  }
   pthread_mutex_unlock(&im->mutex);
-  return ECF_OK;
+  return result;
 }
 
 hsvRC HSVHIPCWaitpost::destroy() {
-  Impl* im = __atomic_exchange_n(&impl_, static_cast<Impl*>(nullptr), __ATOMIC_ACQ_REL);
+  Impl* im = __atomic_load_n(&impl_, __ATOMIC_ACQUIRE);
   if (!im) return ECF_WAITPOST_NOT_INITIALIZED;
-  // Wake every waiter and let it leave before the object goes away, so no
-  // thread is left blocked on freed memory. New calls already see no object.
+  // Wake every waiter and let it leave, so no thread stays blocked on an
+  // object that is gone; calls from now on find it closed.
   pthread_mutex_lock(&im->mutex);
+  if (!im->live) {
+    pthread_mutex_unlock(&im->mutex);
+    return ECF_WAITPOST_NOT_INITIALIZED;
+  }
+  im->live = false;
   im->closing = true;
   pthread_cond_broadcast(&im->cond);
   while (im->waiters > 0) pthread_cond_wait(&im->drained, &im->mutex);
+  im->closing = false;
+  im->posted = false;
   pthread_mutex_unlock(&im->mutex);
-  pthread_cond_destroy(&im->drained);
-  pthread_cond_destroy(&im->cond);
-  pthread_mutex_destroy(&im->mutex);
-  delete im;
   return ECF_OK;
 }
