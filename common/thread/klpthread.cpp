@@ -532,6 +532,10 @@ int threadStateByName(OrdList* list, const char* name) {
 }
 
 klpThread* currentThread() {
+  // A thread that ran its prologue knows itself: no lock, so this is safe
+  // on every log line and after a jump out of a signal handler that may
+  // have interrupted the thread inside the thread-id list's lock.
+  if (tlsThread != nullptr) return tlsThread;
   OrdList* ids = klpThreadIdList();
   uint64_t me = hsvThreadID();
   klpThread* found = nullptr;

@@ -87,6 +87,17 @@ void signalTrap(int sig, siginfo_t* info, void* context) {
     mgr->signal = sig;
     siglongjmp(mgr->recoveryPoint, 1);
   }
+  // No recovery point to go back to. The thread's clean-ups still run (a
+  // control-interface call keeps its reply queue there).
+  if (t != nullptr) t->rcvyMgr.runResources();
+  // Faults and SIGTERM were added to the set for threads that can recover;
+  // elsewhere they take their default course instead of leaving the process
+  // running damaged or ignoring a termination request.
+  if (sig == SIGSEGV || sig == SIGBUS || sig == SIGILL || sig == SIGTERM) {
+    signal(sig, SIG_DFL);
+    raise(sig);
+    return;
+  }
   logInternalError("findRcvyMgr", KLP_RC_NO_MANAGER, "findThread");
   logInternalError("signalHandler", KLP_RC_NO_MANAGER, "findRcvyMgr");
   char num[16];

@@ -77,8 +77,24 @@ void faultingBody(klpThread* t) {
 
 void pointlessBody(klpThread* t) {
   klpThread::prologue(t);
+  addRcvyRes(action, 7);  // still runs: nothing else would clean up
   raise(SIGINT);  // before any recovery point
   say("not reached\n");
+}
+
+// Takes the signal while it holds the thread-id list's lock, which the jump
+// leaves held: the report at the recovery point must not need that lock.
+void insideLockBody(klpThread* t) {
+  klpThread::prologue(t);
+  if (KLP_SET_RECOVERY_POINT(t->rcvyMgr) != 0) {
+    int rc = recoveryMgr::erRecover(&t->rcvyMgr, t);
+    say("reported\n");
+    klpThreadIdList()->unlockList();
+    threadEnd(t, rc);
+  }
+  klpThreadIdList()->lockList();
+  raise(SIGINT);
+  threadEnd(t, 0);
 }
 
 HSVHIPCQueue* g_queue = nullptr;
@@ -173,13 +189,42 @@ TEST_F(SigRecovery, ASignalOnAnUnregisteredThreadEndsItWith2009) {
   EXPECT_TRUE(cap.issuedWith(589, {"signalHandler", "602", "findRcvyMgr"})) << cap.log();
 }
 
+TEST_F(SigRecovery, AFaultOnAThreadThatCannotRecoverTakesItsDefaultCourse) {
+  // Leaving the process running after a fault on a thread nobody can bring
+  // back would hide the damage: the fault ends the process as usual.
+  auto c = thrtest::inChild(cap.dir(), [] {
+    recoveryMgr::erReinstall();
+    pthread_t raw;
+    pthread_create(
+        &raw, nullptr,
+        [](void*) -> void* {
+          raise(SIGSEGV);
+          return nullptr;
+        },
+        nullptr);
+    pthread_join(raw, nullptr);
+    say("still running\n");
+    return 0;
+  });
+  EXPECT_FALSE(c.exited) << c.out;
+  EXPECT_EQ(SIGSEGV, c.signal);
+  EXPECT_EQ(std::string::npos, c.out.find("still running"));
+}
+
 TEST_F(SigRecovery, ARegisteredThreadWithoutRecoveryPointEndsThroughThreadEnd) {
 #if defined(__SANITIZE_THREAD__)
   GTEST_SKIP() << "not under ThreadSanitizer";  // see above
 #endif
   // The end code is stored (and the state is 6) as for any other end.
-  EXPECT_EQ("end=2009 code=2009 global=2\n", child([] { return runThread(pointlessBody, "NoPoint"); }));
+  EXPECT_EQ("action 7\nend=2009 code=2009 global=2\n",
+            child([] { return runThread(pointlessBody, "NoPoint"); }));
   EXPECT_TRUE(cap.issuedWith(591, {"Unknown", "Non-handled", "2"})) << cap.log();
+}
+
+TEST_F(SigRecovery, ASignalInsideTheThreadIdListLockIsStillReported) {
+  EXPECT_EQ("reported\nend=2009 code=2009 global=2\n",
+            child([] { return runThread(insideLockBody, "InLock"); }));
+  EXPECT_TRUE(cap.issuedWith(591, {"InLock", "Handled", "SIGINT"})) << cap.log();
 }
 
 TEST_F(SigRecovery, StoppingAWaitingThreadSignalsItInsteadOfCuttingItOff) {

@@ -701,6 +701,9 @@ int compareIgnTransCriteria(const char* pattern, const char* text) {
       }
       if (*p == '\0') {
         result = *t == '\0';
+        // The pattern ended before the text: the last "%" may have taken too
+        // little ("A%C" against "ABCC"), so try it one character longer. A
+        // match means the whole text matches, as the caller is promised.
         if (!result && backP) {
           p = backP;
           t = backT + 1;

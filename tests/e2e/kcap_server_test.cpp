@@ -1,6 +1,8 @@
 // The sample server and its command engine, driven over the real queues by a
 // raw client and by the exported control interface.
 #include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <cstring>
 #include <string>
@@ -362,4 +364,38 @@ TEST_F(ControlInterface, StatusOfAKcapServerAndItsStop) {
   EXPECT_EQ(s.proc().wait(30000).exitCode, 0);
   EXPECT_FALSE(klptest::queueExists(s.queue()));
   EXPECT_FALSE(klptest::queueExists(s.queue() + ".CMD" + std::to_string(getpid())));
+}
+
+TEST_F(ControlInterface, ASignalWhileACallerWaitsStillDestroysItsReplyQueue) {
+  // A program that calls the control interface has no recovery point of
+  // ours: the call's clean-ups must run all the same.
+  klptest::TmpDir dir;
+  klpEnvClear(klpGetEnv());
+  Server s(dir, "HOLD");
+  ASSERT_TRUE(s.ready());
+  s.proc().kill(SIGSTOP);  // it takes the request but never answers
+  int pid = fork();
+  ASSERT_GE(pid, 0);
+  if (pid == 0) {
+    klpReleaseInfo rel{KLP_KIND_KCAP, 9, 1, 0};
+    klpResultBlock res;
+    klpStatusRequest q = request("HOLD");
+    static klpStatusFmt3 data;
+    q.buffer = &data;
+    q.bufferSize = sizeof data;
+    klpGetStatus(&rel, &q, &res);
+    _exit(0);  // not reached while the server is stopped
+  }
+  std::string reply = s.queue() + ".CMD" + std::to_string(pid);
+  EXPECT_TRUE(e2e::waitFor([&] { return klptest::queueExists(reply); }, 20000));
+  kill(pid, SIGINT);
+  int status = 0;
+  ASSERT_TRUE(e2e::waitFor([&] { return waitpid(pid, &status, WNOHANG) == pid; }, 20000));
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 12) << status;
+  EXPECT_FALSE(klptest::queueExists(reply));
+  s.proc().kill(SIGCONT);
+  klpResultBlock res;
+  EXPECT_EQ(klpStopProgram(KLP_KIND_KCAP, "HOLD", "KLP", 0, &res), 0) << res.text;
+  EXPECT_EQ(s.proc().wait(30000).exitCode, 0);
+  EXPECT_FALSE(klptest::queueExists(s.queue()));
 }
