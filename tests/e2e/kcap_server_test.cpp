@@ -104,7 +104,10 @@ TEST(KcapServer, SuspendAndResumeChangeTheWorkersButNotTheAdminThread) {
         Reply st;
         if (!c.ask(kStatus, &st)) return false;
         auto m = e2e::threadStates(st);
-        return m["WorkerThread"] == KLP_THREAD_WAIT && m["AdminThread"] == KLP_THREAD_REST;
+        // Each worker takes the request from its own command list in its own
+        // time: wait until all of them have.
+        return m["WorkerThread"] == KLP_THREAD_WAIT && m["PruneThread"] == KLP_THREAD_WAIT &&
+               m["HoldLThread"] == KLP_THREAD_WAIT && m["AdminThread"] == KLP_THREAD_REST;
       },
       10000));
   ASSERT_TRUE(c.ask(kStatus, &r));
@@ -120,7 +123,10 @@ TEST(KcapServer, SuspendAndResumeChangeTheWorkersButNotTheAdminThread) {
   ASSERT_TRUE(e2e::waitFor(
       [&] {
         Reply st;
-        return c.ask(kStatus, &st) && e2e::threadStates(st)["WorkerThread"] == KLP_THREAD_REST;
+        if (!c.ask(kStatus, &st)) return false;
+        auto m = e2e::threadStates(st);
+        return m["WorkerThread"] == KLP_THREAD_REST && m["PruneThread"] == KLP_THREAD_REST &&
+               m["HoldLThread"] == KLP_THREAD_REST;
       },
       10000));
   stopCleanly(s, c);
