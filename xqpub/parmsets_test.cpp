@@ -44,10 +44,7 @@ struct Parsed {
 class ParmSetTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    logger_ = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
-    ASSERT_NE(logger_, nullptr);
-    logger_->loadBuiltinMsgs(builtinMsgTable);
-    klpSetProcessLogger(logger_);
+    logger_ = std::make_unique<klptest::ProcessLogger>();
     reset();
     // The password file is looked for in the working directory.
     ASSERT_NE(getcwd(oldCwd_, sizeof oldCwd_), nullptr);
@@ -77,8 +74,7 @@ class ParmSetTest : public ::testing::Test {
   void TearDown() override {
     EXPECT_EQ(chdir(oldCwd_), 0);
     clear();
-    klpSetProcessLogger(nullptr);
-    delete logger_;
+    logger_.reset();
   }
   static Parsed run(klpParmClass* p, std::vector<std::string> args) {
     args.insert(args.begin(), "klpkccmd");
@@ -100,7 +96,7 @@ class ParmSetTest : public ::testing::Test {
   ScopedEnv sid_{"ORACLE_SID", nullptr};
   klptest::TmpDir dir_;
   char oldCwd_[4096] = {0};
-  msgLogger* logger_ = nullptr;
+  std::unique_ptr<klptest::ProcessLogger> logger_;
   std::unique_ptr<kCapCmdParmClass> cmd_;
   std::unique_ptr<xqpubParms> server_;
 };
@@ -172,11 +168,11 @@ TEST_F(ParmSetTest, SwitchesTakeYesAndNoOnly) {
   Parsed p = cmd({"x", "LOGSTDOUT", "RESUME"});
   ASSERT_EQ(p.rc, 0) << p.out;
   EXPECT_EQ(cmd_->getParmBool(4), 1);
-  EXPECT_EQ(logger_->getConsoleFlag(), 1);
+  EXPECT_EQ(logger_->get()->getConsoleFlag(), 1);
   p = newCmd({"x", "LOGSTDOUT=no"});  // no command: refused, the switch is set
   EXPECT_TRUE(p.has("KLP0526E")) << p.out;
   EXPECT_EQ(cmd_->getParmBool(4), 0);
-  EXPECT_EQ(logger_->getConsoleFlag(), 0);
+  EXPECT_EQ(logger_->get()->getConsoleFlag(), 0);
   p = cmd({"x", "LOGSTDOUT=1", "STOP"});
   EXPECT_EQ(p.rc, KLP_RC_BAD_PARM);
   EXPECT_TRUE(p.has("KLP0501E")) << p.out;
@@ -186,7 +182,7 @@ TEST_F(ParmSetTest, SchemaQuotingCaseAndChecks) {
   Parsed p = cmd({"x", "CAPTURE_SCHEMA=\"My_Schema\"", "STOP"});
   ASSERT_EQ(p.rc, 0) << p.out;
   EXPECT_STREQ(cmd_->getParmString(2), "My_Schema");
-  EXPECT_STREQ(logger_->getProgramQualifier(), "\"My_Schema\"");  // as typed, before the rule
+  EXPECT_STREQ(logger_->get()->getProgramQualifier(), "\"My_Schema\"");  // as typed, before the rule
   p = newCmd({"x", "capture_schema=my_schema", "STOP"});
   ASSERT_EQ(p.rc, 0) << p.out;
   EXPECT_STREQ(cmd_->getParmString(2), "MY_SCHEMA");

@@ -13,6 +13,7 @@
 #include "common/msg/klplog.h"
 #include "common/msg/msglogger.h"
 #include "include/klpapi.h"
+#include "tests/testing/klptest.h"
 
 namespace {
 
@@ -30,14 +31,9 @@ std::vector<std::string> printed(const std::function<void()>& print) {
 class StatusReport : public ::testing::Test {
  protected:
   static void SetUpTestSuite() {
-    saved_ = klpGetProcessLogger();
-    logger_ = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
-    ASSERT_NE(logger_, nullptr);
-    logger_->loadBuiltinMsgs(builtinMsgTable);
-    klpSetProcessLogger(logger_);
+    logger_ = new klptest::ProcessLogger;
   }
   static void TearDownTestSuite() {
-    klpSetProcessLogger(saved_);
     delete logger_;
   }
 
@@ -50,11 +46,9 @@ class StatusReport : public ::testing::Test {
     return line + kw + " = " + value;
   }
 
-  static msgLogger* logger_;
-  static msgLogger* saved_;
+  static klptest::ProcessLogger* logger_;
 };
-msgLogger* StatusReport::logger_ = nullptr;
-msgLogger* StatusReport::saved_ = nullptr;
+klptest::ProcessLogger* StatusReport::logger_ = nullptr;
 
 klpStatusFmt3 sampleStatus(const std::string& logFile) {
   klpStatusFmt3 s;

@@ -45,16 +45,8 @@ struct ServerParms {
 
 // A process logger writing the log file env.log into dir.
 struct LogFile {
-  msgLogger* logger = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
-  explicit LogFile(const std::string& dir) {
-    logger->loadBuiltinMsgs(builtinMsgTable);
-    logger->setLogFileName(dir.c_str(), "env.log");
-    klpSetProcessLogger(logger);
-  }
-  ~LogFile() {
-    klpSetProcessLogger(nullptr);
-    delete logger;
-  }
+  klptest::ProcessLogger logger;
+  explicit LogFile(const std::string& dir) : logger(MSG_APP_KLPKCCMD, dir, "env.log") {}
 };
 
 // Every test starts from a cleared environment and leaves one behind.

@@ -367,15 +367,10 @@ TEST(CmdApiStatusFormat2, ShortBuffersAndLyingCounts) {
 class CmdApiExchange : public ::testing::Test {
  protected:
   static void SetUpTestSuite() {
-    saved_ = klpGetProcessLogger();
-    logger_ = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
-    ASSERT_NE(logger_, nullptr);
-    logger_->loadBuiltinMsgs(builtinMsgTable);
-    klpSetProcessLogger(logger_);
+    logger_ = new klptest::ProcessLogger;
     klpEnsureMainThread();
   }
   static void TearDownTestSuite() {
-    klpSetProcessLogger(saved_);
     delete logger_;
   }
   // The IPC directory is kept once read: start each test from its own.
@@ -387,11 +382,9 @@ class CmdApiExchange : public ::testing::Test {
   }
 
   klptest::TmpDir tmp_;
-  static msgLogger* logger_;
-  static msgLogger* saved_;
+  static klptest::ProcessLogger* logger_;
 };
-msgLogger* CmdApiExchange::logger_ = nullptr;
-msgLogger* CmdApiExchange::saved_ = nullptr;
+klptest::ProcessLogger* CmdApiExchange::logger_ = nullptr;
 
 // Server side run in a forked child: owns the server queue (created by the
 // parent before the fork, so the client finds it at once) and answers

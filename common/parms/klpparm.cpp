@@ -52,6 +52,17 @@ void placeholder(ParmEntry& e) {
   e.strValue = nullptr;
 }
 
+// A refused value: one from the control table names the table (541), one
+// from any other source gets `message`.
+int refuseValue(int message, const char* origin, const char* value, const char* name,
+                int32_t source, const char* tableName) {
+  if (source == PARM_SRC_TABLE)
+    logKlpMsg(541, origin, KLP_DEST_CONSOLE, value, nullptr, 2, name, tableName);
+  else
+    logKlpMsg(message, origin, KLP_DEST_CONSOLE, value, nullptr, 1, name);
+  return KLP_RC_BAD_PARM;
+}
+
 }  // namespace
 
 ParmEntry makeParmEntry(int32_t index, const char* name, int32_t matchLength, int32_t type,
@@ -189,11 +200,7 @@ int klpParmClass::setParm(int index, int32_t value, int32_t source) {
     return KLP_RC_BAD_PARM;
   }
   if (value < s.minimum || value > s.maximum) {
-    if (source == PARM_SRC_TABLE)
-      logKlpMsg(541, kOriginSetParm, KLP_DEST_CONSOLE, num, nullptr, 2, s.name, tableName_);
-    else
-      logKlpMsg(503, kOriginSetParm, KLP_DEST_CONSOLE, num, nullptr, 1, s.name);
-    return KLP_RC_BAD_PARM;
+    return refuseValue(503, kOriginSetParm, num, s.name, source, tableName_);
   }
   if (source >= s.source) {
     s.intValue = value;
@@ -231,11 +238,7 @@ int klpParmClass::setBool(int index, char yesNo, int32_t source) {
   } else if (yesNo == 'N' || yesNo == 'n') {
     value = 0;
   } else {
-    if (source == PARM_SRC_TABLE)
-      logKlpMsg(541, kOriginSetBool, KLP_DEST_CONSOLE, text, nullptr, 2, s.name, tableName_);
-    else
-      logKlpMsg(500, kOriginSetBool, KLP_DEST_CONSOLE, text, nullptr, 1, s.name);
-    return KLP_RC_BAD_PARM;
+    return refuseValue(500, kOriginSetBool, text, s.name, source, tableName_);
   }
   if (source >= s.source) {
     s.boolValue = value;

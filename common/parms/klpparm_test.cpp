@@ -15,6 +15,7 @@
 #include "common/parms/klpparm.h"
 #include "common/parms/parmutil.h"
 #include "common/util/klprc.h"
+#include "tests/testing/klptest.h"
 
 namespace {
 
@@ -46,10 +47,7 @@ size_t countOf(const std::string& text, const char* what) {
 class ParmTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    logger_ = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
-    ASSERT_NE(logger_, nullptr);
-    logger_->loadBuiltinMsgs(builtinMsgTable);
-    klpSetProcessLogger(logger_);
+    logger_ = std::make_unique<klptest::ProcessLogger>();
     auto t = smallTable();
     int rc = -1;
     p_ = std::make_unique<klpParmClass>(t.data(), static_cast<int>(t.size()), &rc);
@@ -58,8 +56,7 @@ class ParmTest : public ::testing::Test {
   void TearDown() override {
     klpSetCurrentParms(nullptr);
     p_.reset();
-    klpSetProcessLogger(nullptr);
-    delete logger_;
+    logger_.reset();
   }
   static void begin() {
     fflush(stdout);
@@ -69,7 +66,7 @@ class ParmTest : public ::testing::Test {
     fflush(stdout);
     return ::testing::internal::GetCapturedStdout();
   }
-  msgLogger* logger_ = nullptr;
+  std::unique_ptr<klptest::ProcessLogger> logger_;
   std::unique_ptr<klpParmClass> p_;
 };
 
@@ -168,18 +165,18 @@ TEST_F(ParmTest, HigherSourcesAreNeverReplacedByLowerOnes) {
   EXPECT_EQ(p.setParm(2, "XYZ", PARM_SRC_COMMANDLINE), 0);
   EXPECT_STREQ(p.getParmString(2), "ABC");
 
-  ASSERT_EQ(logger_->getConsoleFlag(), 0);
+  ASSERT_EQ(logger_->get()->getConsoleFlag(), 0);
   p.setParmBool(4, 1, PARM_SRC_COMMANDLINE);
-  EXPECT_EQ(logger_->getConsoleFlag(), 1);
+  EXPECT_EQ(logger_->get()->getConsoleFlag(), 1);
   p.setBool(4, 'n', PARM_SRC_COMMANDLINE);
-  EXPECT_EQ(logger_->getConsoleFlag(), 0);
+  EXPECT_EQ(logger_->get()->getConsoleFlag(), 0);
   p.setParmValue(4, "yes", PARM_SRC_CHGPARMS);
-  EXPECT_EQ(logger_->getConsoleFlag(), 1);
+  EXPECT_EQ(logger_->get()->getConsoleFlag(), 1);
   // Dropped by priority: the flag follows the stored value, not the request.
   EXPECT_EQ(p.setBool(4, 'N', PARM_SRC_COMMANDLINE), 0);
   EXPECT_EQ(p.setParmBool(4, 0, PARM_SRC_TABLE), 0);
   EXPECT_EQ(p.getParmBool(4), 1);
-  EXPECT_EQ(logger_->getConsoleFlag(), 1);
+  EXPECT_EQ(logger_->get()->getConsoleFlag(), 1);
 
   // A command ignores priority.
   EXPECT_EQ(p.setCommand(3, 1, "first", PARM_SRC_KAPPLY), 0);

@@ -204,17 +204,22 @@ int OrdList::putHead(OrdListElement* e) {
   return unlockList();
 }
 
-OrdListElement* OrdList::getHead() {
-  if (loadLink(&olHead) == nullptr) return nullptr;
-  check("OrdList::getHead");
+// Takes the element at one end: the head (whose head-side neighbour is
+// null) or the tail (whose tail-side neighbour is null).
+OrdListElement* OrdList::takeEnd(bool fromHead, const char* where) {
+  OrdListElement** end = fromHead ? &olHead : &olTail;
+  OrdListElement** other = fromHead ? &olTail : &olHead;
+  if (loadLink(end) == nullptr) return nullptr;
+  check(where);
   if (lockList() != 0) return nullptr;
-  OrdListElement* e = olHead;
+  OrdListElement* e = *end;
   if (e != nullptr) {
-    storeLink(&olHead, e->olePrev);
-    if (olHead != nullptr)
-      olHead->oleNext = nullptr;
+    OrdListElement* inward = fromHead ? e->olePrev : e->oleNext;
+    storeLink(end, inward);
+    if (inward != nullptr)
+      (fromHead ? inward->oleNext : inward->olePrev) = nullptr;
     else
-      storeLink(&olTail, nullptr);
+      storeLink(other, nullptr);
     --count;
     e->oleAnchor = nullptr;
     e->olePrev = nullptr;
@@ -224,25 +229,9 @@ OrdListElement* OrdList::getHead() {
   return e;
 }
 
-OrdListElement* OrdList::getTail() {
-  if (loadLink(&olTail) == nullptr) return nullptr;
-  check("OrdList::getTail");
-  if (lockList() != 0) return nullptr;
-  OrdListElement* e = olTail;
-  if (e != nullptr) {
-    storeLink(&olTail, e->oleNext);
-    if (olTail != nullptr)
-      olTail->olePrev = nullptr;
-    else
-      storeLink(&olHead, nullptr);
-    --count;
-    e->oleAnchor = nullptr;
-    e->olePrev = nullptr;
-    e->oleNext = nullptr;
-  }
-  unlockList();
-  return e;
-}
+OrdListElement* OrdList::getHead() { return takeEnd(true, "OrdList::getHead"); }
+
+OrdListElement* OrdList::getTail() { return takeEnd(false, "OrdList::getTail"); }
 
 OrdListElement* OrdList::browseHead() {
   if (loadLink(&olHead) == nullptr) return nullptr;

@@ -105,6 +105,8 @@ class OrdList {
 
   // Fatal when the list is not sound (self pointer of a locked list).
   void check(const char* where) const;
+ private:
+  OrdListElement* takeEnd(bool fromHead, const char* where);
 };
 
 // Removes the element from its list wherever it stands. 0 or 1005; message

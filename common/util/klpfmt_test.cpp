@@ -42,16 +42,7 @@ class Fmt : public ::testing::Test {
 // A process logger writing to a log file in its own directory.
 struct LogFile {
   klptest::TmpDir dir;
-  msgLogger* logger = createMsgLoggerU(MSG_APP_KLPKCCMD, 0);
-  LogFile() {
-    logger->loadBuiltinMsgs(builtinMsgTable);
-    logger->setLogFileName(dir.path().c_str(), "fmt.log");
-    klpSetProcessLogger(logger);
-  }
-  ~LogFile() {
-    klpSetProcessLogger(nullptr);
-    delete logger;
-  }
+  klptest::ProcessLogger logger{MSG_APP_KLPKCCMD, dir.path(), "fmt.log"};
   std::string text() const { return klptest::readFile(dir.path() + "fmt.log"); }
 };
 

@@ -11,6 +11,7 @@
 #include "common/env/klpenv.h"
 #include "common/msg/klplog.h"
 #include "common/msg/msglogger.h"
+#include "common/platform/hsv.h"
 #include "common/thread/klpthread.h"
 #include "include/klpapi.h"
 #include "tests/e2e/e2e_support.h"
@@ -394,6 +395,13 @@ TEST_F(ControlInterface, ASignalWhileACallerWaitsStillDestroysItsReplyQueue) {
   }
   std::string reply = s.queue() + ".CMD" + std::to_string(pid);
   EXPECT_TRUE(e2e::waitFor([&] { return klptest::queueExists(reply); }, 20000));
+  // Signal it while it waits, once its request is on the server's queue.
+  HSVResID sid;
+  ASSERT_EQ(hsvIPCGetQueResID(s.queue().c_str(), HSV_QUEUE_RESID_OPTION, &sid), ECF_OK);
+  HSVHIPCQueue serverQueue;
+  ASSERT_EQ(serverQueue.attach(sid), ECF_OK);
+  EXPECT_TRUE(e2e::waitFor([&] { return serverQueue.hasMessage(); }, 20000));
+  serverQueue.detach();
   kill(pid, SIGINT);
   int status = 0;
   ASSERT_TRUE(e2e::waitFor([&] { return waitpid(pid, &status, WNOHANG) == pid; }, 20000));

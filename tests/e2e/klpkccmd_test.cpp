@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include "common/platform/hsv.h"
 #include "tests/e2e/e2e_support.h"
 
 using e2e::Server;
@@ -194,6 +195,15 @@ TEST(Klpkccmd, InterruptedWhileWaitingItDestroysItsReplyQueue) {
       {klptest::binPath("klpkccmd"), "CAPTURE_SERVER=INTR", "STATUS"});
   std::string reply = e2e::replyQueuePath(dir, "INTR", client.pid());
   EXPECT_TRUE(e2e::waitFor([&] { return klptest::queueExists(reply); }, 20000));
+  // Signal it once its request is on the server's queue, that is while it
+  // waits: a jump out of the middle of issuing a message would abandon that
+  // message's memory, which the leak checker reports.
+  HSVResID sid;
+  ASSERT_EQ(hsvIPCGetQueResID(s.queue().c_str(), HSV_QUEUE_RESID_OPTION, &sid), ECF_OK);
+  HSVHIPCQueue serverQueue;
+  ASSERT_EQ(serverQueue.attach(sid), ECF_OK);
+  EXPECT_TRUE(e2e::waitFor([&] { return serverQueue.hasMessage(); }, 20000));
+  serverQueue.detach();
   client.kill(SIGINT);
   klptest::ProcessResult r = client.wait(30000);
   EXPECT_EQ(r.exitCode, 12) << r.out << r.err;
@@ -214,7 +224,8 @@ TEST(Klpkccmd, AServerStartedAgainAfterSigkillAnswers) {
     first.proc().wait(10000);
   }
   Server second(dir, "AGAIN", {"LOGSTDOUT"});
-  ASSERT_TRUE(e2e::waitFor([&] { return e2e::countOf(second.log(), "KLP0594I") == 2; }, 20000));
+  ASSERT_TRUE(e2e::waitFor([&] { return e2e::countOf(second.log(), "KLP0594I") == 2; }, 20000))
+      << second.log() << second.proc().out() << second.proc().err();
   std::string out = second.proc().out();
   size_t a = out.find("KLP0592I"), d = out.find("KLP0595I"), c = out.find("KLP0594I");
   ASSERT_NE(a, std::string::npos) << out;

@@ -18,6 +18,7 @@
 #include <stdexcept>
 #include <thread>
 
+#include "common/msg/msglogger.h"
 #include "common/platform/hsv.h"
 
 extern char** environ;
@@ -239,6 +240,20 @@ bool memoryExists(const std::string& path) {
   bool found = m.attach(id) == ECF_OK;
   if (found) m.detach();
   return found;
+}
+
+ProcessLogger::ProcessLogger(int applicationIndex, const std::string& logDir,
+                             const std::string& logFile)
+    : logger_(createMsgLoggerU(applicationIndex, 0)), saved_(klpGetProcessLogger()) {
+  if (logger_ == nullptr) throw std::runtime_error("no memory for the logger");
+  logger_->loadBuiltinMsgs(builtinMsgTable);
+  if (!logDir.empty() && !logFile.empty()) logger_->setLogFileName(logDir.c_str(), logFile.c_str());
+  klpSetProcessLogger(logger_);
+}
+
+ProcessLogger::~ProcessLogger() {
+  klpSetProcessLogger(saved_);
+  delete logger_;
 }
 
 }  // namespace klptest

@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+class msgLogger;
+
 namespace klptest {
 
 // A fresh directory under /tmp, set as TMPDIR for this process (and so for
@@ -86,5 +88,23 @@ struct Child {
 // under dir (which ends in "/"); the child exits with body's answer. Waits
 // at most timeoutMs, then kills it.
 Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs = 20000);
+
+// The process logger a program makes first (application 10 unless given,
+// synchronous, built-in texts loaded), installed for the object's life and
+// writing to dir/file when both are given; the previous logger comes back.
+class ProcessLogger {
+ public:
+  explicit ProcessLogger(int applicationIndex = 10, const std::string& logDir = "",
+                         const std::string& logFile = "");
+  ~ProcessLogger();
+  ProcessLogger(const ProcessLogger&) = delete;
+  ProcessLogger& operator=(const ProcessLogger&) = delete;
+  msgLogger* operator->() const { return logger_; }
+  msgLogger* get() const { return logger_; }
+
+ private:
+  msgLogger* logger_;
+  msgLogger* saved_;
+};
 
 }  // namespace klptest
