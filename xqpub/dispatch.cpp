@@ -13,12 +13,15 @@
 namespace {
 
 // Copies a parameter value by length into a zeroed name field of the status
-// request, keeping its last byte as the terminator.
-void copyName(char* field, size_t fieldLen, const char* value) {
+// request, keeping its last byte as the terminator. Answers false when the
+// value does not fit: a cut name would ask some other server than STATUS.
+bool copyName(char* field, size_t fieldLen, const char* value) {
   std::memset(field, 0, fieldLen);
-  if (!value) return;
-  size_t n = strnlen(value, fieldLen - 1);
+  if (!value) return true;
+  size_t n = strnlen(value, fieldLen);
+  if (n == fieldLen) return false;
   std::memcpy(field, value, n);
+  return true;
 }
 
 int detailedStatus() {
@@ -36,12 +39,13 @@ int detailedStatus() {
   klpParmClass* parms = klpGetCurrentParms();
   const char* server = parms ? parms->getParmString(PARM_IDX_SERVER) : nullptr;
   const char* schema = parms ? parms->getParmString(PARM_IDX_SCHEMA) : nullptr;
-  copyName(request.serverName, sizeof(request.serverName), server);
-  copyName(request.schema, sizeof(request.schema), schema);
   request.buffer = nullptr;
   request.bufferSize = 0;
 
-  int rc = klpCollectStatus(&release, &request, &result, nullptr);
+  int rc = KLP_API_BAD_NAME;
+  if (copyName(request.serverName, sizeof(request.serverName), server) &&
+      copyName(request.schema, sizeof(request.schema), schema))
+    rc = klpCollectStatus(&release, &request, &result, nullptr);
   if (rc == 0)
     klpPrintFullStatus(server, schema, request.buffer, 0);
   else if (rc == KLP_API_NO_REPLY)

@@ -26,7 +26,7 @@ enum : int {
   MSG_CURRENT_MEMORY = 7121,
   MSG_HEADING = 7122,
   MSG_STATUS_UP = 7123,
-  MSG_STATUS_DOWN = 7124,
+  MSG_STATUS_UNKNOWN = 7124,
   MSG_NOT_AVAILABLE = 7193,
 };
 
@@ -125,7 +125,7 @@ void klpPrintShortStatus(const char* server, const char* schema, const void*, in
   klpReportRow rows[3] = {
       {MSG_SERVER, "", "SERVER", orEmpty(server)},
       {MSG_SCHEMA, "", "SCHEMA", orEmpty(schema)},
-      {MSG_STATUS, "", "STATUS", klpCatalogLabel(MSG_STATUS_DOWN)},
+      {MSG_STATUS, "", "STATUS", klpCatalogLabel(MSG_STATUS_UNKNOWN)},
   };
   printReport(rows, 3, quiet);
 }

@@ -5,6 +5,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <mutex>
 
 #include "common/env/klpenv.h"
 #include "common/ipc/ipcmsg.h"
@@ -43,16 +44,21 @@ void copyText(char* field, size_t fieldLen, const char* src, size_t srcMax) {
   field[n] = '\0';
 }
 
-// A length-prefixed text at payload offset `at` (taken from a 16-bit word),
-// or nothing when the offset is 0 or the text would run past the payload.
-bool prefixedText(const char* payload, size_t len, size_t at, const char** text,
-                  size_t* textLen) {
-  if (at == 0 || at + 2 > len) return false;
+// A length-prefixed text at payload offset `at` (taken from a 16-bit word).
+// Answers 0 with the text, 0 with an empty text when the offset is 0 (there
+// is none), or 2017 when the text would run past the payload: an offset or
+// length that points elsewhere makes the whole reply malformed.
+int prefixedText(const char* payload, size_t len, size_t at, const char** text,
+                 size_t* textLen) {
+  *text = "";
+  *textLen = 0;
+  if (at == 0) return 0;
+  if (at + 2 > len) return KLP_API_BAD_REPLY;
   size_t n = rd16(payload, at);
-  if (at + 2 + n > len) return false;
+  if (at + 2 + n > len) return KLP_API_BAD_REPLY;
   *text = payload + at + 2;
   *textLen = n;
-  return true;
+  return 0;
 }
 
 }  // namespace
@@ -171,15 +177,22 @@ int klpStatusFromKcap(const char* payload, size_t len, char* out, size_t outLen,
                       int32_t* required) {
   *required = KLP_STATUS_FMT3_SIZE;
   if (!payload || len < kcapDetails::kMinSize) return KLP_API_BAD_REPLY;
+  // Everything the offsets name must lie inside the payload, whether or not
+  // the caller's buffer takes the data this time.
+  const char *logFile, *sectionText;
+  size_t logFileLen, sectionTextLen;
+  if (prefixedText(payload, len, rd16(payload, kcapDetails::kLogFileRef), &logFile, &logFileLen))
+    return KLP_API_BAD_REPLY;
+  size_t sec = rd16(payload, kcapDetails::kSectionRef);
+  if (sec != 0 && sec + 62 > len) return KLP_API_BAD_REPLY;
+  if (sec != 0 && prefixedText(payload, len, sec + 60, &sectionText, &sectionTextLen))
+    return KLP_API_BAD_REPLY;
   if (!out || outLen < KLP_STATUS_FMT3_SIZE) return KLP_API_BUFFER_TOO_SMALL;
   klpStatusFmt3 s;
   std::memset(&s, 0, sizeof(s));
   s.format = 3;
   s.upTime = rd32(payload, kcapDetails::kUpTime);
-  const char* text;
-  size_t textLen;
-  if (prefixedText(payload, len, rd16(payload, kcapDetails::kLogFileRef), &text, &textLen))
-    copyText(s.logFile, sizeof(s.logFile), text, textLen);
+  copyText(s.logFile, sizeof(s.logFile), logFile, logFileLen);
   s.activeSubs = rd32(payload, kcapDetails::kActiveSubs);
   copyText(s.currentLogTime, sizeof(s.currentLogTime), payload + kcapDetails::kLogTime,
            kcapDetails::kLogTimeLen);
@@ -192,13 +205,10 @@ int klpStatusFromKcap(const char* payload, size_t len, char* out, size_t outLen,
     copyText(s.allPublishedLsn, sizeof(s.allPublishedLsn), lsnText, sizeof(lsnText));
   }
   s.currentMemory = rd32(payload, kcapDetails::kMemory);
-  size_t sec = rd16(payload, kcapDetails::kSectionRef);
-  if (sec != 0 && sec + 62 <= len) {
-    const char* section = payload + sec;
-    std::memcpy(s.sectionA, section, 30);
-    std::memcpy(s.sectionB, section + 30, 30);
-    if (prefixedText(payload, len, sec + 60, &text, &textLen))
-      copyText(s.sectionText, sizeof(s.sectionText), text, textLen);
+  if (sec != 0) {
+    std::memcpy(s.sectionA, payload + sec, 30);
+    std::memcpy(s.sectionB, payload + sec + 30, 30);
+    copyText(s.sectionText, sizeof(s.sectionText), sectionText, sectionTextLen);
   }
   std::memcpy(out, &s, sizeof(s));
   return 0;
@@ -215,6 +225,9 @@ int klpStatusFromKapp(const char* payload, size_t len, char* out, size_t outLen,
     return KLP_API_BAD_REPLY;
   uint64_t need = kOutHead + kOutRec * static_cast<uint64_t>(count ? count : 1);
   if (need > INT32_MAX) return KLP_API_BAD_REPLY;
+  const char* text;
+  size_t textLen;
+  if (prefixedText(payload, len, rd16(payload, 20), &text, &textLen)) return KLP_API_BAD_REPLY;
   *required = static_cast<int32_t>(need);
   if (!out || outLen < KLP_STATUS_FMT2_MIN) return 0;
   size_t fit = (outLen - kOutHead) / kOutRec;
@@ -225,10 +238,7 @@ int klpStatusFromKapp(const char* payload, size_t len, char* out, size_t outLen,
   h.format = 2;
   h.count = static_cast<int32_t>(n);
   h.value8 = rd32(payload, 16);
-  const char* text;
-  size_t textLen;
-  if (prefixedText(payload, len, rd16(payload, 20), &text, &textLen))
-    copyText(h.text, sizeof(h.text), text, textLen);
+  copyText(h.text, sizeof(h.text), text, textLen);
   h.value1040 = rd32(payload, 24);
   h.value1044 = rd32(payload, 28);
   std::memcpy(out, &h, sizeof(h));
@@ -331,21 +341,37 @@ struct HeldQueue {
   recoveryRes* res = nullptr;
 };
 
-// Releases and forgets the queue (held becomes null).
+// A queue object not yet attached or created, whose recovery action
+// (erHSVIPCQdetach or erHSVIPCQdestroy) is registered before the queue
+// exists: a signal right after the attach or create still undoes it, and
+// one before finds nothing to undo. Null when memory ran out.
+HeldQueue* newHeld(recoveryAction action) {
+  HeldQueue* held = new (std::nothrow) HeldQueue;
+  if (held) held->queue = new (std::nothrow) HSVHIPCQueue;
+  if (!held || !held->queue) {
+    delete held;
+    return nullptr;
+  }
+  held->res = addRcvyRes(action, reinterpret_cast<uint64_t>(&held->queue));
+  return held;
+}
+
+// Detaches or destroys the queue, and only then drops its recovery action:
+// a signal in between finds the queue closed and leaves it be. Held becomes
+// null.
 void releaseHeld(HeldQueue*& held, bool destroy) {
   if (!held) return;
-  endRcvyRes(held->res);
-  held->res = nullptr;
   if (held->queue) {
     if (destroy)
       held->queue->destroy();
     else
       held->queue->detach();
-    delete held->queue;
-    held->queue = nullptr;
   }
-  delete held;
+  endRcvyRes(held->res);
+  HeldQueue* h = held;
   held = nullptr;
+  delete h->queue;
+  delete h;
 }
 
 const char* const kOrigin = "cmdAPIFunc";
@@ -423,10 +449,10 @@ int printReply(const IpcMsg& header, const char* payload, size_t len, klpMsgCapt
   return 0;
 }
 
-// Puts one request; 0, 1003 or 805 (messages issued).
+// Puts one request, with text (and its NUL) as payload when text is not
+// null; 0, 1003 or 805 (messages issued).
 int putRequest(HSVHIPCQueue* queue, int func, int subFunc, const char* text, const char* resId,
                const char* path, klpMsgCapture* cap) {
-  if (text && (text == klpEmptyText || *text == '\0')) text = nullptr;
   IpcMsg* msg = nullptr;
   int rc = createRequestMsg(&msg, func, subFunc, text);
   if (rc == KLP_RC_MSG_NO_MEMORY) return rc;
@@ -456,15 +482,22 @@ hsvRC createReplyQueue(HSVHIPCQueue* q, const HSVResID& id) {
   return q->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION);
 }
 
+// One exchange at a time per process: the reply queue is named by the
+// process id alone, so a second exchange at once would replace the first
+// one's queue and take its reply.
+std::mutex exchangeLock;
+
 // What one exchange holds. It lives on the heap because a trap jumps past
 // the exchange's frame: the queue actions registered later run first, then
-// this state's own resource frees what is left.
+// this state's own resource frees what is left and lets the next exchange
+// go.
 struct CallState {
   HeldQueue* server = nullptr;
   HeldQueue* reply = nullptr;
   IpcGather gather;
   char msg[HSV_MAX_MSG_SIZE];
   recoveryRes* res = nullptr;
+  bool holdsLock = false;
 };
 
 void freeCallState(uint64_t arg) {
@@ -474,31 +507,26 @@ void freeCallState(uint64_t arg) {
     delete h->queue;  // null when its own action already ran
     delete h;
   }
+  if (st->holdsLock) exchangeLock.unlock();
   delete st;
 }
 
-int exchange(CallState* st, const char* path, const char* serverName, int func,
-             const char* payload, char** replyBuf, klpMsgCapture* cap);
+int exchange(CallState* st, const char* serverName, int func, const char* payload,
+             char** replyBuf, klpMsgCapture* cap);
 
 }  // namespace
 
 int cmdAPIFunc(const char* serverName, int func, const char* payload, char** replyBuf,
                klpMsgCapture* capture) {
   if (replyBuf) *replyBuf = nullptr;
-  klpMsgCapture* cap = capture;
-  klpEnv* env = klpGetEnv();
-  const char* dir = getEnvIPCDir(env);
-
-  char path[KLP_ENV_PATH_MAX + KLP_UNIQUE_NAME_SIZE + 32];
-  if (!serverName || ipcServerQueuePath(path, sizeof(path), dir, serverName) != 0) {
-    issue(cap, 506, kOrigin, KLP_DEST_SEVERITY, ipcProgramWord(serverName));
-    return KLP_RC_ATTACH_FAILED;
-  }
-
   CallState* st = new (std::nothrow) CallState;
   if (!st) return KLP_RC_MSG_NO_MEMORY;
   st->res = addRcvyRes(freeCallState, reinterpret_cast<uint64_t>(st));
-  int rc = exchange(st, path, serverName, func, payload, replyBuf, cap);
+  exchangeLock.lock();
+  st->holdsLock = true;
+  int rc = exchange(st, serverName, func, payload, replyBuf, capture);
+  st->holdsLock = false;
+  exchangeLock.unlock();
   endRcvyRes(st->res);
   delete st;
   return rc;
@@ -506,17 +534,18 @@ int cmdAPIFunc(const char* serverName, int func, const char* payload, char** rep
 
 namespace {
 
-int exchange(CallState* st, const char* path, const char* serverName, int func,
-             const char* payload, char** replyBuf, klpMsgCapture* cap) {
+int exchange(CallState* st, const char* serverName, int func, const char* payload,
+             char** replyBuf, klpMsgCapture* cap) {
   // 1-3: the server queue.
-  HeldQueue*& server = st->server;
-  server = new (std::nothrow) HeldQueue;
-  if (server) server->queue = new (std::nothrow) HSVHIPCQueue;
-  if (!server || !server->queue) {
-    delete server;
-    server = nullptr;
-    return KLP_RC_MSG_NO_MEMORY;
+  char path[KLP_ENV_PATH_MAX + KLP_UNIQUE_NAME_SIZE + 32];
+  if (!serverName ||
+      ipcServerQueuePath(path, sizeof(path), getEnvIPCDir(klpGetEnv()), serverName) != 0) {
+    issue(cap, 506, kOrigin, KLP_DEST_SEVERITY, ipcProgramWord(serverName));
+    return KLP_RC_ATTACH_FAILED;
   }
+  HeldQueue*& server = st->server;
+  server = newHeld(erHSVIPCQdetach);
+  if (!server) return KLP_RC_MSG_NO_MEMORY;
   char serverId[160];
   hsvRC prc = 0;
   int rc = KLPAttachIPCQ(server->queue, serverId, sizeof(serverId), path, &prc);
@@ -527,17 +556,13 @@ int exchange(CallState* st, const char* path, const char* serverName, int func,
     return rc;
   }
   issue(cap, 592, kOrigin, KLP_DEST_SEVERITY, serverId);
-  server->res = addRcvyRes(erHSVIPCQdetach, reinterpret_cast<uint64_t>(&server->queue));
 
   // 4: the reply queue.
   char replyPath[KLP_ENV_PATH_MAX + KLP_UNIQUE_NAME_SIZE + 48];
   std::snprintf(replyPath, sizeof(replyPath), "%s.CMD%d", path, hsvProcessID());
   HeldQueue*& reply = st->reply;
-  reply = new (std::nothrow) HeldQueue;
-  if (reply) reply->queue = new (std::nothrow) HSVHIPCQueue;
-  if (!reply || !reply->queue) {
-    delete reply;
-    reply = nullptr;
+  reply = newHeld(erHSVIPCQdestroy);
+  if (!reply) {
     releaseHeld(server, false);
     return KLP_RC_MSG_NO_MEMORY;
   }
@@ -554,14 +579,11 @@ int exchange(CallState* st, const char* path, const char* serverName, int func,
   if (prc != ECF_OK) {
     issue(cap, 596, kOrigin, KLP_DEST_SEVERITY, replyId, replyPath, ecfErrorGetDescription(prc));
     issue(cap, 507, kOrigin, KLP_DEST_SEVERITY);
-    delete reply->queue;
-    delete reply;
-    reply = nullptr;
+    releaseHeld(reply, false);  // never created: nothing to destroy
     releaseHeld(server, false);
     return KLP_RC_QUEUE_UNAVAILABLE;
   }
   issue(cap, 594, kOrigin, KLP_DEST_SEVERITY, replyId);
-  reply->res = addRcvyRes(erHSVIPCQdestroy, reinterpret_cast<uint64_t>(&reply->queue));
 
   // 5: send.
   int outstanding = 0;
@@ -576,6 +598,9 @@ int exchange(CallState* st, const char* path, const char* serverName, int func,
       if (rc == 0) ++outstanding;
     }
   } else if (func != KLP_FUNC_NONE) {
+    // A missing text or the shared empty text sends none; a changed
+    // parameter's value above always goes, even when empty.
+    if (payload && (payload == klpEmptyText || *payload == '\0')) payload = nullptr;
     rc = putRequest(server->queue, func, 0, payload, serverId, path, cap);
     if (rc == 0) outstanding = 1;
   }
@@ -621,6 +646,9 @@ int exchange(CallState* st, const char* path, const char* serverName, int func,
       rc = KLP_RC_GET_FAILED;
       break;
     }
+    // A late reply to an earlier exchange that gave up waiting reaches this
+    // one's queue of the same name: it is not this request's answer.
+    if (view.header.func != func) continue;
     int32_t piecesLeft = 0;
     int arc = gather.add(view, &piecesLeft);
     if (arc == KLP_RC_MSG_NO_MEMORY) {
@@ -668,12 +696,8 @@ int KLPResponseFunc(int32_t requesterPid, IpcMsg* replyMsg) {
   char path[KLP_ENV_PATH_MAX + KLP_UNIQUE_NAME_SIZE + 32];
   if (ipcEnvReplyQueuePath(path, sizeof(path), requesterPid) != 0) return KLP_RC_ATTACH_FAILED;
 
-  HeldQueue* held = new (std::nothrow) HeldQueue;
-  if (held) held->queue = new (std::nothrow) HSVHIPCQueue;
-  if (!held || !held->queue) {
-    delete held;
-    return KLP_RC_MSG_NO_MEMORY;
-  }
+  HeldQueue* held = newHeld(erHSVIPCQdetach);
+  if (!held) return KLP_RC_MSG_NO_MEMORY;
   char resId[160];
   hsvRC prc = 0;
   int rc = KLPAttachIPCQ(held->queue, resId, sizeof(resId), path, &prc);
@@ -682,7 +706,6 @@ int KLPResponseFunc(int32_t requesterPid, IpcMsg* replyMsg) {
     return rc;
   }
   issue(nullptr, 592, origin, KLP_DEST_SEVERITY, resId);
-  held->res = addRcvyRes(erHSVIPCQdetach, reinterpret_cast<uint64_t>(&held->queue));
 
   size_t payloadLen = static_cast<size_t>(replyMsg->msgLength) - IPC_HEADER_SIZE;
   if (payloadLen <= IPC_MAX_PAYLOAD) {
@@ -725,7 +748,13 @@ int KLPCmdFunc() {
 
 int KLPMonFunc(const char* name, const char* suffix, klpMsgCapture* capture) {
   char server[KLP_UNIQUE_NAME_SIZE + 64];
-  std::snprintf(server, sizeof(server), "%s.%s", name ? name : "", suffix ? suffix : "");
+  int n = std::snprintf(server, sizeof(server), "%s.%s", name ? name : "", suffix ? suffix : "");
+  if (n < 0 || static_cast<size_t>(n) >= sizeof(server)) {
+    // A cut name would address some other server.
+    internalError(capture, "KLPMonFunc", KLP_API_BAD_NAME, "server name",
+                  "the server name and its suffix do not fit a server name");
+    return KLP_API_BAD_NAME;
+  }
   return cmdAPIFunc(server, IPC_FUNC_STATUS, nullptr, nullptr, capture);
 }
 
@@ -735,7 +764,10 @@ int KLPMonFunc(const char* name, const char* suffix, klpMsgCapture* capture) {
 
 void klpEnsureMainThread() {
   // A caller of the control interface may never have run a prologue; the
-  // thread list and the recovery manager must know the calling thread.
+  // thread list and the recovery manager must know the calling thread. Two
+  // of its threads may call at once: the prologue runs once.
+  static std::mutex once;
+  std::lock_guard<std::mutex> hold(once);
   klpThread* main = klpMainThread();
   if (main && main->getState() == KLP_THREAD_EXIST) klpThread::prologue(main);
 }
@@ -743,6 +775,36 @@ void klpEnsureMainThread() {
 static bool releaseOk(const klpReleaseInfo* r) {
   return r->version == KLP_API_VERSION && r->release == KLP_API_RELEASE &&
          r->modification == KLP_API_MODIFICATION;
+}
+
+// The payload of a reply buffer and its length (null and 0 for none).
+static const char* replyPayload(const char* reply, size_t* len) {
+  int32_t l = reply ? rd32(reply, 4) : 0;
+  *len = l > 0 ? static_cast<size_t>(l) : 0;
+  return reply ? reply + KLP_REPLY_HEADER : nullptr;
+}
+
+int klpStatusSizeFromReply(int32_t kind, const char* reply, int32_t* size,
+                           klpMsgCapture* capture) {
+  *size = 0;
+  size_t len = 0;
+  const char* payload = replyPayload(reply, &len);
+  int32_t count = -1;
+  if (payload && len >= IPC_SISIZE_TEXT_SIZE + 4 &&
+      std::memcmp(payload, IPC_SISIZE_TEXT, IPC_SISIZE_TEXT_SIZE) == 0)
+    count = rd32(payload, IPC_SISIZE_TEXT_SIZE);
+  int64_t n = count > 0 ? count : 1;
+  int64_t need = kind == KLP_KIND_KAPP
+                     ? static_cast<int64_t>(sizeof(klpStatusFmt2)) +
+                           static_cast<int64_t>(sizeof(klpStatusFmt2Record)) * n
+                     : 8 + static_cast<int64_t>(sizeof(klpStatusThread)) * n;
+  if (count < 0 || need > INT32_MAX) {
+    internalError(capture, "klpGetStatusSize", KLP_API_BAD_REPLY, "status size",
+                  "the reply is not a status size reply");
+    return KLP_API_BAD_REPLY;
+  }
+  *size = static_cast<int32_t>(need);
+  return 0;
 }
 
 static void copyCapture(klpResultBlock* result, const klpMsgCapture* cap) {
@@ -777,9 +839,8 @@ int klpCollectStatus(const klpReleaseInfo* release, klpStatusRequest* request,
     copyCapture(result, capture);
     return done(klpMapCmdRc(rc));
   }
-  int32_t l = reply ? rd32(reply, 4) : 0;
-  size_t len = l > 0 ? static_cast<size_t>(l) : 0;
-  const char* payload = reply ? reply + KLP_REPLY_HEADER : nullptr;
+  size_t len = 0;
+  const char* payload = replyPayload(reply, &len);
   auto convert = [&](char* out, size_t outLen, int32_t* required) {
     if (kind == KLP_KIND_KCAP) return klpStatusFromKcap(payload, len, out, outLen, required);
     if (kind == KLP_KIND_KAPP) return klpStatusFromKapp(payload, len, out, outLen, required);

@@ -44,8 +44,10 @@ constexpr size_t KLP_REPLY_HEADER = 8;
 // Sends function code `func` to the server whose name (prefix) is serverName.
 // payload: request text or null. replyBuf: when given, the reply payload is
 // gathered into a new buffer stored there (null on failure) instead of being
-// printed. capture: see klpMsgCapture. Answers 0, 804, 805, 815, 816, 817,
-// 824, 825 or 1003.
+// printed. capture: see klpMsgCapture. A reply whose function code is not
+// func is dropped (a late answer to an earlier call). One call at a time
+// runs in a process; another thread's call waits for it. Answers 0, 804,
+// 805, 815, 816, 817, 824, 825 or 1003.
 int cmdAPIFunc(const char* serverName, int func, const char* payload, char** replyBuf,
                klpMsgCapture* capture);
 
@@ -66,7 +68,8 @@ int KLPResponseFunc(int32_t requesterPid, IpcMsg* reply);
 // are printed.
 int KLPCmdFunc();
 
-// Sends STATUS to the server "name.suffix" and prints the reply.
+// Sends STATUS to the server "name.suffix" and prints the reply; 2009 when
+// that name does not fit a server name.
 int KLPMonFunc(const char* name, const char* suffix, klpMsgCapture* capture);
 
 // The status collector behind klpGetStatus; the command program calls it
@@ -74,6 +77,13 @@ int KLPMonFunc(const char* name, const char* suffix, klpMsgCapture* capture);
 // and then frees request->buffer.
 int klpCollectStatus(const klpReleaseInfo* release, klpStatusRequest* request,
                      klpResultBlock* result, klpMsgCapture* capture);
+
+// The status size of a reply to the status size query (59, or 62 for
+// KAPP): "klpSISize: " with its NUL, then the thread count, gives the size
+// status format 1 (format 2 for KAPP) needs. Answers 0, or 2017 when the
+// reply is no such answer (message issued).
+int klpStatusSizeFromReply(int32_t kind, const char* reply, int32_t* size,
+                           klpMsgCapture* capture);
 
 // Runs the prologue of the process's main thread object while it is still in
 // state 1, so that a caller of the control interface is a known thread.
@@ -104,7 +114,8 @@ int32_t klpThreadKind(const char* name);
 // Converting a reply payload into status data. payload/len: the gathered
 // payload. out/outLen: the caller's buffer (may be null when outLen is 0).
 // *required receives the size the data needs. Answers 0, 1001 (buffer too
-// small) or 2017 (the payload does not hold what it claims).
+// small) or 2017 (the payload does not hold what its counts, offsets and
+// lengths claim; nothing is filled then).
 int klpStatusFromThreads(const char* payload, size_t len, char* out, size_t outLen,
                          int32_t* required);
 int klpStatusFromKcap(const char* payload, size_t len, char* out, size_t outLen,

@@ -92,19 +92,14 @@ KLP_API int klpGetStatusSize(const klpReleaseInfo* release, klpStatusRequest* re
     copyCaptured(result, cap);
     return store(result, klpMapCmdRc(rc));
   }
-  // "klpSISize: " with its NUL, then the thread count.
-  int32_t len = 0, count = -1;
-  if (reply) std::memcpy(&len, reply + 4, sizeof(len));
-  if (reply && len >= static_cast<int32_t>(IPC_SISIZE_TEXT_SIZE + 4))
-    std::memcpy(&count, reply + KLP_REPLY_HEADER + IPC_SISIZE_TEXT_SIZE, sizeof(count));
+  int32_t size = 0;
+  rc = klpStatusSizeFromReply(kind, reply, &size, &cap);
   std::free(reply);
-  if (count < 0) return store(result, KLP_API_BAD_REPLY);
-  int64_t n = count ? count : 1;
-  int64_t size = kind == KLP_KIND_KAPP ? static_cast<int64_t>(sizeof(klpStatusFmt2)) +
-                                             static_cast<int64_t>(sizeof(klpStatusFmt2Record)) * n
-                                       : 8 + static_cast<int64_t>(sizeof(klpStatusThread)) * n;
-  if (size > INT32_MAX) return store(result, KLP_API_BAD_REPLY);
-  request->statusSize = static_cast<int32_t>(size);
+  if (rc != 0) {
+    copyCaptured(result, cap);
+    return store(result, rc);
+  }
+  request->statusSize = size;
   return store(result, 0);
 }
 

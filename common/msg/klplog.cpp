@@ -5,6 +5,7 @@
 #include <cstdarg>
 #include <cstdio>
 #include <cstring>
+#include <new>
 
 #include "common/msg/msglogger.h"
 #include "common/util/klprc.h"
@@ -48,14 +49,31 @@ int collect(int number, const char* firstValue, int count, va_list ap, const cha
   return MSG_MAX_VALUES;
 }
 
+// Composes texts for a caller that asks for one but made no process logger
+// (a C program using the control interface): the library's own, never
+// published, which writes nowhere, not even the report of a missing
+// catalogue.
+class textOnlyLogger : public msgLoggerU {
+ public:
+  textOnlyLogger() : msgLoggerU(MSG_APP_KLPKCCMD, 0) { loadBuiltinMsgs(builtinMsgTable); }
+  void writeStderr(logMsg*) override {}
+};
+
+msgLogger* textLogger() {
+  if (msgLogger* logger = processLogger.load()) return logger;
+  static msgLogger* own = new (std::nothrow) textOnlyLogger;
+  return own;
+}
+
 int issueV(int number, const char* origin, int destKind, const char* firstValue,
            klpMsgCtx* context, char* alsoText, uint16_t alsoChars, int count, va_list ap) {
-  msgLogger* logger = processLogger.load();
+  bool textOnly = context != nullptr && context->wantText;
+  msgLogger* logger = textOnly ? textLogger() : processLogger.load();
   if (logger == nullptr) return KLP_RC_BAD_PARM;
   const char* values[MSG_MAX_VALUES];
   int n = collect(number, firstValue, count, ap, values);
   if (number == -1) number = 8999;
-  if (context != nullptr && context->wantText) {
+  if (textOnly) {
     char text[MSG_DEFAULT_TEXT_SIZE + 1];
     int got = logger->getKlpMsgTextV(number, origin, " ", text, sizeof text, n, values);
     capture(context->buffer, context->bufferChars, got < 0 ? "" : text);

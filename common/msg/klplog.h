@@ -30,6 +30,9 @@ enum : int { KLP_DEST_LOG = 0, KLP_DEST_SEVERITY = 1, KLP_DEST_CONSOLE = 2 };
 // Issues message `number` with the values firstValue and `count` further
 // const char* arguments (the first nine values are kept; absent ones become
 // " "). Number -1 issues message 8999 with firstValue as its only value.
+// A text asked for through the context is composed even when the process
+// has no logger (a library caller's process), by a logger of the library's
+// own that is never published.
 // Answers 0, or the record's error (801) when the message was lost.
 int logKlpMsg(int number, const char* origin, int destKind, const char* firstValue,
               klpMsgCtx* context, int count, ...);

@@ -79,10 +79,14 @@ int main(void) {
     check(klpGetStatus(&rel, &req, &res) == KLP_API_NO_SERVER, "status without server name");
   }
 
-  /* Nobody serves this name: the attach is tried five times, then 2013. */
+  /* Nobody serves this name: the attach is tried five times, then 2013,
+   * with the messages' texts although this program made no logger. */
   check(klpStopProgram(KLP_KIND_KCAP, "NOSERVER", "KLP", 0, &res) == KLP_API_NOT_ATTACHABLE &&
             res.rc == KLP_API_NOT_ATTACHABLE,
         "stop of a server that is not running");
+  check(strstr(res.text, "KLP0506E") != NULL && strstr(res.text, "K Capture") != NULL &&
+            strstr(res.text, "KLP0597E") != NULL,
+        "the result text tells why");
 
   rmdir(dir);
   printf("%d passed, %d failed\n", passed, failed);

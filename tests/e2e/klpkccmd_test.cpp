@@ -169,6 +169,29 @@ TEST(Klpkccmd, WithoutAServerItGivesUpAfterFiveAttempts) {
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir, "NOBODY")));
 }
 
+// When the detailed status cannot be had, the short report says so without
+// claiming the server is up, and the run ends with 12.
+TEST(Klpkccmd, DetailedStatusThatCannotBeHadGivesTheShortReport) {
+  klptest::TmpDir dir;
+  const struct {
+    std::string server;
+    const char* code;  // the failure the step report names
+  } cases[] = {
+      {"NOBODY", "\"2013\""},
+      // Cut to the request's 128 characters it would name another server.
+      {std::string(140, 'L'), "\"2009\""},
+  };
+  for (const auto& c : cases) {
+    CmdRun run = klpkccmd(dir, c.server, {"STATUS", "SHOW", "DETAILS"});
+    EXPECT_EQ(run.r.exitCode, 12) << all(run);
+    EXPECT_EQ(e2e::countOf(run.r.out, " = "), 3u) << run.r.out;
+    EXPECT_NE(run.r.out.find("(SERVER) = " + c.server + "\n"), std::string::npos) << run.r.out;
+    EXPECT_NE(run.r.out.find("(STATUS) = Unknown: the detailed status could not be obtained\n"),
+              std::string::npos) << run.r.out;
+    EXPECT_NE(all(run).find(c.code), std::string::npos) << all(run);
+  }
+}
+
 TEST(Klpkccmd, AServerKilledBeforeItAnswersEndsInNoReply) {
   klptest::TmpDir dir;
   {
