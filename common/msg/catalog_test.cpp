@@ -7,6 +7,7 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <functional>
 #include <string>
 #include <utility>
@@ -237,6 +238,31 @@ TEST(Catalogue, OnlyARegularSoundFileFromTheDirectoryVariableIsUsed) {
     }, 10000);
     EXPECT_TRUE(c.finished) << r.what;
     EXPECT_EQ(r.reason, c.exitCode) << r.what;
+  }
+}
+
+// A program finds the catalogue beside itself or through KLP_CATALOG_DIR,
+// never in the build tree it was built in: a copy elsewhere goes without.
+TEST(Catalogue, ProgramsLookBesideThemselvesNotInTheBuildTree) {
+  klptest::TmpDir tmp;
+  std::string built = klptest::binPath("klpkccmd"), copy = tmp.path() + "klpkccmd";
+  ASSERT_TRUE(std::filesystem::copy_file(built, copy));
+  struct Row {
+    std::string program;
+    std::vector<std::string> env;
+    bool found;
+  };
+  const Row rows[] = {
+      {built, {}, true},
+      {copy, {}, false},
+      {copy, {"KLP_CATALOG_DIR=" KLP_BIN_DIR}, true},
+  };
+  for (const Row& r : rows) {
+    SCOPED_TRACE(r.program + (r.env.empty() ? "" : " " + r.env[0]));
+    auto p = klptest::run({r.program}, r.env);
+    EXPECT_EQ(12, p.exitCode);
+    EXPECT_EQ(r.found, p.err.find("KLP0513E") == std::string::npos) << p.err;
+    EXPECT_EQ(r.found, p.out.find("KLP0589E") != std::string::npos) << p.out;
   }
 }
 

@@ -19,8 +19,8 @@
 
 #include "common/msg/msglogger.h"
 
-#ifndef KLP_BUILD_DIR
-#define KLP_BUILD_DIR "."
+#ifndef KLP_DATA_DIR
+#define KLP_DATA_DIR "/usr/local/share/klp"
 #endif
 
 // The texts a lookup can find, by message number. Only decimal ids of
@@ -172,12 +172,12 @@ std::string joinDir(const std::string& dir, const char* name) {
 }
 
 // Where the catalogue lives: KLP_CATALOG_DIR, the program's directory, then
-// the build tree's bin/. A name with a '/' is taken as it is.
+// the installed data directory. A name with a '/' is taken as it is.
 std::string locate(const char* name) {
   if (strchr(name, '/') != nullptr) return name;
   const char* env = getenv("KLP_CATALOG_DIR");
   std::string candidates[3] = {env != nullptr && *env != '\0' ? joinDir(env, name) : "",
-                               joinDir(exeDir(), name), joinDir(KLP_BUILD_DIR "/bin", name)};
+                               joinDir(exeDir(), name), joinDir(KLP_DATA_DIR, name)};
   for (const std::string& c : candidates)
     if (!c.empty() && fileExists(c)) return c;
   return "";
