@@ -82,10 +82,10 @@ int idNumber(std::string_view id) {
 // the severity from it, and a text filed under the wrong number would be
 // issued for a message it does not describe.
 bool beginsWithOwnId(int number, std::string_view text) {
-  char id[16];
-  snprintf(id, sizeof id, "KLP%04d", number);
-  return text.size() >= 8 && text.compare(0, 7, id) == 0 && text[7] != '\0' &&
-         strchr("IWED", text[7]) != nullptr;
+  if (text.size() < 8 || text.compare(0, 3, "KLP") != 0) return false;
+  for (int i = 6; i >= 3; --i, number /= 10)
+    if (text[i] != '0' + number % 10) return false;
+  return text[7] != '\0' && strchr("IWED", text[7]) != nullptr;
 }
 
 // Indexes the catalogue's image; false when it is damaged.
