@@ -3,8 +3,12 @@
 // one-time KLP0513E when it cannot be opened).
 #include <gtest/gtest.h>
 
+#include <sys/stat.h>
+
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
+#include <functional>
 #include <string>
 #include <utility>
 #include <vector>
@@ -60,45 +64,65 @@ int reasonOf(const char* errorText) {
   return colon != nullptr && strlen(colon) >= 3 ? atoi(colon + 3) : -1;
 }
 
-TEST(MoReader, ReadsBothByteOrders) {
-  auto entries = std::vector<std::pair<std::string, std::string>>{
-      {"", "Content-Type: text/plain\n"}, {"500", "KLP0500E first"}, {"7112", "KLP7112I  Label"}};
+// In either byte order, only a decimal message number finds a text, and only
+// a text that begins with its own id: anything else in the file is passed
+// over.
+TEST(MoReader, OnlyDecimalIdsWithTheirOwnTextsAreFound) {
+  std::vector<std::pair<std::string, std::string>> entries = {
+      {"", "KLP0000E header"},       {"0500", "KLP0500E leading zero"},
+      {"abc", "KLP0500E letters"},   {"500", "KLP0500E first"},
+      {"500", "KLP0500E second"},    {"501", "KLP0500E filed under 501"},
+      {"502", "KLP0502X severity"},  {"503", "KLP0503"},
+      {"504", "hello"},              {"12345", "KLP2345E five digits"},
+      {"7", "KLP0007W seven"},       {"9999", "KLP9999D last"}};
+  const std::pair<const char*, const char*> rows[] = {
+      {"500", "KLP0500E first"}, {"7", "KLP0007W seven"}, {"9999", "KLP9999D last"},
+      {"", "<none>"},            {"0", "<none>"},         {"0500", "<none>"},
+      {"abc", "<none>"},         {"501", "<none>"},       {"502", "<none>"},
+      {"503", "<none>"},         {"504", "<none>"},       {"12345", "<none>"},
+      {"2345", "<none>"},        {"-1", "<none>"},
+  };
   for (bool big : {false, true}) {
     auto img = moImage(entries, big);
-    EXPECT_EQ("KLP0500E first", lookup(img, "500"));
-    EXPECT_EQ("KLP7112I  Label", lookup(img, "7112"));
-    EXPECT_EQ("<none>", lookup(img, "501"));
+    for (const auto& [key, want] : rows) EXPECT_EQ(want, lookup(img, key)) << key << " " << big;
   }
 }
 
 TEST(MoReader, DamagedImagesAreRefusedWithoutReadingOutside) {
   auto good = moImage({{"500", "KLP0500E first"}, {"501", "KLP0501E second"}});
-  EXPECT_EQ("<damaged 3>", lookup({}, "500"));
-  EXPECT_EQ("<damaged 3>", lookup(std::vector<uint8_t>(good.begin(), good.begin() + 27), "500"));
-  // Every truncation of the image is either refused or still sound.
+  EXPECT_EQ("KLP0501E second", lookup(good, "501"));
+  // Every truncation of the image is refused.
   for (size_t cut = 0; cut < good.size(); ++cut) {
     std::vector<uint8_t> part(good.begin(), good.begin() + cut);
     EXPECT_EQ("<damaged 3>", lookup(part, "500")) << cut;
   }
-  auto bad = good;
-  bad[0] ^= 0xFF;  // magic
-  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
-  bad = good;
-  put32(bad, 4, 0x00010000, false);  // unknown major revision
-  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
-  bad = good;
-  put32(bad, 8, 0xFFFFFFFF, false);  // count far beyond the file
-  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
-  bad = good;
-  put32(bad, 16, 0xFFFFFFF0, false);  // table offset beyond the file
-  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
-  bad = good;
-  put32(bad, 28 + 8 + 4, 0xFFFFFFF8, false);  // string offset wraps in 32 bits
-  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
-  bad = good;
-  put32(bad, 28 + 16, 0x7FFFFFFF, false);  // string length beyond the file
-  EXPECT_EQ("<damaged 3>", lookup(bad, "500"));
-  EXPECT_EQ("KLP0501E second", lookup(good, "501"));
+  struct Row {
+    const char* what;
+    size_t at;
+    uint32_t value;
+  };
+  const Row rows[] = {
+      {"magic", 0, 0x12345678},
+      {"unknown major revision", 4, 0x00010000},
+      {"count far beyond the file", 8, 0xFFFFFFFF},
+      {"table offset beyond the file", 16, 0xFFFFFFF0},
+      {"string offset wrapping in 32 bits", 28 + 8 + 4, 0xFFFFFFF8},
+      {"string length beyond the file", 28 + 16, 0x7FFFFFFF},
+  };
+  for (const Row& r : rows) {
+    auto bad = good;
+    put32(bad, r.at, r.value, false);
+    EXPECT_EQ("<damaged 3>", lookup(bad, "500")) << r.what;
+  }
+  // Far more entries than message numbers exist, every one of them sound
+  // (empty strings at offset 0): refused before any is read.
+  constexpr uint32_t kCount = 70000;
+  std::vector<uint8_t> many(28 + 16 * kCount, 0);
+  put32(many, 0, 0x950412de, false);
+  put32(many, 8, kCount, false);
+  put32(many, 12, 28, false);
+  put32(many, 16, 28 + 8 * kCount, false);
+  EXPECT_EQ("<damaged 3>", lookup(many, "500"));
 }
 
 TEST(Catalogue, BuiltFileHoldsEveryIssuedNumber) {
@@ -165,31 +189,69 @@ TEST(Catalogue, ValuesAreSubstitutedAndReasonsReported) {
   EXPECT_NE(':', text[0]);
 }
 
-TEST(Catalogue, DamagedFileFoundThroughTheDirectoryVariable) {
-  klptest::TmpDir tmp;
+// What stands under the catalogue's name in KLP_CATALOG_DIR: only a regular,
+// whole file is used, nothing there blocks, and a text filed under another
+// number is not found (the logger then takes the built-in text).
+TEST(Catalogue, OnlyARegularSoundFileFromTheDirectoryVariableIsUsed) {
   std::string image = klptest::readFile(kBuiltCatalog);
   ASSERT_GT(image.size(), 100u);
-  FILE* f = fopen((tmp.path() + "vdbklp.mo").c_str(), "wb");
-  ASSERT_NE(nullptr, f);
-  fwrite(image.data(), 1, image.size() / 2, f);
-  fclose(f);
-  setenv("KLP_CATALOG_DIR", tmp.path().c_str(), 1);
-  msgCatalogReset();
-  char text[300];
-  int n = retrieveCatalogMsg("vdbklp.mo", 500, nullptr, nullptr, 0, text, sizeof text);
-  EXPECT_LE(n, 0);
-  EXPECT_EQ(3, reasonOf(text)) << text;
+  auto write = [](const std::string& file, const std::string& bytes) {
+    FILE* f = fopen(file.c_str(), "wb");
+    bool ok = f != nullptr && fwrite(bytes.data(), 1, bytes.size(), f) == bytes.size();
+    return f != nullptr && fclose(f) == 0 && ok;
+  };
+  auto misfiled = moImage({{"500", "KLP0501E filed under 500"}});
+  struct Row {
+    const char* what;
+    std::function<bool(const std::string&)> make;
+    int reason;  // 0: the text of 500 was found
+  };
+  const Row rows[] = {
+      {"the whole file", [&](const std::string& f) { return write(f, image); }, 0},
+      {"half the file", [&](const std::string& f) { return write(f, image.substr(0, image.size() / 2)); }, 3},
+      {"a FIFO", [](const std::string& f) { return mkfifo(f.c_str(), 0600) == 0; }, 3},
+      {"a directory", [](const std::string& f) { return mkdir(f.c_str(), 0700) == 0; }, 3},
+      {"a text under another number",
+       [&](const std::string& f) { return write(f, std::string(misfiled.begin(), misfiled.end())); }, 4},
+  };
+  for (const Row& r : rows) {
+    klptest::TmpDir tmp;
+    ASSERT_TRUE(r.make(tmp.path() + "vdbklp.mo")) << r.what;
+    auto c = msgtest::inChild(tmp.path(), [&] {
+      setenv("KLP_CATALOG_DIR", tmp.path().c_str(), 1);
+      msgCatalogReset();
+      char text[300];
+      int n = retrieveCatalogMsg("vdbklp.mo", 500, nullptr, nullptr, 0, text, sizeof text);
+      return n > 0 ? 0 : reasonOf(text);
+    }, 10000);
+    EXPECT_TRUE(c.finished) << r.what;
+    EXPECT_EQ(r.reason, c.exitCode) << r.what;
+  }
+}
 
-  // A whole copy there is used; the parsed file is kept for the process.
-  f = fopen((tmp.path() + "vdbklp.mo").c_str(), "wb");
-  fwrite(image.data(), 1, image.size(), f);
-  fclose(f);
-  msgCatalogReset();
-  EXPECT_GT(retrieveCatalogMsg("vdbklp.mo", 500, nullptr, nullptr, 0, text, sizeof text), 0);
-  remove((tmp.path() + "vdbklp.mo").c_str());
-  EXPECT_GT(retrieveCatalogMsg("vdbklp.mo", 501, nullptr, nullptr, 0, text, sizeof text), 0);
-  unsetenv("KLP_CATALOG_DIR");
-  msgCatalogReset();
+// A program finds the catalogue beside itself or through KLP_CATALOG_DIR,
+// never in the build tree it was built in: a copy elsewhere goes without.
+TEST(Catalogue, ProgramsLookBesideThemselvesNotInTheBuildTree) {
+  klptest::TmpDir tmp;
+  std::string built = klptest::binPath("klpkccmd"), copy = tmp.path() + "klpkccmd";
+  ASSERT_TRUE(std::filesystem::copy_file(built, copy));
+  struct Row {
+    std::string program;
+    std::vector<std::string> env;
+    bool found;
+  };
+  const Row rows[] = {
+      {built, {}, true},
+      {copy, {}, false},
+      {copy, {"KLP_CATALOG_DIR=" KLP_BIN_DIR}, true},
+  };
+  for (const Row& r : rows) {
+    SCOPED_TRACE(r.program + (r.env.empty() ? "" : " " + r.env[0]));
+    auto p = klptest::run({r.program}, r.env);
+    EXPECT_EQ(12, p.exitCode);
+    EXPECT_EQ(r.found, p.err.find("KLP0513E") == std::string::npos) << p.err;
+    EXPECT_EQ(r.found, p.out.find("KLP0589E") != std::string::npos) << p.out;
+  }
 }
 
 // A logger whose catalogue file does not exist.

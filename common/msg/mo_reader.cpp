@@ -1,8 +1,11 @@
 // Our own reader of the message catalogue, a GNU MO file: every count and
 // offset in it is checked against the file size, and a damaged file is
-// handled like an unreadable one.
+// handled like an unreadable one. Lookups are by message number only.
+#include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -12,16 +15,24 @@
 #include <new>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "common/msg/msglogger.h"
 
-#ifndef KLP_BUILD_DIR
-#define KLP_BUILD_DIR "."
+#ifndef KLP_DATA_DIR
+#define KLP_DATA_DIR "/usr/local/share/klp"
 #endif
 
+// The texts a lookup can find, by message number. Only decimal ids of
+// message numbers are kept, so the index stays small whatever the file holds.
+struct msgMoEntry {
+  int number;
+  std::string_view text;  // a view into image
+};
+
 struct msgMoCatalog {
-  std::string image;                                  // the whole file
-  std::map<std::string_view, std::string_view> byId;  // views into image
+  std::string image;                // the whole file
+  std::vector<msgMoEntry> byNumber;  // ascending; one entry per number
 };
 
 namespace {
@@ -29,6 +40,9 @@ namespace {
 constexpr uint32_t kMagic = 0x950412de;
 constexpr uint32_t kMagicSwapped = 0xde120495;
 constexpr size_t kMaxCatalogBytes = 64u << 20;  // far beyond any real catalogue
+// Message numbers have four digits, so a real catalogue holds at most 10000
+// texts besides its header; a file claiming many more is not one of ours.
+constexpr uint32_t kMaxCatalogEntries = 1u << 16;
 
 enum { REASON_MISSING = 2, REASON_UNREADABLE = 3, REASON_NO_MESSAGE = 4, REASON_BAD_CALL = 5 };
 
@@ -50,6 +64,84 @@ bool readString(const uint8_t* data, size_t size, uint64_t table, uint32_t index
   if (static_cast<uint64_t>(off) + len + 1 > size) return false;
   *out = std::string_view(reinterpret_cast<const char*>(data) + off, len);
   return true;
+}
+
+// The message number an id names as "%d" would print it (one to four digits,
+// no leading zero), or -1.
+int idNumber(std::string_view id) {
+  if (id.empty() || id.size() > 4 || (id[0] == '0' && id.size() > 1)) return -1;
+  int n = 0;
+  for (char c : id) {
+    if (c < '0' || c > '9') return -1;
+    n = n * 10 + (c - '0');
+  }
+  return n;
+}
+
+// A text must begin with its own id ("KLP0504E" for 504): the logger reads
+// the severity from it, and a text filed under the wrong number would be
+// issued for a message it does not describe.
+bool beginsWithOwnId(int number, std::string_view text) {
+  if (text.size() < 8 || text.compare(0, 3, "KLP") != 0) return false;
+  for (int i = 6; i >= 3; --i, number /= 10)
+    if (text[i] != '0' + number % 10) return false;
+  return text[7] != '\0' && strchr("IWED", text[7]) != nullptr;
+}
+
+// Indexes the catalogue's image; false when it is damaged.
+bool indexImage(msgMoCatalog* cat) {
+  const uint8_t* data = reinterpret_cast<const uint8_t*>(cat->image.data());
+  size_t size = cat->image.size();
+  if (size < 28) return false;
+  uint32_t magic;
+  memcpy(&magic, data, sizeof magic);
+  bool swap;
+  if (magic == kMagic)
+    swap = false;
+  else if (magic == kMagicSwapped)
+    swap = true;
+  else
+    return false;
+  uint32_t revision = read32(data + 4, swap);
+  if ((revision >> 16) != 0) return false;  // a major revision we do not know
+  uint32_t count = read32(data + 8, swap);
+  uint64_t origTable = read32(data + 12, swap);
+  uint64_t transTable = read32(data + 16, swap);
+  if (count > kMaxCatalogEntries) return false;
+  if (origTable + 8ull * count > size || transTable + 8ull * count > size) return false;
+  try {
+    for (uint32_t i = 0; i < count; ++i) {
+      std::string_view id, text;
+      if (!readString(data, size, origTable, i, swap, &id) ||
+          !readString(data, size, transTable, i, swap, &text))
+        return false;
+      int number = idNumber(id);
+      if (number >= 0 && beginsWithOwnId(number, text)) cat->byNumber.push_back({number, text});
+    }
+    // The first of duplicate ids wins.
+    auto before = [](const msgMoEntry& a, const msgMoEntry& b) { return a.number < b.number; };
+    std::stable_sort(cat->byNumber.begin(), cat->byNumber.end(), before);
+    auto same = [](const msgMoEntry& a, const msgMoEntry& b) { return a.number == b.number; };
+    cat->byNumber.erase(std::unique(cat->byNumber.begin(), cat->byNumber.end(), same),
+                        cat->byNumber.end());
+  } catch (...) {
+    return false;
+  }
+  return true;
+}
+
+// Parses an image the catalogue takes over.
+msgMoCatalog* parseImage(std::string&& image, int* reason) {
+  if (reason != nullptr) *reason = REASON_UNREADABLE;
+  msgMoCatalog* cat = new (std::nothrow) msgMoCatalog;
+  if (cat == nullptr) return nullptr;
+  cat->image = std::move(image);
+  if (!indexImage(cat)) {
+    delete cat;
+    return nullptr;
+  }
+  if (reason != nullptr) *reason = 0;
+  return cat;
 }
 
 struct CacheEntry {
@@ -80,15 +172,52 @@ std::string joinDir(const std::string& dir, const char* name) {
 }
 
 // Where the catalogue lives: KLP_CATALOG_DIR, the program's directory, then
-// the build tree's bin/. A name with a '/' is taken as it is.
+// the installed data directory. A name with a '/' is taken as it is.
 std::string locate(const char* name) {
   if (strchr(name, '/') != nullptr) return name;
   const char* env = getenv("KLP_CATALOG_DIR");
   std::string candidates[3] = {env != nullptr && *env != '\0' ? joinDir(env, name) : "",
-                               joinDir(exeDir(), name), joinDir(KLP_BUILD_DIR "/bin", name)};
+                               joinDir(exeDir(), name), joinDir(KLP_DATA_DIR, name)};
   for (const std::string& c : candidates)
     if (!c.empty() && fileExists(c)) return c;
   return "";
+}
+
+// Reads a regular file of at most kMaxCatalogBytes. Opened without blocking:
+// a FIFO or device under the catalogue's name must not hold the first
+// message up forever.
+int readCatalogFile(const std::string& path, std::string* image, std::string* detail) {
+  int fd = open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+  if (fd < 0) {
+    int err = errno;
+    *detail = path + ": " + strerror(err);
+    return err == ENOENT ? REASON_MISSING : REASON_UNREADABLE;
+  }
+  struct stat st{};
+  int reason = 0;
+  if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+    *detail = path + ": not a regular file";
+    reason = REASON_UNREADABLE;
+  } else if (static_cast<uint64_t>(st.st_size) > kMaxCatalogBytes) {
+    *detail = path + ": file too large";
+    reason = REASON_UNREADABLE;
+  } else {
+    image->resize(static_cast<size_t>(st.st_size));
+    size_t got = 0;
+    while (got < image->size()) {
+      ssize_t n = read(fd, image->data() + got, image->size() - got);
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) {
+        *detail = path + ": read error";
+        reason = REASON_UNREADABLE;
+      }
+      if (n <= 0) break;
+      got += static_cast<size_t>(n);
+    }
+    image->resize(got);  // a file cut short while we read parses as damaged
+  }
+  close(fd);
+  return reason;
 }
 
 void load(const char* name, CacheEntry* entry) {
@@ -98,34 +227,11 @@ void load(const char* name, CacheEntry* entry) {
     entry->detail = std::string("file not found: ") + name;
     return;
   }
-  FILE* f = fopen(path.c_str(), "rb");
-  if (f == nullptr) {
-    int err = errno;
-    entry->reason = err == ENOENT ? REASON_MISSING : REASON_UNREADABLE;
-    entry->detail = path + ": " + strerror(err);
-    return;
-  }
   std::string image;
-  char buf[65536];
-  size_t n;
-  bool tooBig = false;
-  while ((n = fread(buf, 1, sizeof buf, f)) > 0) {
-    if (image.size() + n > kMaxCatalogBytes) {
-      tooBig = true;
-      break;
-    }
-    image.append(buf, n);
-  }
-  bool readError = ferror(f) != 0;
-  fclose(f);
-  if (readError || tooBig) {
-    entry->reason = REASON_UNREADABLE;
-    entry->detail = path + (tooBig ? ": file too large" : ": read error");
-    return;
-  }
+  entry->reason = readCatalogFile(path, &image, &entry->detail);
+  if (entry->reason != 0) return;
   int reason = 0;
-  entry->catalog = msgMoParse(reinterpret_cast<const uint8_t*>(image.data()), image.size(),
-                              &reason);
+  entry->catalog = parseImage(std::move(image), &reason);
   if (entry->catalog == nullptr) {
     entry->reason = reason != 0 ? reason : REASON_UNREADABLE;
     entry->detail = path + ": not a valid message catalogue";
@@ -142,50 +248,24 @@ int fail(char* buffer, int bufferSize, int reason, const std::string& detail) {
 
 msgMoCatalog* msgMoParse(const uint8_t* data, size_t size, int* reason) {
   if (reason != nullptr) *reason = REASON_UNREADABLE;
-  if (data == nullptr || size < 28) return nullptr;
-  uint32_t magic;
-  memcpy(&magic, data, sizeof magic);
-  bool swap;
-  if (magic == kMagic)
-    swap = false;
-  else if (magic == kMagicSwapped)
-    swap = true;
-  else
-    return nullptr;
-  uint32_t revision = read32(data + 4, swap);
-  if ((revision >> 16) != 0) return nullptr;  // a major revision we do not know
-  uint32_t count = read32(data + 8, swap);
-  uint64_t origTable = read32(data + 12, swap);
-  uint64_t transTable = read32(data + 16, swap);
-  if (origTable + 8ull * count > size || transTable + 8ull * count > size) return nullptr;
-  msgMoCatalog* cat = new (std::nothrow) msgMoCatalog;
-  if (cat == nullptr) return nullptr;
+  if (data == nullptr) return nullptr;
   try {
-    cat->image.assign(reinterpret_cast<const char*>(data), size);
-    const uint8_t* img = reinterpret_cast<const uint8_t*>(cat->image.data());
-    for (uint32_t i = 0; i < count; ++i) {
-      std::string_view id, text;
-      if (!readString(img, size, origTable, i, swap, &id) ||
-          !readString(img, size, transTable, i, swap, &text)) {
-        delete cat;
-        return nullptr;
-      }
-      cat->byId.emplace(id, text);  // the first of duplicate ids wins
-    }
+    return parseImage(std::string(reinterpret_cast<const char*>(data), size), reason);
   } catch (...) {
-    delete cat;
     return nullptr;
   }
-  if (reason != nullptr) *reason = 0;
-  return cat;
 }
 
 const char* msgMoLookup(const msgMoCatalog* catalog, const char* key, size_t* len) {
   if (catalog == nullptr || key == nullptr) return nullptr;
-  auto it = catalog->byId.find(std::string_view(key));
-  if (it == catalog->byId.end()) return nullptr;
-  if (len != nullptr) *len = it->second.size();
-  return it->second.data();
+  int number = idNumber(key);
+  if (number < 0) return nullptr;
+  auto it = std::lower_bound(
+      catalog->byNumber.begin(), catalog->byNumber.end(), number,
+      [](const msgMoEntry& e, int n) { return e.number < n; });
+  if (it == catalog->byNumber.end() || it->number != number) return nullptr;
+  if (len != nullptr) *len = it->text.size();
+  return it->text.data();
 }
 
 void msgMoFree(msgMoCatalog* catalog) { delete catalog; }

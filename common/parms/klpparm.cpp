@@ -101,10 +101,6 @@ const char* parmSourceLabel(int32_t source, const char* tableName) {
 klpParmClass::klpParmClass(const ParmEntry* table, int n, int* rc) {
   int result = 0;
   setTableName("PARAMETERS TABLE");
-  for (auto& c : chg_) {
-    c.index = -1;
-    c.value[0] = '\0';
-  }
   // Every slot starts as a placeholder, also when the table is refused as a
   // whole, so that the destructor always sees initialised slots.
   for (auto& s : slots_) placeholder(s);
@@ -427,32 +423,28 @@ int klpParmClass::findChangeableParm(const char* keyword) {
   return slots_[i].index;
 }
 
+// Records are never freed, so those in use are chg_[0..chgCount_-1] and the
+// rest are never touched: 64 kilobyte-sized records would cost a short-lived
+// program a page fault every four of them just to mark them free.
 const ChgParmsEntry* klpParmClass::getChgParmsEntry(int i) const {
+  static const ChgParmsEntry kFree = {-1, ""};
   if (i < 0 || i >= KLP_PARM_SLOTS) return nullptr;
-  return &chg_[i];
+  return i < chgCount_ ? &chg_[i] : &kFree;
 }
 
 int klpParmClass::addChgParm(int index, const char* value) {
   if (!value) value = klpEmptyText;
-  if (strlen(value) >= sizeof chg_[0].value) return KLP_RC_BAD_PARM;
+  if (index < 0 || strlen(value) >= sizeof chg_[0].value) return KLP_RC_BAD_PARM;
   ChgParmsEntry* target = nullptr;
-  for (auto& c : chg_)
-    if (c.index == index) {
-      target = &c;
-      break;
-    }
+  for (int i = 0; i < chgCount_ && !target; ++i)
+    if (chg_[i].index == index) target = &chg_[i];
   if (!target) {
-    for (auto& c : chg_)
-      if (c.index == -1) {
-        target = &c;
-        break;
-      }
-    if (!target) {
+    if (chgCount_ >= KLP_PARM_SLOTS) {
       printf("cmdParmsClass ERROR: no find room in chgparms array\n");
       return KLP_RC_BAD_PARM;
     }
+    target = &chg_[chgCount_++];
     target->index = index;
-    ++chgCount_;
   }
   snprintf(target->value, sizeof target->value, "%s", value);
   return KLP_OK;

@@ -28,6 +28,7 @@ constexpr hsvRC ECF_QUEUE_FULL = 0x9000000A;      // put still blocked after the
 constexpr hsvRC ECF_INTERRUPTED = 0x9000000B;
 constexpr hsvRC ECF_LIMIT_REACHED = 0x9000000C;   // system limit on queues / memory reached
 constexpr hsvRC ECF_NO_MEMORY = 0x9000000D;
+constexpr hsvRC ECF_NOT_OWNED = 0x9000000E;       // object of another user, or open to group/others
 constexpr hsvRC ECF_TIMEOUT = 0x90000013;
 constexpr hsvRC ECF_SEM_WAIT_ABANDONED = 0x90000080;
 constexpr hsvRC ECF_SYSTEM_ERROR = 0x900000FF;    // any other errno
@@ -75,10 +76,14 @@ class HSVHIPCQueue {
   HSVHIPCQueue(const HSVHIPCQueue&) = delete;
   HSVHIPCQueue& operator=(const HSVHIPCQueue&) = delete;
 
-  // Creates the queue (ECF_ALREADY_EXISTS when one exists) and keeps it open.
-  // An object that already holds a queue answers ECF_INVALID_ARGUMENT.
+  // Creates the queue (ECF_ALREADY_EXISTS when one of ours exists,
+  // ECF_NOT_OWNED when the name is taken by an object that is not private to
+  // us) and keeps it open. An object that already holds a queue answers
+  // ECF_INVALID_ARGUMENT.
   hsvRC create(const HSVResID& id, size_t maxMsgSize, int option);
-  // Attaches to an existing queue; ECF_NOT_FOUND while none exists.
+  // Attaches to an existing queue; ECF_NOT_FOUND while none exists,
+  // ECF_NOT_OWNED when it belongs to another user or is open to group or
+  // others (names are predictable, so anyone could have made it first).
   hsvRC attach(const HSVResID& id);
   hsvRC detach();   // closes the descriptor, queue stays
   hsvRC destroy();  // closes and removes the queue from the system
@@ -117,6 +122,8 @@ class HSVHIPCMemory {
   HSVHIPCMemory(const HSVHIPCMemory&) = delete;
   HSVHIPCMemory& operator=(const HSVHIPCMemory&) = delete;
 
+  // Both answer ECF_NOT_OWNED for a block that is not private to us, as the
+  // queue does.
   hsvRC create(const HSVResID& id, size_t size, int option);  // zero-filled
   hsvRC attach(const HSVResID& id);                           // ECF_NOT_FOUND when none
   void* getAddress() const { return addr_; }

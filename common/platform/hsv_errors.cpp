@@ -19,6 +19,7 @@ const char* ecfErrorGetDescription(hsvRC code) {
     case ECF_INTERRUPTED: return "interrupted";
     case ECF_LIMIT_REACHED: return "system limit reached";
     case ECF_NO_MEMORY: return "not enough memory";
+    case ECF_NOT_OWNED: return "object belongs to another user or is open to group or others";
     case ECF_TIMEOUT: return "time-out";
     case ECF_SEM_WAIT_ABANDONED: return "wait abandoned";
     case ECF_SYSTEM_ERROR: return "operating system error";

@@ -12,6 +12,20 @@
 
 using hsvint::posixName;
 
+namespace {
+
+// Why a block name is taken: by a block of ours (ECF_ALREADY_EXISTS) or by
+// one we must not use (ECF_NOT_OWNED).
+hsvRC takenBy(const char* name) {
+  int fd = shm_open(name, O_RDONLY, 0);
+  if (fd < 0) return errno == EACCES ? ECF_NOT_OWNED : ECF_ALREADY_EXISTS;
+  hsvRC rc = hsvint::checkPrivate(fd);
+  close(fd);
+  return rc == ECF_NOT_OWNED ? ECF_NOT_OWNED : ECF_ALREADY_EXISTS;
+}
+
+}  // namespace
+
 HSVHIPCMemory::HSVHIPCMemory() = default;
 
 HSVHIPCMemory::~HSVHIPCMemory() { detach(); }
@@ -22,7 +36,7 @@ hsvRC HSVHIPCMemory::create(const HSVResID& id, size_t size, int /*option*/) {
   char name[sizeof(HSVResID::part2)];
   if (!posixName(id, name)) return ECF_INVALID_ARGUMENT;
   int fd = shm_open(name, O_RDWR | O_CREAT | O_EXCL, 0600);
-  if (fd < 0) return hsvErrnoToECF(errno);
+  if (fd < 0) return errno == EEXIST ? takenBy(name) : hsvErrnoToECF(errno);
   // A new object is zero-filled by the kernel; ftruncate only sizes it.
   if (ftruncate(fd, static_cast<off_t>(size)) != 0) {
     int err = errno;
@@ -50,10 +64,10 @@ hsvRC HSVHIPCMemory::attach(const HSVResID& id) {
   int fd = shm_open(name, O_RDWR, 0);
   if (fd < 0) return hsvErrnoToECF(errno);
   struct stat st{};
-  if (fstat(fd, &st) != 0) {
-    int err = errno;
+  hsvRC owned = hsvint::checkPrivate(fd, &st);
+  if (owned != ECF_OK) {
     close(fd);
-    return hsvErrnoToECF(err);
+    return owned;
   }
   // A creator that has not sized the block yet leaves it empty: there is
   // nothing to attach to until it has.

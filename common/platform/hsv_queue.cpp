@@ -13,6 +13,20 @@
 
 using hsvint::posixName;
 
+namespace {
+
+// Why a queue name is taken: by a queue of ours (ECF_ALREADY_EXISTS) or by
+// one we must not use (ECF_NOT_OWNED).
+hsvRC takenBy(const char* name) {
+  mqd_t q = mq_open(name, O_RDONLY);
+  if (q == static_cast<mqd_t>(-1)) return errno == EACCES ? ECF_NOT_OWNED : ECF_ALREADY_EXISTS;
+  hsvRC rc = hsvint::checkPrivate(q);
+  mq_close(q);
+  return rc == ECF_NOT_OWNED ? ECF_NOT_OWNED : ECF_ALREADY_EXISTS;
+}
+
+}  // namespace
+
 HSVHIPCQueue::HSVHIPCQueue() = default;
 
 HSVHIPCQueue::~HSVHIPCQueue() { detach(); }
@@ -26,7 +40,7 @@ hsvRC HSVHIPCQueue::create(const HSVResID& id, size_t maxMsgSize, int /*option*/
   attr.mq_maxmsg = HSV_QUEUE_DEPTH;
   attr.mq_msgsize = static_cast<long>(maxMsgSize);
   mqd_t q = mq_open(name, O_RDWR | O_CREAT | O_EXCL, 0600, &attr);
-  if (q == static_cast<mqd_t>(-1)) return hsvErrnoToECF(errno);
+  if (q == static_cast<mqd_t>(-1)) return errno == EEXIST ? takenBy(name) : hsvErrnoToECF(errno);
   fd_ = q;
   msgSize_ = maxMsgSize;
   id_ = id;
@@ -39,6 +53,11 @@ hsvRC HSVHIPCQueue::attach(const HSVResID& id) {
   if (!posixName(id, name)) return ECF_INVALID_ARGUMENT;
   mqd_t q = mq_open(name, O_RDWR);
   if (q == static_cast<mqd_t>(-1)) return hsvErrnoToECF(errno);
+  hsvRC owned = hsvint::checkPrivate(q);
+  if (owned != ECF_OK) {
+    mq_close(q);
+    return owned;
+  }
   mq_attr attr{};
   if (mq_getattr(q, &attr) != 0 || attr.mq_msgsize <= 0) {
     int err = errno;

@@ -1,7 +1,10 @@
 // Resource ids, codes, wait/post, time, libraries and the trap file.
 #include <gtest/gtest.h>
 
+#include <fcntl.h>
+#include <mqueue.h>
 #include <sys/mman.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 
 #include <atomic>
@@ -93,7 +96,7 @@ TEST(ResID, PrintableNeverWritesPastTheBuffer) {
 TEST(Codes, TextsAndErrnoMapping) {
   const hsvRC named[] = {ECF_ACCESS_DENIED, ECF_NOT_FOUND,  ECF_INVALID_ARGUMENT, ECF_ALREADY_EXISTS,
                          ECF_MSG_TOO_BIG,   ECF_QUEUE_FULL, ECF_TIMEOUT,          ECF_SYSTEM_ERROR,
-                         ECF_WAITPOST_NOT_INITIALIZED};
+                         ECF_WAITPOST_NOT_INITIALIZED, ECF_NOT_OWNED};
   for (hsvRC c : named) {
     ASSERT_NE(ecfErrorGetDescription(c), nullptr);
     EXPECT_STRNE(ecfErrorGetDescription(c), "unknown platform error") << std::hex << c;
@@ -111,6 +114,54 @@ TEST(Codes, TextsAndErrnoMapping) {
   EXPECT_EQ(hsvErrnoToECF(EMSGSIZE), ECF_MSG_TOO_BIG);
   EXPECT_EQ(hsvErrnoToECF(EINVAL), ECF_INVALID_ARGUMENT);
   EXPECT_EQ(hsvErrnoToECF(EXDEV), ECF_SYSTEM_ERROR);
+}
+
+// A queue or block made first under our name by someone else: only a private
+// one of ours is used. A second user is not at hand in a test, but the mode
+// such a user would have to grant us is, and is refused the same way.
+TEST(Ownership, OnlyPrivateObjectsOfOursAreUsed) {
+  struct Row {
+    mode_t mode;
+    hsvRC attach, create;
+  };
+  const Row rows[] = {
+      {0600, ECF_OK, ECF_ALREADY_EXISTS},         {0666, ECF_NOT_OWNED, ECF_NOT_OWNED},
+      {0640, ECF_NOT_OWNED, ECF_NOT_OWNED},       {0602, ECF_NOT_OWNED, ECF_NOT_OWNED},
+      {0610, ECF_NOT_OWNED, ECF_NOT_OWNED},       {0400, ECF_ACCESS_DENIED, ECF_ALREADY_EXISTS},
+  };
+  klptest::TmpDir tmp;
+  std::string path = tmp.path() + "MYDB.KLP.KCAP.IPC";
+  HSVResID qid{}, mid{};
+  ASSERT_EQ(hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &qid), ECF_OK);
+  ASSERT_EQ(hsvIPCGetResID(path.c_str(), HSV_MEMORY_RESID_OPTION, &mid), ECF_OK);
+  for (const Row& r : rows) {
+    SCOPED_TRACE(std::to_string(r.mode));
+    mq_attr attr{};
+    attr.mq_maxmsg = HSV_QUEUE_DEPTH;
+    attr.mq_msgsize = HSV_MAX_MSG_SIZE;
+    mqd_t raw = mq_open(qid.posixName(), O_RDWR | O_CREAT | O_EXCL, 0600, &attr);
+    ASSERT_NE(raw, static_cast<mqd_t>(-1));
+    ASSERT_EQ(fchmod(raw, r.mode), 0);
+    HSVHIPCQueue q, q2;
+    EXPECT_EQ(q.attach(qid), r.attach);
+    EXPECT_EQ(q.isOpen(), r.attach == ECF_OK);
+    EXPECT_EQ(q2.create(qid, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), r.create);
+    mq_close(raw);
+    mq_unlink(qid.posixName());
+
+    int fd = shm_open(mid.posixName(), O_RDWR | O_CREAT | O_EXCL, 0600);
+    ASSERT_GE(fd, 0);
+    ASSERT_EQ(ftruncate(fd, 4096), 0);
+    ASSERT_EQ(fchmod(fd, r.mode), 0);
+    HSVHIPCMemory m, m2;
+    EXPECT_EQ(m.attach(mid), r.attach);
+    EXPECT_EQ(m.getAddress() != nullptr, r.attach == ECF_OK);
+    EXPECT_EQ(m2.create(mid, 4096, HSV_CREATE_OPTION), r.create);
+    close(fd);
+    shm_unlink(mid.posixName());
+  }
+  EXPECT_FALSE(klptest::queueExists(path));
+  EXPECT_FALSE(klptest::memoryExists(path));
 }
 
 TEST(Waitpost, PostWaitAndTimeout) {
