@@ -393,6 +393,8 @@ int KLPAttachIPCQ(HSVHIPCQueue* queue, char* resId, size_t resIdLen, const char*
       if (rc == ECF_OK) return 0;
     }
     *platformRc = rc;
+    // Another user's object, or one open to others, stays so: no retry.
+    if (rc == ECF_NOT_OWNED) break;
     if (attempt < KLP_ATTACH_ATTEMPTS) klpRestingSleep(KLP_CMD_PAUSE_MS);
   }
   return KLP_RC_ATTACH_FAILED;
@@ -608,6 +610,7 @@ int exchange(CallState* st, const char* serverName, int func, const char* payloa
   // 6-7: wait for the replies. Each pause ends as soon as a message arrives.
   IpcGather& gather = st->gather;
   int emptyPolls = 0;
+  int dropped = 0;
   char* msgBuf = st->msg;
   while (rc == 0 && outstanding > 0) {
     if (!reply->queue->hasMessage()) {
@@ -647,8 +650,17 @@ int exchange(CallState* st, const char* serverName, int func, const char* payloa
       break;
     }
     // A late reply to an earlier exchange that gave up waiting reaches this
-    // one's queue of the same name: it is not this request's answer.
-    if (view.header.func != func) continue;
+    // one's queue of the same name: it is not this request's answer. A
+    // queue's worth of them is forgiven; past that each counts as an empty
+    // poll, so a sender that keeps answering another request cannot hold
+    // the exchange beyond its budget.
+    if (view.header.func != func) {
+      if (++dropped > HSV_QUEUE_DEPTH && ++emptyPolls >= KLP_CMD_POLLS) {
+        issue(cap, 510, kOrigin, KLP_DEST_SEVERITY);
+        rc = KLP_RC_NO_REPLY;
+      }
+      continue;
+    }
     int32_t piecesLeft = 0;
     int arc = gather.add(view, &piecesLeft);
     if (arc == KLP_RC_MSG_NO_MEMORY) {

@@ -4,10 +4,14 @@
 #include "common/ipc/cmdapi.h"
 
 #include <gtest/gtest.h>
+#include <fcntl.h>
+#include <mqueue.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <cstddef>
 #include <cstdlib>
 #include <cstring>
@@ -839,6 +843,45 @@ TEST_F(CmdApiExchange, SilentServerEndsWithNoReply) {
   EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 14, nullptr, nullptr, &cap), 824);
   EXPECT_TRUE(has(cap.text, "KLP0510")) << cap.text;
   EXPECT_FALSE(klptest::queueExists(replyPath("S1.KLP.KCAP")));
+}
+
+// A peer that keeps answering some other request cannot hold the exchange
+// past its budget: the call gives up while the flood still runs, and the
+// flooder finds the reply queue gone.
+TEST_F(CmdApiExchange, EndlessWrongAnswersEndWithNoReply) {
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [&](const IpcMsgView& req) {
+    for (int i = 0; i < 2000; ++i)
+      if (srv.putRaw(req.header.senderPid, rawMsg(15, {}, 1, 0, 0)) != 0) return 0;
+    return 1;  // the call was still taking them
+  });
+  klpMsgCapture cap{};
+  EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", 14, nullptr, nullptr, &cap), 824);
+  EXPECT_TRUE(has(cap.text, "KLP0510")) << cap.text;
+  EXPECT_EQ(srv.finish(), 0);
+}
+
+// A server queue that is not private to us is refused at the first attempt:
+// it will not become ours by waiting (retrying would take four pauses).
+TEST_F(CmdApiExchange, AQueueOpenToOthersIsRefusedWithoutRetrying) {
+  std::string path = tmp_.path() + "S1.KLP.KCAP.IPC";
+  HSVResID id{};
+  ASSERT_EQ(hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+  mq_attr attr{};
+  attr.mq_maxmsg = HSV_QUEUE_DEPTH;
+  attr.mq_msgsize = HSV_MAX_MSG_SIZE;
+  mqd_t raw = mq_open(id.posixName(), O_RDWR | O_CREAT | O_EXCL, 0600, &attr);
+  ASSERT_NE(raw, static_cast<mqd_t>(-1));
+  ASSERT_EQ(fchmod(raw, 0666), 0);
+  HSVHIPCQueue q;
+  char resId[64];
+  hsvRC prc = 0;
+  auto start = std::chrono::steady_clock::now();
+  EXPECT_EQ(KLPAttachIPCQ(&q, resId, sizeof(resId), path.c_str(), &prc), 815);
+  EXPECT_EQ(prc, ECF_NOT_OWNED);
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(4));
+  mq_close(raw);
+  mq_unlink(id.posixName());
 }
 
 // A logger that raises SIGINT once message `at` is composed: a signal that
