@@ -200,7 +200,8 @@ class HSVSharedLib {
 
   // option 4: resolve lazily, local; 0: resolve now. ECF_NOT_FOUND when it
   // cannot be loaded; lastError() then holds the loader's text and
-  // lastErrno() the error number (ENOEXEC for a file that is no library).
+  // lastErrno() the error number (ENOEXEC for a path to a file that is no
+  // library, ENOENT for a name the search finds nothing for).
   hsvRC load(const char* name, int option);
   void* getFuncAddress(const char* symbol);  // null when absent
   // The same with a code: ECF_NOT_FOUND for a symbol the library lacks,

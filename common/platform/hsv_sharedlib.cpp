@@ -1,8 +1,10 @@
 // Shared libraries loaded at run time.
 #include <dlfcn.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 
 #include "common/platform/hsv.h"
 
@@ -29,8 +31,11 @@ hsvRC HSVSharedLib::load(const char* name, int option) {
   errno = 0;
   void* h = dlopen(name, flags);
   if (!h) {
-    // The loader leaves errno alone when it found a file it cannot load.
-    errno_ = errno != 0 ? errno : ENOEXEC;
+    // The loader does not set errno reliably: a path is checked for the
+    // file itself; a file that is there but does not load is no library.
+    int err = errno;
+    if (strchr(name, '/')) err = access(name, F_OK) != 0 ? errno : (err ? err : ENOEXEC);
+    errno_ = err ? err : ENOENT;
     keepError(err_, sizeof err_, "library not loaded");
     return ECF_NOT_FOUND;
   }
