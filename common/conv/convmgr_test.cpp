@@ -10,7 +10,9 @@
 #include <string>
 #include <vector>
 
+#include "common/env/klpenv.h"
 #include "common/msg/msglogger.h"
+#include "common/parms/klpparm.h"
 #include "tests/testing/klptest.h"
 
 namespace {
@@ -175,6 +177,13 @@ TEST(ConvMgr, ValuesAndRunningBuffers) {
   none = nullptr;
   EXPECT_EQ(m.cpcvl(37, "\xC1\xC2", 1208, &len32, &none, 2, 0, 0, 0), 0);
   EXPECT_EQ(std::string(none, len32), "AB");
+  // Lengths that a 16-bit field cannot hold.
+  std::string big(20000, '\x63');  // a-umlaut: two bytes each in UTF-8
+  none = nullptr;
+  EXPECT_EQ(m.cpcvc(37, big.c_str(), 1208, &len, &none, 20000, 0, 0, 0), 5003);
+  EXPECT_EQ(none, nullptr);
+  big.resize(40000, '\xC1');
+  EXPECT_EQ(m.cpcvc(37, big.c_str(), 37, &len, &none, 40000, 0, 0, 0), 5003);
   // Graphic lengths count double-byte characters.
   len = sizeof buf;
   EXPECT_EQ(m.cpcvc(930, "\x42\xC1", 1208, &len, &t, 1, 0, 1, 0), 0);
@@ -201,7 +210,11 @@ TEST(ConvMgr, ValuesAndRunningBuffers) {
     EXPECT_EQ(rb.remaining, r.rc ? r.remaining : r.remaining - 2);
     EXPECT_EQ(std::string(area + 1 + r.remaining + (r.remaining < 0 ? 1 : 0), 2), "##");
   }
-  EXPECT_EQ(log.text().find("KLP0589E"), std::string::npos) << log.text();
+  // Only the converted value that did not fit was reported.
+  std::string text = log.text();
+  EXPECT_NE(text.find("\"ConvMgr::cpcvc\" a step failed with return code \"5003\": \"do conversion\""),
+            std::string::npos) << text;
+  EXPECT_EQ(text.find("KLP0589E"), text.rfind("KLP0589E")) << text;
 }
 
 TEST(ConvMgr, CcsidAttributes) {
@@ -256,7 +269,8 @@ TEST(ConvMgr, ListNamesAndTheEndOfTheProcessState) {
     klptest::ProcessLogger logger;
     ConvMgr before(2);
     ConvListItem* item = nullptr;
-    if (before.lookupAddConv(37, &item, 0) != 0) return 1;
+    if (before.lookupAddConv(37, &item, 0) != 0 || before.lookupAddConv(1208, &item, 0) != 0)
+      return 1;
     ConvMgr::cleanup();
     const char* s = "\xC1";
     char* out = nullptr;
@@ -265,4 +279,35 @@ TEST(ConvMgr, ListNamesAndTheEndOfTheProcessState) {
   });
   EXPECT_EQ(c.exitCode, 0) << c.out << c.err;
   EXPECT_NE(c.out.find("static ConvMgr not initialized"), std::string::npos) << c.out;
+}
+
+TEST(ConvMgr, ApplyServerDecidesAboutErrorsItself) {
+  klptest::TmpDir dir;
+  auto c = klptest::inChild(dir.path(), [] {
+    klptest::ProcessLogger logger;
+    // The apply server's parameters: DEBUG (1) and the strict switch (39).
+    ParmEntry table[40];
+    char names[40][8];
+    for (int i = 0; i < 40; ++i) {
+      snprintf(names[i], sizeof names[i], "P%d", i);
+      table[i] = makeParmEntry(i, names[i], 0, PARM_BOOLEAN, -1, -1, -1, nullptr, 1, 1, 0);
+    }
+    int rc = 0;
+    klpParmClass parms(table, 40, &rc);
+    klpSetCurrentParms(&parms);
+    setEnvTovRIB(klpGetEnv(), "xqapply", 1, 0, 0);
+    ConvMgr m(2);
+    const char euro[] = "\xE2\x82\xAC";  // not in CCSID 37
+    const char* s = euro;
+    char* out = nullptr;
+    if (m.cpcv(1208, &s, euro + 3, 37, &out, nullptr, 0, 0, 0, 0, 0, 1, 1) != 5001) return 1;
+    const char broken[] = "\xC1\x0E\x42\xC1";
+    s = broken;
+    return m.cpcv(933, &s, broken + 4, 1208, &out, nullptr, 0, 0, 0, 0, 0, 1, 1);
+  });
+  EXPECT_EQ(c.exitCode, 0) << c.out;
+  EXPECT_NE(c.out.find("KOR: Data after adding SHIFT bytes (5): C10E42C10F\n"), std::string::npos)
+      << c.out;
+  for (const char* silent : {"KLP0568E", "KLP0589E", "KLP0619E"})
+    EXPECT_EQ(c.out.find(silent), std::string::npos) << c.out;
 }
