@@ -110,7 +110,11 @@ bool convStrictApply() {
 
 int ConvMgr::openConverter(uint32_t ccsid, UConverter** conv, int encoding) {
   trcEntry(kTrcComp, kFnOpen);
-  trcData(kTrcComp, kFnOpen, "inputs", 2, 0, 4, &ccsid, 0, 4, &encoding);
+  if (trcIsRunning()) {
+    char inputs[64];
+    snprintf(inputs, sizeof inputs, "ccsid: %d, encoding: %d", static_cast<int>(ccsid), encoding);
+    trcData(kTrcComp, kFnOpen, "inputs", 2, 7, static_cast<uint32_t>(strlen(inputs)), inputs);
+  }
   UErrorCode err = U_ZERO_ERROR;
   *conv = nullptr;
   if (ccsid == 864) {
