@@ -206,15 +206,22 @@ class HSVSharedLib {
   HSVSharedLib& operator=(const HSVSharedLib&) = delete;
 
   // option 4: resolve lazily, local; 0: resolve now. ECF_NOT_FOUND when it
-  // cannot be loaded; lastError() then holds the loader's text.
+  // cannot be loaded; lastError() then holds the loader's text and
+  // lastErrno() the error number (ENOEXEC for a path to a file that is no
+  // library, ENOENT for a name the search finds nothing for).
   hsvRC load(const char* name, int option);
   void* getFuncAddress(const char* symbol);  // null when absent
+  // The same with a code: ECF_NOT_FOUND for a symbol the library lacks,
+  // ECF_NOT_ATTACHED while nothing is loaded; *address is null then.
+  hsvRC getFuncAddress(const char* symbol, void** address);
   hsvRC unload();
   bool isLoaded() const { return handle_ != nullptr; }
   const char* lastError() const { return err_; }
+  int lastErrno() const { return errno_; }
 
  private:
   void* handle_ = nullptr;
+  int errno_ = 0;
   char err_[256] = {0};
 };
 

@@ -1,7 +1,10 @@
 // Shared libraries loaded at run time.
 #include <dlfcn.h>
+#include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
 
 #include "common/platform/hsv.h"
 
@@ -25,21 +28,37 @@ hsvRC HSVSharedLib::load(const char* name, int option) {
   if (handle_) return ECF_ALREADY_EXISTS;
   int flags = option == 4 ? (RTLD_LAZY | RTLD_LOCAL) : (RTLD_NOW | RTLD_LOCAL);
   dlerror();
+  errno = 0;
   void* h = dlopen(name, flags);
   if (!h) {
+    // The loader does not set errno reliably: a path is checked for the
+    // file itself; a file that is there but does not load is no library.
+    int err = errno;
+    if (strchr(name, '/')) err = access(name, F_OK) != 0 ? errno : (err ? err : ENOEXEC);
+    errno_ = err ? err : ENOENT;
     keepError(err_, sizeof err_, "library not loaded");
     return ECF_NOT_FOUND;
   }
+  errno_ = 0;
   handle_ = h;
   return ECF_OK;
 }
 
 void* HSVSharedLib::getFuncAddress(const char* symbol) {
-  if (!handle_ || !symbol || !*symbol) return nullptr;
-  dlerror();
-  void* p = dlsym(handle_, symbol);
-  if (!p) keepError(err_, sizeof err_, "symbol not found");
+  void* p = nullptr;
+  getFuncAddress(symbol, &p);
   return p;
+}
+
+hsvRC HSVSharedLib::getFuncAddress(const char* symbol, void** address) {
+  *address = nullptr;
+  if (!handle_) return ECF_NOT_ATTACHED;
+  if (!symbol || !*symbol) return ECF_INVALID_ARGUMENT;
+  dlerror();
+  *address = dlsym(handle_, symbol);
+  if (*address) return ECF_OK;
+  keepError(err_, sizeof err_, "symbol not found");
+  return ECF_NOT_FOUND;
 }
 
 hsvRC HSVSharedLib::unload() {
