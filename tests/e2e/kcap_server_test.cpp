@@ -1,6 +1,7 @@
 // The sample server and its command engine, driven over the real queues by a
 // raw client and by the exported control interface.
 #include <signal.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -178,6 +179,29 @@ TEST(KcapServer, ChgparmsIsEchoedAndQryparmsShowsTheChangeWithItsSource) {
   EXPECT_EQ(after["TERM"].source, 3);
   EXPECT_EQ(after["CAPTURE_PATH"].value, dir.path());
   EXPECT_NE(after["CAPTURE_PATH"].source, 3);
+  stopCleanly(s, c);
+}
+
+TEST(KcapServer, AQueryLongerThanOneMessageReachesTheCommandProgramInPieces) {
+  klptest::TmpDir dir;
+  const std::string v(1000, 'v');
+  // A working directory of its own with a long name, and two long values.
+  std::string path = dir.path() + std::string(200, 'p');
+  for (int i = 0; i < 4; ++i) {
+    ASSERT_EQ(mkdir(path.c_str(), 0700), 0);
+    path += "/" + std::string(200, 'p');
+  }
+  ASSERT_EQ(mkdir(path.c_str(), 0700), 0);
+  Server s(dir, "LNG", {"CAPTURE_PATH=" + path, "CAP_DBNAME=D" + v, "COMPATIBILITY=C" + v});
+  ASSERT_TRUE(s.ready());
+  klptest::ProcessResult pr =
+      klptest::run({klptest::binPath("klpkccmd"), "CAPTURE_SERVER=LNG", "QRYPARMS"}, {}, 60000);
+  EXPECT_EQ(pr.exitCode, 0) << pr.out;
+  for (const char* name : {"\"COMPATIBILITY\" has the value \"Cvvv",
+                           "\"CAP_DBNAME\" has the value \"Dvvv",
+                           "\"CAPTURE_SERVER\" has the value \"LNG\""})
+    EXPECT_NE(pr.out.find(name), std::string::npos) << name << "\n" << pr.out;
+  RawClient c(s.queue());
   stopCleanly(s, c);
 }
 
