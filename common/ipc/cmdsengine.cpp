@@ -97,6 +97,27 @@ void noteGetSuccess(cmdsState* st) {
 // ---------------------------------------------------------------------------
 OrdList* cmdListOf(klpThread* t) { return t->cmdList != nullptr ? t->cmdList : t->sharedCmdList; }
 
+// Commands waiting on the list. Only the engine adds to it, so the count can
+// only fall between this look and the engine's own put.
+int32_t pendingCmds(OrdList* list) {
+  int lrc = list->lockList();
+  int32_t n = list->count;
+  if (lrc == 0) list->unlockList();
+  return n;
+}
+
+// A thread that does not take its commands must not make its list grow
+// without end: a request past the cap is refused for that thread.
+bool underCap(klpThread* t, OrdList* target, const IpcMsgView& view) {
+  int32_t waiting = pendingCmds(target);
+  if (waiting < CMDS_MAX_PENDING_CMDS) return true;
+  char num[16], func[16];
+  msgInt(num, sizeof num, waiting);
+  msgInt(func, sizeof func, view.header.func);
+  logKlpMsg(CMDS_MSG_CMD_REFUSED, kOrigin, KLP_DEST_SEVERITY, t->name, nullptr, 2, num, func);
+  return false;
+}
+
 int distribute(cmdsState* st, OrdList* threads, const IpcMsgView& view) {
   if (threads == nullptr) return 0;
   int rc = 0;
@@ -106,7 +127,7 @@ int distribute(cmdsState* st, OrdList* threads, const IpcMsgView& view) {
     klpThread* t = klpThreadOf(e);
     if (!interestedInCmd(t, view.header.func)) continue;
     OrdList* target = cmdListOf(t);
-    if (target == nullptr) continue;
+    if (target == nullptr || !underCap(t, target, view)) continue;
     MsgQe* qe = nullptr;
     if (createMsgQe(&qe, view) != 0 || qe == nullptr) {
       st->endRequested = 1;

@@ -36,6 +36,10 @@ constexpr int32_t CMDS_GET_TIMEOUT_MS = 30000;
 // message at once; the later pieces of a long reply may wait this long in
 // all for the requester to make room.
 constexpr int32_t CMDS_PIECE_WAIT_MS = 2000;
+// Commands that may wait on one command list; a request past this is not
+// handed to that list's thread (message 8054).
+constexpr int32_t CMDS_MAX_PENDING_CMDS = 100;
+constexpr int CMDS_MSG_CMD_REFUSED = 8054;
 constexpr size_t CMDS_STATUS_TEXT_SIZE = 16;
 constexpr const char* CMDS_STATUS_UNDETERMINED = "UNDETERMINED";
 

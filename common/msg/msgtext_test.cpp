@@ -34,7 +34,7 @@ struct TextTest : ::testing::Test {
 
 TEST_F(TextTest, BuiltinTableLoadsWellFormedRowsOnceAndFirstDefinitionWins) {
   msgLogger fresh(MSG_APP_KLPKCCMD, 0);
-  EXPECT_EQ(115, fresh.loadBuiltinMsgs(builtinMsgTable));
+  EXPECT_EQ(116, fresh.loadBuiltinMsgs(builtinMsgTable));
   EXPECT_EQ(0, fresh.loadBuiltinMsgs(builtinMsgTable));
   EXPECT_EQ(0, fresh.loadBuiltinMsgs(nullptr));
   const char* empty[] = {nullptr};

@@ -339,6 +339,26 @@ TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
   freeIpcMsg(other);
 }
 
+TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
+  klptest::ProcessLogger log(5, dir_->path(), "eng.log");
+  klpThread* stuck = addThread("Stuck", KLP_THREAD_REST, {kPrune});
+  klpThread* taking = addThread("Taking", KLP_THREAD_REST, {kPrune});
+  for (int i = 0; i < 102; ++i) {
+    ASSERT_EQ(handle(e2e::RawClient::request(kPrune, 0, nullptr, 0)), 0);
+    deleteMsgQe(takeQe(taking));  // this one takes its commands
+  }
+  EXPECT_EQ(stuck->cmdList->count, 100);
+  EXPECT_EQ(taking->cmdList->count, 0);
+  std::string text = logText();
+  EXPECT_EQ(e2e::countOf(text, "KLP8054E"), 2u) << text;
+  EXPECT_NE(text.find("The thread \"Stuck\" has \"100\" commands waiting; the command with "
+                      "function code \"22\" is not passed to it."),
+            std::string::npos)
+      << text;
+  EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
+  EXPECT_EQ(stuck->cmdList->count, 101);
+}
+
 TEST_F(Engine, WithoutAServerQueueTheEngineReports804) {
   int32_t flag = 0;
   EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_NORMAL, &flag), 804);
