@@ -306,6 +306,23 @@ TEST(KcapServer, GarbageOnTheQueueNeitherCrashesNorHangsIt) {
   stopCleanly(s, c);
 }
 
+TEST(KcapServer, ANamePrefixThatDoesNotFitIsReportedWithTheBuildersCode) {
+  // 170 + ".KLP.KCAP" is more than the prefix's 160 characters.
+  klptest::TmpDir dir;
+  const std::string server = "CAPTURE_SERVER=" + std::string(170, 'N');
+  const std::vector<std::vector<std::string>> runs = {
+      {klptest::binPath("klpkcap"), server},
+      {klptest::binPath("klpkccmd"), server, "STATUS"},
+  };
+  for (const auto& argv : runs) {
+    klptest::ProcessResult pr = klptest::run(argv, {}, 30000);
+    EXPECT_EQ(pr.exitCode, 12) << argv[0];
+    EXPECT_NE(pr.out.find("a step failed with return code \"6005\": \"setEnvNamePrefix\""),
+              std::string::npos)
+        << argv[0] << "\n" << pr.out;
+  }
+}
+
 TEST(KcapServer, RestartAfterKillReplacesTheStaleQueue) {
   klptest::TmpDir dir;
   {
