@@ -24,8 +24,7 @@
 
 namespace {
 
-constexpr int kStop = 14, kStatus = 15, kChgparms = 20, kPrune = 22, kReinitq = 23;
-constexpr int kTerm = 5, kCommitInterval = 30;
+constexpr int kStop = 14, kStatus = 15, kPrune = 22;
 
 int g_dbRc = 0;
 int testDbCheck(char* text, size_t len) {
@@ -203,67 +202,6 @@ TEST_F(Engine, OnlyInterestedThreadsReceiveAndARequestWithoutRequesterIsNotAnswe
   ASSERT_TRUE(receive(&r));
   EXPECT_EQ(r.header.func, kPrune);
   EXPECT_EQ(r.header.msgLength, 44);
-}
-
-TEST_F(Engine, APayloadLongerThanTheElementHoldsIsCutAndEnded) {
-  klpThread* admin = addThread("AdminThread", KLP_THREAD_REST, {kReinitq});
-  auto m = e2e::RawClient::request(kReinitq, 0, nullptr);
-  m.resize(4096, 'Z');  // no NUL anywhere
-  int32_t len = 4096;
-  memcpy(m.data() + 12, &len, 4);
-  ASSERT_EQ(handle(m), 0);
-  MsgQe* qe = takeQe(admin);
-  ASSERT_NE(qe, nullptr);
-  EXPECT_EQ(strlen(qe->QeString), 1039u);
-  EXPECT_EQ(qe->QeString[1038], 'Z');
-  deleteMsgQe(qe);
-}
-
-TEST_F(Engine, MessagesThatDisagreeWithWhatWasReceivedCountAsFailedGets) {
-  klpThread* t = addThread("AdminThread", KLP_THREAD_REST, {kReinitq});
-  auto m = e2e::RawClient::request(kReinitq, 0, nullptr);
-  int32_t claim = 4096;  // more than the 44 bytes that came
-  memcpy(m.data() + 12, &claim, 4);
-  ASSERT_EQ(handle(m), 0);
-  EXPECT_EQ(st_.getFailed, 1);
-  std::vector<char> shortOne(m.begin(), m.begin() + 43);
-  ASSERT_EQ(handle(shortOne), 0);
-  EXPECT_EQ(cmdsHandleMessage(&st_, &threads_, nullptr, 0), 0);
-  EXPECT_EQ(t->cmdList->count, 0);
-  e2e::Reply r;
-  EXPECT_FALSE(receive(&r, 200));
-  // The next good message clears the state.
-  ASSERT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
-  EXPECT_EQ(st_.getFailed, 0);
-  EXPECT_TRUE(receive(&r));
-}
-
-TEST_F(Engine, ChgparmsWithMaybeLeavesTheFlagButEchoesTheRequest) {
-  std::string maybe = "MAYBE";
-  auto m = e2e::RawClient::request(kChgparms, kTerm, &maybe);
-  ASSERT_EQ(handle(m), 0);
-  e2e::Reply r;
-  ASSERT_TRUE(receive(&r));
-  ASSERT_EQ(r.raw.size(), m.size());
-  EXPECT_EQ(r.header.subFunc, kTerm);
-  EXPECT_STREQ(r.payload.data(), "MAYBE");
-  EXPECT_EQ(parms_->getParmBool(kTerm), 0);
-  EXPECT_EQ(parms_->getParmSource(kTerm), PARM_SRC_DEFAULT);
-
-  std::string value = "750";
-  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, kCommitInterval, &value)), 0);
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(parms_->getParmInt(kCommitInterval), 750);
-  EXPECT_EQ(parms_->getParmSource(kCommitInterval), PARM_SRC_CHGPARMS);
-  // Out of the parameter's range: refused by the registry, still echoed.
-  value = "50";
-  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, kCommitInterval, &value)), 0);
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(parms_->getParmInt(kCommitInterval), 750);
-  // An index outside the registry changes nothing.
-  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, 4000, &value)), 0);
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(r.header.subFunc, 4000);
 }
 
 TEST_F(Engine, StopIsAnsweredOnceAndTheStopSequenceSkipsStoppedThreads) {

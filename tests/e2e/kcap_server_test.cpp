@@ -164,9 +164,13 @@ TEST(KcapServer, ChgparmsIsEchoedAndQryparmsShowsTheChangeWithItsSource) {
   ASSERT_TRUE(c.ask(kChgparms, &r, kTerm, &maybe));
   EXPECT_EQ(r.header.subFunc, kTerm);
   ASSERT_TRUE(c.ask(kChgparms, &r, kCapturePath, &path));
-  // An integer that is not a whole number changes nothing either.
-  std::string bad = "12abc", term = "yes";
+  // An integer that is not a whole number, or is out of its range, changes
+  // nothing either; nor does an index outside the set.
+  std::string bad = "12abc", low = "50", term = "yes";
   ASSERT_TRUE(c.ask(kChgparms, &r, 16, &bad));
+  ASSERT_TRUE(c.ask(kChgparms, &r, kCommitInterval, &low));
+  ASSERT_TRUE(c.ask(kChgparms, &r, 4000, &low));
+  EXPECT_EQ(r.header.subFunc, 4000);
   ASSERT_TRUE(c.ask(kChgparms, &r, kTerm, &term));
 
   ASSERT_TRUE(c.ask(kQryparms, &r));
