@@ -114,9 +114,10 @@ void runCommand(int argc, char** argv) {
 
   // The server's queue is named by the prefix; a trace may be on for it.
   klpEnv* env = klpGetEnv();
-  if (setEnvNamePrefix(env, "KCAP") != KLP_OK) {
+  int prc = setEnvNamePrefix(env, "KCAP");
+  if (prc != KLP_OK) {
+    logInternalError(kProgram, prc, "setEnvNamePrefix");  // the routine's own reason
     r.rc = KLP_RC_NO_SERVER;
-    logInternalError(kProgram, r.rc, "setEnvNamePrefix");
     return;
   }
   trcAttach(getEnvIPCDir(env), getEnvNamePrefix(env), &env->appVersion, nullptr);

@@ -3,6 +3,7 @@
 // message refuses what.
 #include <gtest/gtest.h>
 
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -223,6 +224,22 @@ TEST_F(ParmSetTest, PathAndPasswordFile) {
   p = newSrv({"x", "PWDFILE=missing.aut"});
   EXPECT_EQ(p.rc, 806);
   EXPECT_TRUE(p.has("KLP0545E") && p.has(dir_.path() + "missing.aut")) << p.out;
+
+  // A working directory at the longest a value may be still gets its "/":
+  // the separator is not held to the value's limit.
+  std::string deep = dir_.path().substr(0, dir_.path().size() - 1);
+  while (deep.size() < 1040) {
+    size_t room = 1040 - deep.size();
+    deep += "/" + std::string(room <= 201 ? room - 1 : 100, 'd');
+    ASSERT_EQ(mkdir(deep.c_str(), 0700), 0) << deep.size();
+  }
+  ASSERT_EQ(chdir(deep.c_str()), 0);
+  p = newCmd({"x", "STOP"});
+  ASSERT_EQ(p.rc, 0) << p.out;
+  EXPECT_EQ(std::string(cmd_->peekSlot(7)->strValue), deep + "/");
+  p = newSrv({"x"});
+  ASSERT_EQ(p.rc, 0) << p.out;
+  EXPECT_EQ(std::string(server_->getParmString(7)), deep + "/");
 }
 
 TEST_F(ParmSetTest, ServerShortFormsAndPriority) {

@@ -719,28 +719,8 @@ int KLPResponseFunc(int32_t requesterPid, IpcMsg* replyMsg) {
   }
   issue(nullptr, 592, origin, KLP_DEST_SEVERITY, resId);
 
-  size_t payloadLen = static_cast<size_t>(replyMsg->msgLength) - IPC_HEADER_SIZE;
-  if (payloadLen <= IPC_MAX_PAYLOAD) {
-    if (putIpcMsg(held->queue, replyMsg, &prc) != 0) rc = KLP_RC_PUT_FAILED;
-  } else {
-    char* piece = static_cast<char*>(std::malloc(IPC_MAX_MSG_SIZE));
-    if (!piece) {
-      issue(nullptr, 543, origin, KLP_DEST_SEVERITY, "4096", "IPC message");
-      rc = KLP_RC_MSG_NO_MEMORY;
-    } else {
-      int32_t pieces = ipcPieceCount(payloadLen);
-      for (int32_t i = 1; rc == 0 && i <= pieces; ++i) {
-        size_t len = 0;
-        if (ipcBuildPiece(replyMsg, i, piece, IPC_MAX_MSG_SIZE, &len) != 0) {
-          prc = ECF_INVALID_ARGUMENT;
-          rc = KLP_RC_PUT_FAILED;
-        } else if (putIpcMsg(held->queue, reinterpret_cast<IpcMsg*>(piece), &prc) != 0) {
-          rc = KLP_RC_PUT_FAILED;
-        }
-      }
-      std::free(piece);
-    }
-  }
+  rc = putIpcReply(held->queue, replyMsg, HSV_PUT_WAIT_MS, -1, &prc, origin);
+  if (rc == IPC_RC_PUT_FAILED) rc = KLP_RC_PUT_FAILED;
   if (rc == KLP_RC_PUT_FAILED) {
     issue(nullptr, 508, origin, KLP_DEST_SEVERITY);
     logInternalError(origin, rc, "HSVHIPCQueue::put", ecfErrorGetDescription(prc));

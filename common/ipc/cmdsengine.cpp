@@ -97,6 +97,27 @@ void noteGetSuccess(cmdsState* st) {
 // ---------------------------------------------------------------------------
 OrdList* cmdListOf(klpThread* t) { return t->cmdList != nullptr ? t->cmdList : t->sharedCmdList; }
 
+// Commands waiting on the list. Only the engine adds to it, so the count can
+// only fall between this look and the engine's own put.
+int32_t pendingCmds(OrdList* list) {
+  int lrc = list->lockList();
+  int32_t n = list->count;
+  if (lrc == 0) list->unlockList();
+  return n;
+}
+
+// A thread that does not take its commands must not make its list grow
+// without end: a request past the cap is refused for that thread.
+bool underCap(klpThread* t, OrdList* target, const IpcMsgView& view) {
+  int32_t waiting = pendingCmds(target);
+  if (waiting < CMDS_MAX_PENDING_CMDS) return true;
+  char num[16], func[16];
+  msgInt(num, sizeof num, waiting);
+  msgInt(func, sizeof func, view.header.func);
+  logKlpMsg(CMDS_MSG_CMD_REFUSED, kOrigin, KLP_DEST_SEVERITY, t->name, nullptr, 2, num, func);
+  return false;
+}
+
 int distribute(cmdsState* st, OrdList* threads, const IpcMsgView& view) {
   if (threads == nullptr) return 0;
   int rc = 0;
@@ -106,7 +127,7 @@ int distribute(cmdsState* st, OrdList* threads, const IpcMsgView& view) {
     klpThread* t = klpThreadOf(e);
     if (!interestedInCmd(t, view.header.func)) continue;
     OrdList* target = cmdListOf(t);
-    if (target == nullptr) continue;
+    if (target == nullptr || !underCap(t, target, view)) continue;
     MsgQe* qe = nullptr;
     if (createMsgQe(&qe, view) != 0 || qe == nullptr) {
       st->endRequested = 1;
@@ -187,20 +208,26 @@ void changeParm(int32_t index, const char* value) {
 // ---------------------------------------------------------------------------
 int buildQueryReply(IpcMsg** out, int32_t pid) {
   klpParmClass* parms = klpGetCurrentParms();
-  size_t qsize = parms != nullptr ? parms->getQueryMsgSize() : 10;
-  if (qsize > IPC_MAX_GATHER) qsize = 10;
-  int rc = createReplyMsg(out, IPC_HEADER_SIZE + qsize, IPC_FUNC_QRYPARMS, pid);
-  if (rc != 0) return rc;
-  int qrc = parms != nullptr ? parms->setQueryMsg((*out)->payload()) : KLP_RC_BAD_PARM;
-  if (qrc != 0) {
-    logInternalError(kOrigin, qrc, "setQueryMsg");
-    // An empty query message still answers, so the requester does not wait
-    // for a reply that never comes.
-    freeIpcMsg(*out);
-    rc = createReplyMsg(out, IPC_HEADER_SIZE + 10, IPC_FUNC_QRYPARMS, pid);
-    if (rc != 0) return rc;
-    memcpy((*out)->payload() + 2, "KLPQRYMG", 8);
+  int qrc = KLP_RC_BAD_PARM;
+  if (parms != nullptr) {
+    size_t qsize = parms->getQueryMsgSize();
+    // Every requester refuses a longer one; a registry's slots cannot make it.
+    qrc = qsize <= ipcReplyPayloadLimit(IPC_FUNC_QRYPARMS) ? KLP_OK : KLP_RC_TOO_LONG;
+    if (qrc == KLP_OK) {
+      int rc = createReplyMsg(out, IPC_HEADER_SIZE + qsize, IPC_FUNC_QRYPARMS, pid);
+      if (rc != 0) return rc;
+      qrc = parms->setQueryMsg((*out)->payload());
+      if (qrc == KLP_OK) return 0;
+      freeIpcMsg(*out);
+      *out = nullptr;
+    }
   }
+  logInternalError(kOrigin, qrc, "setQueryMsg");
+  // An empty query message still answers, so the requester does not wait
+  // for a reply that never comes.
+  int rc = createReplyMsg(out, IPC_HEADER_SIZE + KLP_QUERY_HEADER_SIZE, IPC_FUNC_QRYPARMS, pid);
+  if (rc != 0) return rc;
+  memcpy((*out)->payload() + 2, "KLPQRYMG", 8);
   return 0;
 }
 
@@ -223,8 +250,8 @@ int buildSizeReply(IpcMsg** out, OrdList* threads, int32_t pid) {
   return 0;
 }
 
-// Puts the reply on the requester's reply queue. A reply that cannot be
-// delivered is reported and dropped.
+// Puts the reply on the requester's reply queue, in pieces when it is long.
+// A reply that cannot be delivered is reported and dropped.
 void sendReply(IpcMsg* reply, int32_t requester) {
   trcEntry(kTrcComp, kFnReply);
   char path[2 * KLP_ENV_PATH_MAX];
@@ -251,8 +278,10 @@ void sendReply(IpcMsg* reply, int32_t requester) {
     trcExit(kTrcComp, kFnReply, TRC_RET_RC, 0, 597);
     return;
   }
+  // A requester that does not take its replies must not hold up everyone
+  // else's: the first message goes only when there is room for it now.
   hsvRC putRc = ECF_OK;
-  if (putIpcMsg(&q, reply, &putRc) != 0) {
+  if (putIpcReply(&q, reply, 0, CMDS_PIECE_WAIT_MS, &putRc, kOrigin) == IPC_RC_PUT_FAILED) {
     logKlpMsg(508, kOrigin, KLP_DEST_SEVERITY, idText != nullptr ? idText : IPC_RESID_UNKNOWN,
               nullptr, 0);
     logInternalError(kOrigin, KLP_RC_PUT_FAILED, "HSVHIPCQueue::put",

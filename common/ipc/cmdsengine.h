@@ -32,6 +32,14 @@ constexpr int32_t CMDS_GRACE_SECONDS = 8;
 constexpr int32_t CMDS_GRACE_SECONDS_XQAPPLY = 180;
 constexpr int64_t CMDS_DB_CHECK_SECONDS = 4;  // a check is due once more than this passed
 constexpr int32_t CMDS_GET_TIMEOUT_MS = 30000;
+// A reply goes only when the requester's queue has room for its first
+// message at once; the later pieces of a long reply may wait this long in
+// all for the requester to make room.
+constexpr int32_t CMDS_PIECE_WAIT_MS = 2000;
+// Commands that may wait on one command list; a request past this is not
+// handed to that list's thread (message 8054).
+constexpr int32_t CMDS_MAX_PENDING_CMDS = 100;
+constexpr int CMDS_MSG_CMD_REFUSED = 8054;
 constexpr size_t CMDS_STATUS_TEXT_SIZE = 16;
 constexpr const char* CMDS_STATUS_UNDETERMINED = "UNDETERMINED";
 

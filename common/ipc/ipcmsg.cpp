@@ -2,6 +2,7 @@
 // command element.
 #include "common/ipc/ipcmsg.h"
 
+#include <chrono>
 #include <cinttypes>
 #include <cstdlib>
 #include <cstring>
@@ -9,6 +10,7 @@
 
 #include "common/env/klpenv.h"
 #include "common/msg/klplog.h"
+#include "common/parms/klpparm.h"
 #include "common/util/klprc.h"
 
 namespace {
@@ -80,6 +82,22 @@ bool ipcFuncKnown(int32_t func) {
          (func >= IPC_FUNC_STATUS_SIZE && func <= IPC_FUNC_KAPP_SIZE);
 }
 
+size_t ipcReplyPayloadLimit(int32_t func) {
+  // KCAP detailed status: a length-prefixed text at a 16-bit offset, and a
+  // section at another whose text starts 62 bytes in.
+  constexpr size_t kKcapDetailsMax = 0xFFFF + 62 + 0xFFFF;
+  // KAPP detailed status: 32 bytes, then 12296 bytes per entry.
+  constexpr size_t kKappEntries = 4096;
+  constexpr size_t kKappDetailsMax = 32 + 12296 * kKappEntries;
+  switch (func) {
+    case IPC_FUNC_STATUS: return IPC_STATUS_HEADER + IPC_STATUS_RECORD * 0x10000;
+    case IPC_FUNC_QRYPARMS: return KLP_QUERY_MSG_MAX;
+    case IPC_FUNC_KCAP_DETAILS: return kKcapDetailsMax;
+    case IPC_FUNC_KAPP_DETAILS: return kKappDetailsMax;
+    default: return IPC_MAX_PAYLOAD;
+  }
+}
+
 // ---------------------------------------------------------------------------
 // Building and putting
 // ---------------------------------------------------------------------------
@@ -128,14 +146,59 @@ void stampIpcMsg(IpcMsg* msg) {
 }
 
 int putIpcMsg(HSVHIPCQueue* queue, IpcMsg* msg, hsvRC* platformRc) {
+  return putIpcMsgWait(queue, msg, HSV_PUT_WAIT_MS, platformRc);
+}
+
+int putIpcMsgWait(HSVHIPCQueue* queue, IpcMsg* msg, int32_t waitMs, hsvRC* platformRc) {
   hsvRC rc = ECF_INVALID_ARGUMENT;
   if (queue && msg && msg->msgLength >= static_cast<int32_t>(IPC_HEADER_SIZE) &&
       msg->msgLength <= static_cast<int32_t>(IPC_MAX_MSG_SIZE)) {
     stampIpcMsg(msg);
-    rc = queue->put(msg, static_cast<size_t>(msg->msgLength));
+    if (waitMs < 0) waitMs = HSV_PUT_WAIT_MS;
+    rc = queue->putWait(msg, static_cast<size_t>(msg->msgLength), waitMs);
   }
   if (platformRc) *platformRc = rc;
   return rc == ECF_OK ? KLP_OK : IPC_RC_PUT_FAILED;
+}
+
+int putIpcReply(HSVHIPCQueue* queue, IpcMsg* reply, int32_t firstWaitMs, int32_t restWaitMs,
+                hsvRC* platformRc, const char* origin) {
+  if (platformRc) *platformRc = ECF_INVALID_ARGUMENT;
+  if (!reply || reply->msgLength < static_cast<int32_t>(IPC_HEADER_SIZE))
+    return IPC_RC_PUT_FAILED;
+  size_t payloadLen = static_cast<size_t>(reply->msgLength) - IPC_HEADER_SIZE;
+  if (payloadLen <= IPC_MAX_PAYLOAD) return putIpcMsgWait(queue, reply, firstWaitMs, platformRc);
+
+  auto* piece = static_cast<IpcMsg*>(malloc(IPC_MAX_MSG_SIZE));
+  if (!piece) {
+    logKlpMsg(543, origin, KLP_DEST_SEVERITY, "4096", nullptr, 1, "IPC message");
+    return KLP_RC_MSG_NO_MEMORY;
+  }
+  // The pieces after the first share one budget, so a requester that takes
+  // a few pieces and then stops cannot hold the sender for long.
+  using Clock = std::chrono::steady_clock;
+  const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(restWaitMs);
+  stampIpcMsg(reply);
+  int rc = KLP_OK;
+  int32_t pieces = ipcPieceCount(payloadLen);
+  for (int32_t k = 1; rc == KLP_OK && k <= pieces; ++k) {
+    int32_t waitMs = firstWaitMs;
+    if (k > 1 && restWaitMs >= 0) {
+      auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now());
+      waitMs = left.count() > 0 ? static_cast<int32_t>(left.count()) : 0;
+    } else if (k > 1) {
+      waitMs = restWaitMs;
+    }
+    size_t len = 0;
+    if (ipcBuildPiece(reply, k, piece, IPC_MAX_MSG_SIZE, &len) != KLP_OK) {
+      if (platformRc) *platformRc = ECF_INVALID_ARGUMENT;
+      rc = IPC_RC_PUT_FAILED;
+    } else {
+      rc = putIpcMsgWait(queue, piece, waitMs, platformRc);
+    }
+  }
+  free(piece);
+  return rc;
 }
 
 // ---------------------------------------------------------------------------
@@ -213,15 +276,21 @@ int ipcBuildPiece(const IpcMsg* reply, int32_t pieceNo, void* out, size_t outCap
 
 IpcGather::~IpcGather() { free(buf_); }
 
-int IpcGather::reserve(size_t payloadBytes) {
+// Room for payloadBytes; grows by doubling up to ceiling, so that a long
+// reply is not copied once per piece and a short one holds no more than it
+// got.
+int IpcGather::reserve(size_t payloadBytes, size_t ceiling) {
   if (payloadBytes <= capacity_ && buf_) return KLP_OK;
+  size_t room = capacity_ * 2;
+  if (room > ceiling) room = ceiling;
+  if (room < payloadBytes) room = payloadBytes;
   // One spare byte keeps a NUL after the payload, so a text payload can be
   // read as a string without trusting the sender to have ended it.
-  char* grown = static_cast<char*>(realloc(buf_, IPC_GATHER_HEADER + payloadBytes + 1));
+  char* grown = static_cast<char*>(realloc(buf_, IPC_GATHER_HEADER + room + 1));
   if (!grown) return KLP_RC_MSG_NO_MEMORY;
   if (!buf_) memset(grown, 0, IPC_GATHER_HEADER);
   buf_ = grown;
-  capacity_ = payloadBytes;
+  capacity_ = room;
   return KLP_OK;
 }
 
@@ -230,7 +299,7 @@ int IpcGather::add(const IpcMsgView& msg, int32_t* piecesLeft) {
   if (spoiled_) return KLP_RC_GET_FAILED;
   const IpcMsg& h = msg.header;
   size_t len = msg.payloadLen;
-  if ((len && !msg.payload) || h.pieceCount < 0) {
+  if ((len && !msg.payload) || h.pieceCount < 0 || len > IPC_MAX_PAYLOAD) {
     spoiled_ = true;
     return KLP_RC_GET_FAILED;
   }
@@ -239,40 +308,36 @@ int IpcGather::add(const IpcMsgView& msg, int32_t* piecesLeft) {
 
   if (!inProgress && h.pieceCount > 1) {
     // The first piece of a multi-piece reply names count and total: they
-    // must agree with each other and stay within bounds before anything is
-    // allocated for them.
-    if (h.pieceNo != 1 || h.totalLength <= 0 || h.totalLength > IPC_MAX_GATHER ||
-        ipcPieceCount(static_cast<size_t>(h.totalLength)) != h.pieceCount ||
-        used_ + static_cast<size_t>(h.totalLength) > static_cast<size_t>(IPC_MAX_GATHER)) {
+    // must agree with each other and stay within what the code can need.
+    if (h.pieceNo != 1 || h.totalLength <= 0 ||
+        static_cast<size_t>(h.totalLength) > ipcReplyPayloadLimit(h.func) ||
+        ipcPieceCount(static_cast<size_t>(h.totalLength)) != h.pieceCount) {
       spoiled_ = true;
       return KLP_RC_GET_FAILED;
     }
-    int rc = reserve(used_ + static_cast<size_t>(h.totalLength));
-    if (rc != KLP_OK) return rc;
     expected_ = h.pieceCount;
     received_ = 0;
     total_ = h.totalLength;
+    func_ = h.func;
     base_ = used_;
     inProgress = true;
   }
 
+  int rc;
   if (inProgress) {
     size_t offset = static_cast<size_t>(received_) * IPC_MAX_PAYLOAD;
     size_t want = static_cast<size_t>(total_) - offset;
     if (want > IPC_MAX_PAYLOAD) want = IPC_MAX_PAYLOAD;
-    if (h.pieceCount != expected_ || h.totalLength != total_ || h.pieceNo != received_ + 1 ||
-        len != want || base_ + offset + len > capacity_) {
+    if (h.func != func_ || h.pieceCount != expected_ || h.totalLength != total_ ||
+        h.pieceNo != received_ + 1 || len != want) {
       spoiled_ = true;
       return KLP_RC_GET_FAILED;
     }
+    rc = reserve(base_ + offset + len, base_ + static_cast<size_t>(total_));
   } else {
-    if (used_ + len > static_cast<size_t>(IPC_MAX_GATHER)) {
-      spoiled_ = true;
-      return KLP_RC_GET_FAILED;
-    }
-    int rc = reserve(used_ + len);
-    if (rc != KLP_OK) return rc;
+    rc = reserve(used_ + len, used_ + len);
   }
+  if (rc != KLP_OK) return rc;
 
   if (first) memcpy(buf_, &h.senderPid, sizeof h.senderPid);
   if (len) memcpy(buf_ + IPC_GATHER_HEADER + used_, msg.payload, len);
@@ -293,7 +358,7 @@ char* IpcGather::release() {
   char* out = buf_;
   buf_ = nullptr;
   capacity_ = used_ = 0;
-  expected_ = received_ = total_ = 0;
+  expected_ = received_ = total_ = func_ = 0;
   base_ = 0;
   return out;
 }

@@ -24,10 +24,6 @@ constexpr size_t IPC_MAX_MSG_SIZE = 4096;                             // one mes
 constexpr size_t IPC_MAX_PAYLOAD = IPC_MAX_MSG_SIZE - IPC_HEADER_SIZE;  // 4052
 constexpr int32_t IPC_MSG_VERSION = 1;
 constexpr const char* IPC_EYE_CATCHER = "IPC:";
-// Longest reply payload accepted for reassembly. A multi-piece reply names its
-// own size; this bound keeps a damaged or hostile header from making the
-// receiver allocate gigabytes.
-constexpr int32_t IPC_MAX_GATHER = 64 * 1024 * 1024;
 
 // The 44-byte header; the payload follows it. All integers little-endian.
 struct IpcMsg {
@@ -75,6 +71,13 @@ enum : int32_t {
 
 // True for the codes above.
 bool ipcFuncKnown(int32_t func);
+// Longest reply payload the code can need: STATUS 12 + 20 x 65536 (the thread
+// count travels in 16 bits), QRYPARMS a query message of every slot at its
+// longest value, the KCAP detailed status what its 16-bit offsets reach, the
+// KAPP detailed status 4096 entries; every other code one message. A
+// multi-piece reply names its own size, so this is what keeps a damaged or
+// forged header from making the receiver allocate for it.
+size_t ipcReplyPayloadLimit(int32_t func);
 // The command word of a code ("STOP", ...), "" for codes without one.
 const char* ipcFuncWord(int32_t func);
 
@@ -113,7 +116,21 @@ void stampIpcMsg(IpcMsg* msg);
 // not within 44..4096 (nothing is put then; *platformRc is
 // ECF_INVALID_ARGUMENT).
 int putIpcMsg(HSVHIPCQueue* queue, IpcMsg* msg, hsvRC* platformRc);
+// The same, waiting at most waitMs for room in a full queue (0: not at all;
+// negative: as long as a plain put does). A queue still full gives 503 with
+// *platformRc ECF_QUEUE_FULL.
+int putIpcMsgWait(HSVHIPCQueue* queue, IpcMsg* msg, int32_t waitMs, hsvRC* platformRc);
 constexpr int IPC_RC_PUT_FAILED = 503;
+
+// Puts a reply of any length on the requester's attached queue: whole when
+// its payload fits one message, otherwise in pieces (ipcBuildPiece), in
+// order. The first message waits at most firstWaitMs for room, the pieces
+// after it together at most restWaitMs (negative: each as long as a plain put
+// does). After a failed put no further piece is sent. Answers 0, 503 (see
+// *platformRc) or 1003 after message 543 (origin) when no piece buffer could
+// be had. The reply itself is stamped but otherwise left as it is.
+int putIpcReply(HSVHIPCQueue* queue, IpcMsg* reply, int32_t firstWaitMs, int32_t restWaitMs,
+                hsvRC* platformRc, const char* origin);
 
 // ---------------------------------------------------------------------------
 // Decoding a received buffer
@@ -155,8 +172,10 @@ int ipcBuildPiece(const IpcMsg* reply, int32_t pieceNo, void* out, size_t outCap
 // Collects reply pieces into one reply buffer: [int32 senderPid of the first
 // piece][int32 payload bytes gathered][payload]. Single-piece replies are
 // appended as they come (the buffer grows); the pieces of a multi-piece reply
-// must agree with its first piece in count and total, come in order (pieceNo
-// 1, 2, ...) and sum to the total.
+// must agree with its first piece in code, count and total, come in order
+// (pieceNo 1, 2, ...) and sum to the total, which must lie within what the
+// code can need (ipcReplyPayloadLimit). Room grows with the pieces that came,
+// never ahead of them by more than what has come.
 class IpcGather {
  public:
   IpcGather() = default;
@@ -171,20 +190,22 @@ class IpcGather {
   int add(const IpcMsgView& msg, int32_t* piecesLeft);
   // Pieces still expected of the reply in progress.
   int32_t outstanding() const { return expected_ - received_; }
-  // Payload bytes gathered so far.
+  // Payload bytes gathered so far, and the room held for them.
   size_t gathered() const { return used_; }
+  size_t reserved() const { return capacity_; }
   // Hands the buffer (malloc'ed; the caller frees it) to the caller; null
   // when nothing was gathered or the gather is spoiled.
   char* release();
 
  private:
-  int reserve(size_t payloadBytes);
+  int reserve(size_t payloadBytes, size_t ceiling);
   char* buf_ = nullptr;
   size_t capacity_ = 0;   // payload capacity of buf_
   size_t used_ = 0;
   int32_t expected_ = 0;  // pieces of the multi-piece reply in progress
   int32_t received_ = 0;
   int32_t total_ = 0;
+  int32_t func_ = 0;      // code of the multi-piece reply in progress
   size_t base_ = 0;       // where the multi-piece reply in progress begins
   bool spoiled_ = false;
 };

@@ -330,6 +330,7 @@ TEST(Pieces, CorruptedPieceHeadersFailCleanly) {
       {"piece number repeated", 2, 36, 2},
       {"piece number negative", 1, 36, -1},
       {"count changes midway", 2, 32, 5},
+      {"code changes midway", 1, 16, IPC_FUNC_STATUS},
       {"total changes midway", 1, 40, 3 * 4052 + 11},
       {"total beyond the count", 0, 40, 5 * 4052},
       {"total below the count", 0, 40, 3 * 4052},
@@ -375,6 +376,34 @@ TEST(Pieces, CorruptedPieceHeadersFailCleanly) {
   EXPECT_EQ(3, early.outstanding());
 }
 
+TEST(Pieces, ATotalBeyondWhatItsCodeCanNeedIsRefusedAndRoomFollowsThePieces) {
+  const struct {
+    int32_t func;
+    int32_t total;
+    bool taken;
+  } cases[] = {
+      {IPC_FUNC_QRYPARMS, 69130, true},  // 64 slots of 1040-character values
+      {IPC_FUNC_QRYPARMS, 69131, false},
+      {IPC_FUNC_QRYPARMS, 64 * 1024 * 1024, false},
+      {IPC_FUNC_STATUS, 1310733, false},  // more than 65536 thread records
+      {IPC_FUNC_KCAP_DETAILS, 131133, false},
+      {IPC_FUNC_KAPP_DETAILS, 50364448, true},  // 4096 entries
+      {IPC_FUNC_KAPP_DETAILS, 50364449, false},
+      {IPC_FUNC_CHGPARMS, 4053, false},  // the echo of one request
+      {99, 4053, false},
+  };
+  for (const auto& c : cases) {
+    int32_t count = (c.total + 4051) / 4052;
+    IpcGather g;
+    int32_t left = 0;
+    auto first = rawMsg(4096, pattern(4052), 1, count, 1, c.total, c.func);
+    EXPECT_EQ(c.taken ? 0 : KLP_RC_GET_FAILED, addRaw(g, first, &left)) << c.func << " " << c.total;
+    EXPECT_EQ(c.taken ? count - 1 : 0, left) << c.func << " " << c.total;
+    // A forged first piece costs what it brought, not what it claims.
+    EXPECT_LE(g.reserved(), 4052u) << c.func << " " << c.total;
+  }
+}
+
 TEST(Pieces, LongReplyTravelsBetweenProcesses) {
   klptest::TmpDir dir;
   char path[256];
@@ -390,13 +419,8 @@ TEST(Pieces, LongReplyTravelsBetweenProcesses) {
     IpcMsg* msg = nullptr;
     if (createReplyMsg(&msg, 44 + payload.size(), 61, hsvProcessID()) != 0) _exit(2);
     memcpy(msg->payload(), payload.data(), payload.size());
-    char piece[IPC_MAX_MSG_SIZE];
-    for (int32_t k = 1; k <= ipcPieceCount(payload.size()); ++k) {
-      size_t len = 0;
-      hsvRC prc;
-      if (ipcBuildPiece(msg, k, piece, sizeof piece, &len) != 0) _exit(3);
-      if (putIpcMsg(&q, reinterpret_cast<IpcMsg*>(piece), &prc) != 0) _exit(4);
-    }
+    hsvRC prc;
+    if (putIpcReply(&q, msg, -1, -1, &prc, "test") != 0) _exit(4);
     freeIpcMsg(msg);
     q.detach();
     _exit(0);

@@ -82,6 +82,7 @@ const char* const builtinMsgTable[] = {
     "KLP8051D  \"$1\" : \"$2\" : Stop was requested by \"$3\".",
     "KLP8052D  \"$1\" : \"$2\" : All threads have stopped.",
     "KLP8053D  \"$1\" : \"$2\" : Signal \"$3\" was handled; the dump was written to file \"$4\".",
+    "KLP8054E  \"$1\" : \"$2\" : The thread \"$3\" has \"$4\" commands waiting; the command with function code \"$5\" is not passed to it.",
     "KLP8999D $1",
     "KLP0641E  \"$1\" : \"$2\" : The send queue \"$3\" could not be reinitialized. Reason code: \"$4\".",
     "KLP0645E  \"$1\" : \"$2\" : The value \"$3\" of column \"$4\" in table \"$5\" is not valid.",

@@ -33,19 +33,44 @@ HeaderKind headerKind(int n) {
   return HEADER_NONE;
 }
 
-char* copyText(const char* s, size_t n) {
+// How a byte of a value is written in a message text: control characters
+// escaped, so that no value can end or split the line its message goes on
+// (a queue name a client sent may hold a line feed). Answers the characters
+// written into out (room for 4 and a NUL), or only counts them when out is
+// null.
+size_t escapeByte(unsigned char c, char* out) {
+  const char* named = c == '\n' ? "\\n" : c == '\r' ? "\\r" : c == '\t' ? "\\t" : nullptr;
+  if (named != nullptr) {
+    if (out != nullptr) memcpy(out, named, 2);
+    return 2;
+  }
+  if (c < 0x20 || c == 0x7F) {
+    if (out != nullptr) snprintf(out, 5, "\\x%02X", c);
+    return 4;
+  }
+  if (out != nullptr) *out = static_cast<char>(c);
+  return 1;
+}
+
+// A value's copy as it is substituted; *len gets its length.
+char* copyValue(const char* value, size_t* len) {
+  size_t n = 0;
+  for (const char* p = value; *p != '\0'; ++p) n += escapeByte(static_cast<unsigned char>(*p), nullptr);
   char* c = new (std::nothrow) char[n + 1];
   if (c == nullptr) return nullptr;
-  memcpy(c, s, n);
+  // The terminator's place gives the last escape room for its NUL.
+  size_t at = 0;
+  for (const char* p = value; *p != '\0'; ++p) at += escapeByte(static_cast<unsigned char>(*p), c + at);
   c[n] = '\0';
+  *len = n;
   return c;
 }
 
 // Puts a copy of value in front of the record's values; when nine are held
 // the last one is dropped first.
 bool pushFront(logMsg* r, const char* value) {
-  size_t n = strlen(value);
-  char* copy = copyText(value, n);
+  size_t n = 0;
+  char* copy = copyValue(value, &n);
   if (copy == nullptr) {
     r->error = KLP_RC_NO_MEMORY;
     return false;
@@ -143,8 +168,8 @@ void msgLogger::setMsgValues(logMsg* r, int count, const char* const* values) {
   int n = count < MSG_MAX_VALUES ? count : MSG_MAX_VALUES;
   for (int i = 0; i < n && r->valueCount < MSG_MAX_VALUES; ++i) {
     const char* v = (values != nullptr && values[i] != nullptr) ? values[i] : "*";
-    size_t len = strlen(v);
-    char* copy = copyText(v, len);
+    size_t len = 0;
+    char* copy = copyValue(v, &len);
     if (copy == nullptr) {
       r->error = KLP_RC_NO_MEMORY;
       return;

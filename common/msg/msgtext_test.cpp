@@ -34,7 +34,7 @@ struct TextTest : ::testing::Test {
 
 TEST_F(TextTest, BuiltinTableLoadsWellFormedRowsOnceAndFirstDefinitionWins) {
   msgLogger fresh(MSG_APP_KLPKCCMD, 0);
-  EXPECT_EQ(115, fresh.loadBuiltinMsgs(builtinMsgTable));
+  EXPECT_EQ(116, fresh.loadBuiltinMsgs(builtinMsgTable));
   EXPECT_EQ(0, fresh.loadBuiltinMsgs(builtinMsgTable));
   EXPECT_EQ(0, fresh.loadBuiltinMsgs(nullptr));
   const char* empty[] = {nullptr};
@@ -202,6 +202,27 @@ TEST_F(TextTest, SubstitutionFollowsMarkerOrder) {
   EXPECT_EQ("no markers", sub("no markers"));
   EXPECT_EQ("x$", sub("x$"));
   EXPECT_EQ("<A|", sub("<$1|$2|$3>", 3, 3));    // cut at the capacity
+}
+
+TEST_F(TextTest, ControlCharactersInValuesAreWrittenEscaped) {
+  // A value may come from another process (a queue name a client sent): it
+  // must never end or split the line its message is written on.
+  const struct {
+    const char* value;
+    const char* shown;
+  } cases[] = {
+      {"Q1\nKLP0522I forged", "Q1\\nKLP0522I forged"},
+      {"a\r\tb", "a\\r\\tb"},
+      {"\x1b[31mred\x7f", "\\x1B[31mred\\x7F"},
+      {"\x01", "\\x01"},
+      {"back\\slash \xc3\xbc", "back\\slash \xc3\xbc"},  // printable and UTF-8 stay
+  };
+  for (const auto& c : cases)
+    EXPECT_EQ(std::string("KLP8999D ") + c.shown, text(8999, "T", c.value)) << c.shown;
+  // The header values too: a qualifier with a line feed shows escaped.
+  logger.setProgramQualifier("K\nLP");
+  EXPECT_EQ("KLP8006D  \"KlpKCcmd\" : \"K\\nLP\" : \"T\" : Element \"X\" is out of range.",
+            text(8006, "T", "X"));
 }
 
 TEST_F(TextTest, TextIsCutAt1024AndNeverWrittenPastTheBuffer) {

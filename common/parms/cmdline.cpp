@@ -323,17 +323,13 @@ int klpParmClass::parseCmdLine(int argc, char** argv) {
     return KLP_RC_BAD_PARM;
   }
 
-  // The path always ends with a directory separator.
+  // The path always ends with a directory separator. The separator is
+  // stored back as it is: a directory the user may give (or be in) at the
+  // value's longest must not become too long by it.
   std::string path = slotText(&slots_[PARM_IDX_PATH]);
   if (path.empty() || path.back() != '/') {
     path += '/';
-    if (slots_[PARM_IDX_PATH].type == PARM_STRING) {
-      int rc = setParm(PARM_IDX_PATH, path.c_str(), slots_[PARM_IDX_PATH].source);
-      if (rc) {
-        logInternalError(kWhereParse, rc, "klpParmClass::setParm");
-        return rc;
-      }
-    }
+    if (slots_[PARM_IDX_PATH].type == PARM_STRING) replaceSlotText(PARM_IDX_PATH, path.c_str());
   }
 
   ParmEntry& pwd = slots_[PARM_IDX_PWDFILE];

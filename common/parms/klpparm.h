@@ -34,6 +34,13 @@ constexpr int KLP_PARM_NAME_MAX = 32;       // longest parameter name
 constexpr int KLP_PARM_VALUE_MAX = 1040;    // longest STRING / COMMAND text
 constexpr int KLP_PARM_TABLE_NAME_MAX = 128;
 
+// The parameter query message: a 10-byte header, then per parameter shown a
+// record of 40 bytes and the value. At most one record per slot.
+constexpr size_t KLP_QUERY_HEADER_SIZE = 10;
+constexpr size_t KLP_QUERY_RECORD_FIXED = 40;
+constexpr size_t KLP_QUERY_MSG_MAX =
+    KLP_QUERY_HEADER_SIZE + KLP_PARM_SLOTS * (KLP_QUERY_RECORD_FIXED + KLP_PARM_VALUE_MAX);
+
 // Well-known parameter numbers, the same in every parameter set.
 enum : int {
   PARM_IDX_SERVER = 0,

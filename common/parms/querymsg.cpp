@@ -14,8 +14,8 @@
 
 namespace {
 
-constexpr size_t kHeaderSize = 10;
-constexpr size_t kRecordFixed = 40;
+constexpr size_t kHeaderSize = KLP_QUERY_HEADER_SIZE;
+constexpr size_t kRecordFixed = KLP_QUERY_RECORD_FIXED;
 
 bool included(const ParmEntry& s) {
   return s.display == 1 || (s.display == -1 && s.source != PARM_SRC_DEFAULT);

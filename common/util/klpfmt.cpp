@@ -4,6 +4,7 @@
 #include <cctype>
 #include <cerrno>
 #include <cinttypes>
+#include <climits>
 #include <cstdarg>
 #include <cstdlib>
 #include <cstring>
@@ -136,11 +137,14 @@ void toStdout(char* text, size_t needed) {
 }
 
 // Reads the decimal number at text[pos] up to the next non-digit, never past
-// len.
+// len. A run of digits beyond what an int holds gives -1.
 int numberAt(const char* text, size_t len, size_t pos) {
   int v = 0;
-  for (size_t i = pos; i < len && isdigit(static_cast<unsigned char>(text[i])); ++i)
-    v = v * 10 + (text[i] - '0');
+  for (size_t i = pos; i < len && isdigit(static_cast<unsigned char>(text[i])); ++i) {
+    int digit = text[i] - '0';
+    if (v > (INT_MAX - digit) / 10) return -1;
+    v = v * 10 + digit;
+  }
   return v;
 }
 
@@ -290,22 +294,28 @@ void hexDump(size_t count, const void* addr, FILE* stream, bool showAddress) {
 int timestamp2seconds(const char* text, int64_t* seconds, int32_t* micros) {
   size_t len = text ? strlen(text) : 0;
   if (len != KLP_TIMESTAMP_LEN && len != KLP_TIMESTAMP_US_LEN) {
+    // The log line ends itself; a line feed in the text would only show
+    // escaped.
     char line[80];
-    snprintf(line, sizeof line, "Expected timestamp len of 19 or 26. Received %d\n",
+    snprintf(line, sizeof line, "Expected timestamp len of 19 or 26. Received %d",
              static_cast<int>(len));
     logKlpMsg(-1, "timestamp2seconds", KLP_DEST_LOG, line, nullptr, 0);
     return -1;
   }
+  const int year = numberAt(text, len, 0), month = numberAt(text, len, 5);
   struct tm tm {};
-  tm.tm_year = numberAt(text, len, 0) - 1900;
-  tm.tm_mon = numberAt(text, len, 5) - 1;
+  tm.tm_year = year - 1900;
+  tm.tm_mon = month - 1;
   tm.tm_mday = numberAt(text, len, 8);
   tm.tm_hour = numberAt(text, len, 11);
   tm.tm_min = numberAt(text, len, 14);
   tm.tm_sec = numberAt(text, len, 17);
   tm.tm_isdst = -1;  // daylight saving is the local-time conversion's to decide
   int32_t us = len == KLP_TIMESTAMP_US_LEN ? numberAt(text, len, 20) : 0;
-  time_t t = mktime(&tm);
+  // A field too long for a number is not a time: conversion fails for it.
+  bool overflow = year < 0 || month < 0 || tm.tm_mday < 0 || tm.tm_hour < 0 || tm.tm_min < 0 ||
+                  tm.tm_sec < 0;
+  time_t t = overflow ? static_cast<time_t>(-1) : mktime(&tm);
   if (t == static_cast<time_t>(-1)) {
     if (seconds) *seconds = 0;
     if (micros) *micros = us;

@@ -177,13 +177,21 @@ TEST_F(Fmt, TimestampsParseAndPrint) {
   formatMillis32(59999, buf, sizeof buf);
   EXPECT_STREQ(" 0h  0m 59.999s", buf);
 
-  // A wrong length is reported with the length.
+  // A wrong length is reported with the length, on a line of its own.
   LogFile log;
   EXPECT_EQ(-1, timestamp2seconds("2026-12-06-11.43.08.12345", &s, nullptr));
   EXPECT_EQ(-1, timestamp2seconds(nullptr, &s, nullptr));
   EXPECT_NE(std::string::npos, log.text().find("<timestamp2seconds> KLP8999D Expected timestamp "
-                                               "len of 19 or 26. Received 25"))
+                                               "len of 19 or 26. Received 25\n"))
       << log.text();
+  // Fields with more digits than a number holds are no time.
+  for (const char* huge : {"99999999999999999999999999", "2026-12-06-11.999999999999",
+                           "2026-12-999999999999999999"}) {
+    s = 7;
+    EXPECT_EQ(-1, timestamp2seconds(huge, &s, nullptr)) << huge;
+    EXPECT_EQ(0, s) << huge;
+  }
+  EXPECT_EQ(5u, klptest::lines(log.text()).size()) << log.text();
 }
 
 TEST_F(Fmt, PackedDecimalDatesAndFractionPrecision) {

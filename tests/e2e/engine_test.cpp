@@ -3,10 +3,12 @@
 // that what each thread received can be looked at directly.
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstring>
 #include <memory>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "common/env/klpenv.h"
@@ -22,8 +24,7 @@
 
 namespace {
 
-constexpr int kStop = 14, kStatus = 15, kChgparms = 20, kPrune = 22, kReinitq = 23;
-constexpr int kTerm = 5, kCommitInterval = 30;
+constexpr int kStop = 14, kStatus = 15, kPrune = 22;
 
 int g_dbRc = 0;
 int testDbCheck(char* text, size_t len) {
@@ -116,6 +117,28 @@ class Engine : public ::testing::Test {
 
   static MsgQe* takeQe(klpThread* t) { return reinterpret_cast<MsgQe*>(t->cmdList->getHead()); }
 
+  // Takes a reply's pieces as the client does until it is whole; the
+  // headers of the pieces that came are kept.
+  std::vector<char> gatherReply(std::vector<IpcMsg>* headers) {
+    IpcGather g;
+    int32_t left = 0;
+    do {
+      e2e::Reply r;
+      if (!receive(&r)) return {};
+      headers->push_back(r.header);
+      IpcMsgView v;
+      if (ipcDecodeMsg(r.raw.data(), r.raw.size(), &v) != 0 || g.add(v, &left) != 0) return {};
+    } while (left > 0);
+    char* buf = g.release();
+    int32_t len = 0;
+    memcpy(&len, buf + 4, 4);
+    std::vector<char> payload(buf + 8, buf + 8 + len);
+    free(buf);
+    return payload;
+  }
+
+  std::string logText() const { return klptest::readFile(dir_->path() + "eng.log"); }
+
   std::unique_ptr<klptest::TmpDir> dir_;
   std::unique_ptr<xqpubParms> parms_;
   OrdList threads_;
@@ -125,25 +148,37 @@ class Engine : public ::testing::Test {
   std::string replyPath_;
 };
 
-TEST_F(Engine, StatusOfThreeThreadsIs136BytesInListOrder) {
-  addThread("First", KLP_THREAD_REST);
+TEST_F(Engine, StatusHasOneRecordPerThreadInListOrderAndALongOneComesInPieces) {
   addThread("BehinderWorkerThread", KLP_THREAD_RUN);
-  addThread("Third", KLP_THREAD_DBWAIT);
-  ASSERT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
-  e2e::Reply r;
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(r.header.msgLength, 136);
-  EXPECT_EQ(r.raw.size(), 136u);
-  EXPECT_EQ(r.header.func, kStatus);
-  EXPECT_EQ(r.header.senderPid, getpid());
-  EXPECT_EQ(e2e::rd32(r.payload, 0), 0);
-  EXPECT_EQ(e2e::rd32(r.payload, 8), 3);
-  EXPECT_STREQ(r.payload.data() + 12, "First");
-  EXPECT_STREQ(r.payload.data() + 32, "BehinderWorker");
-  EXPECT_STREQ(r.payload.data() + 52, "Third");
-  EXPECT_EQ(e2e::rd32(r.payload, 12 + 16), KLP_THREAD_REST);
-  EXPECT_EQ(e2e::rd32(r.payload, 32 + 16), KLP_THREAD_RUN);
-  EXPECT_EQ(e2e::rd32(r.payload, 52 + 16), KLP_THREAD_DBWAIT);
+  addThread("Second", KLP_THREAD_DBWAIT);
+  addThread("Third", KLP_THREAD_REST);
+  const struct {
+    int threads;
+    size_t pieces;
+    int32_t lastLength;
+  } cases[] = {
+      {3, 1, 136},         // 76 + 20 x 3
+      {250, 2, 44 + 980},  // 5032 payload bytes: 4052, then 980
+  };
+  for (const auto& c : cases) {
+    while (threads_.count < c.threads) addThread("More", KLP_THREAD_REST);
+    std::vector<IpcMsg> pieces;
+    ASSERT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
+    std::vector<char> p = gatherReply(&pieces);
+    ASSERT_EQ(pieces.size(), c.pieces);
+    for (const IpcMsg& h : pieces) {
+      EXPECT_EQ(h.func, kStatus);
+      EXPECT_EQ(h.senderPid, getpid());
+      EXPECT_EQ(h.pieceCount, static_cast<int32_t>(c.pieces));
+    }
+    EXPECT_EQ(pieces.back().msgLength, c.lastLength);
+    EXPECT_EQ(e2e::rd32(p, 0), 0);
+    EXPECT_EQ(e2e::rd32(p, 8), c.threads);
+    EXPECT_STREQ(p.data() + 12, "BehinderWorker");
+    EXPECT_EQ(e2e::rd32(p, 12 + 16), KLP_THREAD_RUN);
+    EXPECT_STREQ(p.data() + 32, "Second");
+    EXPECT_EQ(e2e::rd32(p, 32 + 16), KLP_THREAD_DBWAIT);
+  }
 }
 
 TEST_F(Engine, OnlyInterestedThreadsReceiveAndARequestWithoutRequesterIsNotAnswered) {
@@ -167,67 +202,6 @@ TEST_F(Engine, OnlyInterestedThreadsReceiveAndARequestWithoutRequesterIsNotAnswe
   ASSERT_TRUE(receive(&r));
   EXPECT_EQ(r.header.func, kPrune);
   EXPECT_EQ(r.header.msgLength, 44);
-}
-
-TEST_F(Engine, APayloadLongerThanTheElementHoldsIsCutAndEnded) {
-  klpThread* admin = addThread("AdminThread", KLP_THREAD_REST, {kReinitq});
-  auto m = e2e::RawClient::request(kReinitq, 0, nullptr);
-  m.resize(4096, 'Z');  // no NUL anywhere
-  int32_t len = 4096;
-  memcpy(m.data() + 12, &len, 4);
-  ASSERT_EQ(handle(m), 0);
-  MsgQe* qe = takeQe(admin);
-  ASSERT_NE(qe, nullptr);
-  EXPECT_EQ(strlen(qe->QeString), 1039u);
-  EXPECT_EQ(qe->QeString[1038], 'Z');
-  deleteMsgQe(qe);
-}
-
-TEST_F(Engine, MessagesThatDisagreeWithWhatWasReceivedCountAsFailedGets) {
-  klpThread* t = addThread("AdminThread", KLP_THREAD_REST, {kReinitq});
-  auto m = e2e::RawClient::request(kReinitq, 0, nullptr);
-  int32_t claim = 4096;  // more than the 44 bytes that came
-  memcpy(m.data() + 12, &claim, 4);
-  ASSERT_EQ(handle(m), 0);
-  EXPECT_EQ(st_.getFailed, 1);
-  std::vector<char> shortOne(m.begin(), m.begin() + 43);
-  ASSERT_EQ(handle(shortOne), 0);
-  EXPECT_EQ(cmdsHandleMessage(&st_, &threads_, nullptr, 0), 0);
-  EXPECT_EQ(t->cmdList->count, 0);
-  e2e::Reply r;
-  EXPECT_FALSE(receive(&r, 200));
-  // The next good message clears the state.
-  ASSERT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
-  EXPECT_EQ(st_.getFailed, 0);
-  EXPECT_TRUE(receive(&r));
-}
-
-TEST_F(Engine, ChgparmsWithMaybeLeavesTheFlagButEchoesTheRequest) {
-  std::string maybe = "MAYBE";
-  auto m = e2e::RawClient::request(kChgparms, kTerm, &maybe);
-  ASSERT_EQ(handle(m), 0);
-  e2e::Reply r;
-  ASSERT_TRUE(receive(&r));
-  ASSERT_EQ(r.raw.size(), m.size());
-  EXPECT_EQ(r.header.subFunc, kTerm);
-  EXPECT_STREQ(r.payload.data(), "MAYBE");
-  EXPECT_EQ(parms_->getParmBool(kTerm), 0);
-  EXPECT_EQ(parms_->getParmSource(kTerm), PARM_SRC_DEFAULT);
-
-  std::string value = "750";
-  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, kCommitInterval, &value)), 0);
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(parms_->getParmInt(kCommitInterval), 750);
-  EXPECT_EQ(parms_->getParmSource(kCommitInterval), PARM_SRC_CHGPARMS);
-  // Out of the parameter's range: refused by the registry, still echoed.
-  value = "50";
-  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, kCommitInterval, &value)), 0);
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(parms_->getParmInt(kCommitInterval), 750);
-  // An index outside the registry changes nothing.
-  ASSERT_EQ(handle(e2e::RawClient::request(kChgparms, 4000, &value)), 0);
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(r.header.subFunc, 4000);
 }
 
 TEST_F(Engine, StopIsAnsweredOnceAndTheStopSequenceSkipsStoppedThreads) {
@@ -257,6 +231,70 @@ TEST_F(Engine, StopIsAnsweredOnceAndTheStopSequenceSkipsStoppedThreads) {
   EXPECT_EQ(qe->QeFunc, kStop);
   EXPECT_EQ(qe->QeResponseId, 0);
   deleteMsgQe(qe);
+}
+
+TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
+  // Its reply queue is full. A taker makes room once the engine is done
+  // (after 5 s if the engine is still waiting for room): what reaches the
+  // queue then shows whether the engine waited.
+  const struct {
+    const char* what;
+    int waiting;
+    int threads;
+    bool firstPiece;  // the STATUS reply's first piece found room
+  } cases[] = {
+      {"full: nothing goes", 10, 3, false},
+      {"room for the first of two pieces only", 9, 250, true},
+  };
+  IpcMsg* other = nullptr;
+  ASSERT_EQ(createReplyMsg(&other, 44, 99, 1), 0);
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    klptest::ProcessLogger log(5, dir_->path(), "eng.log");
+    while (threads_.count < c.threads) addThread("T", KLP_THREAD_REST);
+    hsvRC prc;
+    for (int i = 0; i < c.waiting; ++i) ASSERT_EQ(putIpcMsgWait(&reply_, other, 0, &prc), 0);
+    std::atomic<bool> done{false};
+    std::thread taker([&] {
+      e2e::waitFor([&] { return done.load(); }, 5000);
+      char buf[HSV_MAX_MSG_SIZE];
+      size_t got = 0;
+      reply_.get(buf, sizeof buf, &got, 1000);
+    });
+    EXPECT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
+    done = true;
+    taker.join();
+    // Left: the others but the one taken, then the pieces that found room.
+    std::vector<std::pair<int32_t, int32_t>> left, want(c.waiting - 1, {99, 0});
+    for (e2e::Reply r; receive(&r, 0);) left.emplace_back(r.header.func, r.header.pieceNo);
+    if (c.firstPiece) want.emplace_back(kStatus, 1);
+    EXPECT_EQ(left, want);
+    std::string text = logText();
+    EXPECT_EQ(e2e::countOf(text, "KLP0508E"), 1u) << text;
+    EXPECT_NE(text.find("\"805\""), std::string::npos) << text;
+    remove((dir_->path() + "eng.log").c_str());
+  }
+  freeIpcMsg(other);
+}
+
+TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
+  klptest::ProcessLogger log(5, dir_->path(), "eng.log");
+  klpThread* stuck = addThread("Stuck", KLP_THREAD_REST, {kPrune});
+  klpThread* taking = addThread("Taking", KLP_THREAD_REST, {kPrune});
+  for (int i = 0; i < 102; ++i) {
+    ASSERT_EQ(handle(e2e::RawClient::request(kPrune, 0, nullptr, 0)), 0);
+    deleteMsgQe(takeQe(taking));  // this one takes its commands
+  }
+  EXPECT_EQ(stuck->cmdList->count, 100);
+  EXPECT_EQ(taking->cmdList->count, 0);
+  std::string text = logText();
+  EXPECT_EQ(e2e::countOf(text, "KLP8054E"), 2u) << text;
+  EXPECT_NE(text.find("The thread \"Stuck\" has \"100\" commands waiting; the command with "
+                      "function code \"22\" is not passed to it."),
+            std::string::npos)
+      << text;
+  EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
+  EXPECT_EQ(stuck->cmdList->count, 101);
 }
 
 TEST_F(Engine, WithoutAServerQueueTheEngineReports804) {

@@ -1,6 +1,7 @@
 // The sample server and its command engine, driven over the real queues by a
 // raw client and by the exported control interface.
 #include <signal.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -163,9 +164,13 @@ TEST(KcapServer, ChgparmsIsEchoedAndQryparmsShowsTheChangeWithItsSource) {
   ASSERT_TRUE(c.ask(kChgparms, &r, kTerm, &maybe));
   EXPECT_EQ(r.header.subFunc, kTerm);
   ASSERT_TRUE(c.ask(kChgparms, &r, kCapturePath, &path));
-  // An integer that is not a whole number changes nothing either.
-  std::string bad = "12abc", term = "yes";
+  // An integer that is not a whole number, or is out of its range, changes
+  // nothing either; nor does an index outside the set.
+  std::string bad = "12abc", low = "50", term = "yes";
   ASSERT_TRUE(c.ask(kChgparms, &r, 16, &bad));
+  ASSERT_TRUE(c.ask(kChgparms, &r, kCommitInterval, &low));
+  ASSERT_TRUE(c.ask(kChgparms, &r, 4000, &low));
+  EXPECT_EQ(r.header.subFunc, 4000);
   ASSERT_TRUE(c.ask(kChgparms, &r, kTerm, &term));
 
   ASSERT_TRUE(c.ask(kQryparms, &r));
@@ -178,6 +183,29 @@ TEST(KcapServer, ChgparmsIsEchoedAndQryparmsShowsTheChangeWithItsSource) {
   EXPECT_EQ(after["TERM"].source, 3);
   EXPECT_EQ(after["CAPTURE_PATH"].value, dir.path());
   EXPECT_NE(after["CAPTURE_PATH"].source, 3);
+  stopCleanly(s, c);
+}
+
+TEST(KcapServer, AQueryLongerThanOneMessageReachesTheCommandProgramInPieces) {
+  klptest::TmpDir dir;
+  const std::string v(1000, 'v');
+  // A working directory of its own with a long name, and two long values.
+  std::string path = dir.path() + std::string(200, 'p');
+  for (int i = 0; i < 4; ++i) {
+    ASSERT_EQ(mkdir(path.c_str(), 0700), 0);
+    path += "/" + std::string(200, 'p');
+  }
+  ASSERT_EQ(mkdir(path.c_str(), 0700), 0);
+  Server s(dir, "LNG", {"CAPTURE_PATH=" + path, "CAP_DBNAME=D" + v, "COMPATIBILITY=C" + v});
+  ASSERT_TRUE(s.ready());
+  klptest::ProcessResult pr =
+      klptest::run({klptest::binPath("klpkccmd"), "CAPTURE_SERVER=LNG", "QRYPARMS"}, {}, 60000);
+  EXPECT_EQ(pr.exitCode, 0) << pr.out;
+  for (const char* name : {"\"COMPATIBILITY\" has the value \"Cvvv",
+                           "\"CAP_DBNAME\" has the value \"Dvvv",
+                           "\"CAPTURE_SERVER\" has the value \"LNG\""})
+    EXPECT_NE(pr.out.find(name), std::string::npos) << name << "\n" << pr.out;
+  RawClient c(s.queue());
   stopCleanly(s, c);
 }
 
@@ -280,6 +308,23 @@ TEST(KcapServer, GarbageOnTheQueueNeitherCrashesNorHangsIt) {
   EXPECT_NE(log.find("KLP0509W"), std::string::npos);
   EXPECT_NE(log.find("KLP0511W"), std::string::npos);
   stopCleanly(s, c);
+}
+
+TEST(KcapServer, ANamePrefixThatDoesNotFitIsReportedWithTheBuildersCode) {
+  // 170 + ".KLP.KCAP" is more than the prefix's 160 characters.
+  klptest::TmpDir dir;
+  const std::string server = "CAPTURE_SERVER=" + std::string(170, 'N');
+  const std::vector<std::vector<std::string>> runs = {
+      {klptest::binPath("klpkcap"), server},
+      {klptest::binPath("klpkccmd"), server, "STATUS"},
+  };
+  for (const auto& argv : runs) {
+    klptest::ProcessResult pr = klptest::run(argv, {}, 30000);
+    EXPECT_EQ(pr.exitCode, 12) << argv[0];
+    EXPECT_NE(pr.out.find("a step failed with return code \"6005\": \"setEnvNamePrefix\""),
+              std::string::npos)
+        << argv[0] << "\n" << pr.out;
+  }
 }
 
 TEST(KcapServer, RestartAfterKillReplacesTheStaleQueue) {
