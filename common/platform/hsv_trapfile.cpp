@@ -143,6 +143,27 @@ hsvRC writeAll(int fd, const void* buf, size_t len) {
 
 }  // namespace
 
+void hsvTrapLine(int signalNumber, const char* threadName) {
+  int savedErrno = errno;
+  Text t;
+  t.str("KLP trap: signal ");
+  t.dec(signalNumber);
+  t.str(" (");
+  t.str(signalName(signalNumber));
+  t.str(") in process ");
+  t.dec(getpid());
+  t.str(", thread ");
+  t.dec(static_cast<int64_t>(hsvThreadID()));
+  if (threadName != nullptr && threadName[0] != '\0') {
+    t.str(" (");
+    t.str(threadName);
+    t.chr(')');
+  }
+  t.chr('\n');
+  writeAll(STDERR_FILENO, t.data(), t.size());
+  errno = savedErrno;
+}
+
 HSVTrapFile::HSVTrapFile() = default;
 
 HSVTrapFile::~HSVTrapFile() { close(); }
