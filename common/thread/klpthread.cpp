@@ -383,7 +383,7 @@ int klpThread::prologue(klpThread* t) {
     t->sharedCmdList = klpSharedCmdList();
     hsvOneTimeOnly();
     t->threadId = hsvThreadID();
-    ids->makeShared("KlpThreadIDList", 0);
+    if (!ids->locked) ids->makeShared("KlpThreadIDList", 0);  // never under a user
     ids->putTail(&t->tid);
     msgSetThreadNameProvider(threadNameForLogger);
     t->setState(KLP_THREAD_RUN);

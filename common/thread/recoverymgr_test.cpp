@@ -157,11 +157,6 @@ TEST_F(SigRecovery, ResourcesRunLastFirstOnceAndTheFourthReturnEndsTheThread) {
 }
 
 TEST_F(SigRecovery, ASignalOnAnUnregisteredThreadEndsItWith2009AndLeavesNoLockHeld) {
-#if defined(__SANITIZE_THREAD__)
-  // Ending the thread unwinds out of the signal handler, through the race
-  // detector's own signal frames, which cannot be unwound.
-  GTEST_SKIP() << "not under ThreadSanitizer";
-#endif
   // The thread is inside the thread-id list's lock, as it is while it looks
   // itself up: the handler's messages look it up again.
   EXPECT_EQ("end=2009 list free\n", child([] {
@@ -189,9 +184,6 @@ TEST_F(SigRecovery, ASignalOnAnUnregisteredThreadEndsItWith2009AndLeavesNoLockHe
 }
 
 TEST_F(SigRecovery, ARegisteredThreadWithoutRecoveryPointIsNamedAndEndsThroughThreadEnd) {
-#if defined(__SANITIZE_THREAD__)
-  GTEST_SKIP() << "not under ThreadSanitizer";  // see above
-#endif
   // The end code is stored (and the state is 6) as for any other end.
   EXPECT_EQ("action 7\nend=2009 code=2009 global=2\n",
             child([] { return runThread(pointlessBody, "NoPoint"); }));
