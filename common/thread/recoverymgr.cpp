@@ -117,7 +117,7 @@ void passOn(int sig, siginfo_t* info, void* context) {
   }
 }
 
-// The Part of the handler that has no recovery point to go back to: the
+// The end of the handler when there is no recovery point to go back to: the
 // thread is reported and ended.
 [[noreturn]] void endUnrecoverable(int sig, klpThread* t) {
   char buf[16];
