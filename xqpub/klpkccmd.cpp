@@ -146,6 +146,9 @@ int klpkccmdMain(int argc, char** argv) {
   trcInitAnchor();
   klpThread* mainThread = klpMainThread();
   r.rc = klpThread::prologue(mainThread);
+  // A hang-up, a closed pipe or any other signal that ends the program
+  // still destroys its reply queue first (at the recovery point).
+  erCatchEndingSignals();
   if (r.rc) {
     logInternalError("threadPrologue", r.rc, "klpThread::prologue");
   } else if (KLP_SET_RECOVERY_POINT(mainThread->rcvyMgr) != 0) {

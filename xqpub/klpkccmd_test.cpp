@@ -2,11 +2,14 @@
 // refused (message number on the console, exit code 12), the usage text,
 // and the recognition of STATUS SHOW DETAILS.
 #include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/resource.h>
 
 #include <cstdlib>
 #include <string>
 #include <vector>
 
+#include "common/platform/hsv.h"
 #include "tests/testing/klptest.h"
 
 namespace {
@@ -164,6 +167,32 @@ TEST_F(KlpkccmdTest, StatusShowDetailsIsShortenedForTheParser) {
   EXPECT_EQ(last_.out.find("\"show\""), std::string::npos) << last_.out;
   // One argument holding the three words is not recognised.
   expectRefused({"X", "STATUS SHOW DETAILS"}, "KLP0504E");
+}
+
+TEST_F(KlpkccmdTest, EndedByASignalWhileWaitingItLeavesNoReplyQueue) {
+  // A server queue that takes the request and never answers.
+  std::string server = dir_.path() + "SIG.KLP.KCAP.IPC";
+  HSVResID id;
+  ASSERT_EQ(ECF_OK, hsvIPCGetQueResID(server.c_str(), HSV_QUEUE_RESID_OPTION, &id));
+  HSVHIPCQueue queue;
+  ASSERT_EQ(ECF_OK, queue.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION));
+  struct rlimit none = {0, 0};  // SIGQUIT would leave a core file
+  setrlimit(RLIMIT_CORE, &none);
+  for (int sig : {SIGHUP, SIGQUIT, SIGPIPE, SIGUSR2}) {
+    SCOPED_TRACE(sig);
+    klptest::Background client({klptest::binPath("klpkccmd"), "CAPTURE_SERVER=SIG", "STATUS"});
+    std::string reply = server + ".CMD" + std::to_string(client.pid());
+    char msg[HSV_MAX_MSG_SIZE];
+    size_t got = 0;
+    // Its request has arrived: it waits for the reply.
+    EXPECT_EQ(ECF_OK, queue.get(msg, sizeof msg, &got, 30000));
+    EXPECT_TRUE(klptest::queueExists(reply));
+    client.kill(sig);
+    klptest::ProcessResult r = client.wait(30000);
+    EXPECT_EQ(sig, r.signal) << r.out;
+    EXPECT_FALSE(klptest::queueExists(reply)) << r.out;
+  }
+  queue.destroy();
 }
 
 }  // namespace

@@ -8,6 +8,7 @@
 #include "common/env/klpenv.h"
 #include "common/ipc/cmdapi.h"
 #include "common/ipc/ipcmsg.h"
+#include "common/thread/recoverymgr.h"
 
 namespace {
 
@@ -31,7 +32,24 @@ void copyCaptured(klpResultBlock* result, const klpMsgCapture& cap) {
   result->text[n] = '\0';
 }
 
+// A call ended by a signal: its clean-ups ran; the caller gets 2010 and the
+// signal report as text.
+int interrupted(klpResultBlock* result, erLibraryCall& call) {
+  char text[sizeof(result->text)];
+  int rc = call.recover(text, sizeof(text));
+  if (!result) return rc;
+  std::memcpy(result->text, text, sizeof(text));
+  return store(result, rc);
+}
+
 }  // namespace
+
+// Every exported call runs with our signal handling and gives the caller's
+// back before it returns; a signal during the call ends the call, never the
+// caller's process.
+#define KLP_GUARD_CALL(result)             \
+  erLibraryCall guard_;                    \
+  if (KLP_SET_CALL_POINT(guard_) != 0) return interrupted(result, guard_)
 
 extern "C" {
 
@@ -39,6 +57,7 @@ KLP_API int klpStartProgram(void) { return 0; }
 
 KLP_API int klpStopProgram(int32_t kind, const char* serverName, const char* schema,
                            int32_t option, klpResultBlock* result) {
+  KLP_GUARD_CALL(result);
   if (!result) return KLP_API_MISSING_ARG;
   if (kind < KLP_KIND_APP || kind > KLP_KIND_MON) return store(result, KLP_API_BAD_KIND);
   if (emptyName(serverName)) return store(result, KLP_API_NO_SERVER);
@@ -64,6 +83,7 @@ KLP_API int klpStopProgram(int32_t kind, const char* serverName, const char* sch
 
 KLP_API int klpGetStatusSize(const klpReleaseInfo* release, klpStatusRequest* request,
                              klpResultBlock* result) {
+  KLP_GUARD_CALL(result);
   if (!result) return KLP_API_MISSING_ARG;
   if (!release) return missing(result, "klpReleaseInfo");
   if (!request) return missing(result, "klpGetStatusDataSize");
@@ -105,6 +125,7 @@ KLP_API int klpGetStatusSize(const klpReleaseInfo* release, klpStatusRequest* re
 
 KLP_API int klpGetStatus(const klpReleaseInfo* release, klpStatusRequest* request,
                          klpResultBlock* result) {
+  KLP_GUARD_CALL(result);
   if (!result) return KLP_API_MISSING_ARG;
   if (!release) return missing(result, "klpReleaseInfo");
   if (!request) return missing(result, "klpGetStatusData");

@@ -138,8 +138,8 @@ class HSVHIPCMemory {
 };
 
 // ---------------------------------------------------------------------------
-// Wait/post object (process-local auto-reset event).
-// A post while nobody waits is remembered until the next wait consumes it.
+// Wait/post object (process-local event that counts its posts).
+// A post while nobody waits is remembered until a wait consumes it.
 // ---------------------------------------------------------------------------
 class HSVHIPCWaitpost {
  public:
@@ -235,6 +235,10 @@ constexpr int HSV_TRAPFILE_DUMP_OPTION = 507911;
 // may dump from a signal handler calls this early, outside any handler.
 // Costs a shared-library load, so short-lived programs skip it.
 void hsvTrapFilePrepare();
+// Writes one line naming the signal, the process and the thread to standard
+// error; async-signal-safe, for a handler that is about to let a fault end
+// the process.
+void hsvTrapLine(int signalNumber, const char* threadName);
 
 class HSVTrapFile {
  public:

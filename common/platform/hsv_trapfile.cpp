@@ -126,6 +126,17 @@ void utcText(Text& t, int64_t secs, int64_t usecs) {
   t.str(" UTC");
 }
 
+// "<number> (<name>)<between><pid><then><tid>": the signal and who took it.
+void whoTrapped(Text& t, int signalNumber, const char* between, const char* then) {
+  t.dec(signalNumber);
+  t.str(" (");
+  t.str(signalName(signalNumber));
+  t.str(between);
+  t.dec(getpid());
+  t.str(then);
+  t.dec(static_cast<int64_t>(hsvThreadID()));
+}
+
 hsvRC writeAll(int fd, const void* buf, size_t len) {
   const char* p = static_cast<const char*>(buf);
   while (len > 0) {
@@ -142,6 +153,21 @@ hsvRC writeAll(int fd, const void* buf, size_t len) {
 }
 
 }  // namespace
+
+void hsvTrapLine(int signalNumber, const char* threadName) {
+  int savedErrno = errno;
+  Text t;
+  t.str("KLP trap: signal ");
+  whoTrapped(t, signalNumber, ") in process ", ", thread ");
+  if (threadName != nullptr && threadName[0] != '\0') {
+    t.str(" (");
+    t.str(threadName);
+    t.chr(')');
+  }
+  t.chr('\n');
+  writeAll(STDERR_FILENO, t.data(), t.size());
+  errno = savedErrno;
+}
 
 HSVTrapFile::HSVTrapFile() = default;
 
@@ -188,13 +214,7 @@ hsvRC HSVTrapFile::dump(int /*option*/, int signalNumber, const void* siginfo,
   int savedErrno = errno;  // a handler must leave errno as it found it
   Text t;
   t.str("*** Trap dump ***\nSignal: ");
-  t.dec(signalNumber);
-  t.str(" (");
-  t.str(signalName(signalNumber));
-  t.str(")\nProcess id: ");
-  t.dec(getpid());
-  t.str("\nThread id: ");
-  t.dec(static_cast<int64_t>(hsvThreadID()));
+  whoTrapped(t, signalNumber, ")\nProcess id: ", "\nThread id: ");
   timespec now{};
   clock_gettime(CLOCK_REALTIME, &now);
   t.str("\nTime: ");

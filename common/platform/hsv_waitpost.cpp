@@ -1,6 +1,7 @@
-// Wait/post object: a process-local auto-reset event. A post is remembered
-// until one wait consumes it, so a post that comes before the wait is not
-// lost.
+// Wait/post object: a process-local event that counts its posts. A post is
+// remembered until one wait consumes it, so a post that comes before the
+// wait is not lost, and two posts wake two waiters even when both come
+// before either waiter runs.
 #include <pthread.h>
 
 #include <cerrno>
@@ -17,7 +18,7 @@ struct HSVHIPCWaitpost::Impl {
   pthread_cond_t cond;      // signalled by post
   pthread_cond_t drained;   // signalled when the last waiter leaves a closing object
   bool live = false;        // between create and destroy
-  bool posted = false;
+  int posts = 0;            // posts not yet consumed by a wait
   bool closing = false;
   int waiters = 0;
 };
@@ -73,11 +74,29 @@ hsvRC HSVHIPCWaitpost::create(int /*option*/) {
   hsvRC result = im->live ? ECF_ALREADY_EXISTS : ECF_OK;
   if (!im->live) {
     im->live = true;
-    im->posted = false;
+    im->posts = 0;
   }
   pthread_mutex_unlock(&im->mutex);
   return result;
 }
+
+namespace {
+
+// Leaves the object as the wait found it however the wait ends, also when
+// the waiting thread is cancelled inside the condition wait (the mutex is
+// held again by then and the unwinding runs this).
+struct WaiterGuard {
+  pthread_mutex_t* mutex;
+  pthread_cond_t* drained;
+  int* waiters;
+  const bool* closing;
+  ~WaiterGuard() {
+    if (--*waiters == 0 && *closing) pthread_cond_signal(drained);
+    pthread_mutex_unlock(mutex);
+  }
+};
+
+}  // namespace
 
 hsvRC HSVHIPCWaitpost::wait(int32_t timeMs) {
   Impl* im = __atomic_load_n(&impl_, __ATOMIC_ACQUIRE);
@@ -89,35 +108,24 @@ hsvRC HSVHIPCWaitpost::wait(int32_t timeMs) {
     return ECF_WAITPOST_NOT_INITIALIZED;
   }
   ++im->waiters;
-  hsvRC result = ECF_OK;
+  WaiterGuard guard{&im->mutex, &im->drained, &im->waiters, &im->closing};
   for (;;) {
-    if (im->closing) {
-      result = ECF_WAITPOST_NOT_INITIALIZED;
-      break;
+    if (im->closing) return ECF_WAITPOST_NOT_INITIALIZED;
+    if (im->posts > 0) {
+      --im->posts;
+      return ECF_OK;
     }
-    if (im->posted) {
-      im->posted = false;
-      break;
-    }
-    if (timeMs == 0) {
-      result = ECF_TIMEOUT;
-      break;
-    }
+    if (timeMs == 0) return ECF_TIMEOUT;
     int rc = timeMs < 0 ? pthread_cond_wait(&im->cond, &im->mutex)
                         : pthread_cond_timedwait(&im->cond, &im->mutex, &deadline);
     if (rc == ETIMEDOUT) {
       // A post may have come in together with the time-out: take it.
-      if (im->posted && !im->closing) {
-        im->posted = false;
-      } else {
-        result = im->closing ? ECF_WAITPOST_NOT_INITIALIZED : ECF_TIMEOUT;
-      }
-      break;
+      if (im->closing) return ECF_WAITPOST_NOT_INITIALIZED;
+      if (im->posts == 0) return ECF_TIMEOUT;
+      --im->posts;
+      return ECF_OK;
     }
   }
-  if (--im->waiters == 0 && im->closing) pthread_cond_signal(&im->drained);
-  pthread_mutex_unlock(&im->mutex);
-  return result;
 }
 
 hsvRC HSVHIPCWaitpost::post() {
@@ -126,7 +134,7 @@ hsvRC HSVHIPCWaitpost::post() {
   pthread_mutex_lock(&im->mutex);
   hsvRC result = ECF_WAITPOST_NOT_INITIALIZED;
   if (im->live) {
-    im->posted = true;
+    ++im->posts;
     pthread_cond_signal(&im->cond);
     result = ECF_OK;
   }
@@ -149,7 +157,7 @@ hsvRC HSVHIPCWaitpost::destroy() {
   pthread_cond_broadcast(&im->cond);
   while (im->waiters > 0) pthread_cond_wait(&im->drained, &im->mutex);
   im->closing = false;
-  im->posted = false;
+  im->posts = 0;
   pthread_mutex_unlock(&im->mutex);
   return ECF_OK;
 }

@@ -1,5 +1,7 @@
 #include "common/thread/klpthread.h"
 
+#include <sched.h>
+
 #include <atomic>
 #include <csignal>
 #include <cstdio>
@@ -19,7 +21,8 @@ namespace {
 constexpr int kTrcComp = 6;  // trace component of the thread wrapper
 
 thread_local klpThread* tlsThread = nullptr;
-std::atomic<int> g_firstPrologueDone{0};
+// The first prologue: 0 not yet, 1 running on some thread, 2 done.
+std::atomic<int> g_firstPrologue{0};
 
 template <typename T>
 T* neverDestroyed() {
@@ -329,15 +332,18 @@ int klpThread::start(klpThread* t, OrdList* list) {
   t->check("klpThread::start");
   if (t->hasHandle) return 0;
   trcEntry(kTrcComp, 1);  // "Start thread   "
-  // A program that runs threads may dump from a signal handler: load the
-  // stack walker now, outside any handler.
-  hsvTrapFilePrepare();
   pthread_attr_t attr;
   pthread_attr_init(&attr);
   pthread_attr_setstacksize(&attr, KLP_THREAD_STACK);
   t->setState(KLP_THREAD_START);
+  // The new thread inherits a mask without SIGINT and SIGTERM: sent to the
+  // process, they are the main thread's to handle.
+  sigset_t block, old;
+  erProcessSignals(&block);
+  pthread_sigmask(SIG_BLOCK, &block, &old);
   pthread_t h;
   int rc = pthread_create(&h, &attr, threadTrampoline, t);
+  pthread_sigmask(SIG_SETMASK, &old, nullptr);
   pthread_attr_destroy(&attr);
   if (rc != 0) {
     const char* word = createErrorName(rc);
@@ -363,7 +369,12 @@ int klpThread::prologue(klpThread* t) {
   t->check("klpThread::prologue");
   t->setState(KLP_THREAD_INIT);
   OrdList* ids = klpThreadIdList();
-  if (!g_firstPrologueDone) {
+  // One thread takes the first prologue; any other waits until it is done,
+  // since the thread-id list is made ready there.
+  int expected = 0;
+  bool first = g_firstPrologue.compare_exchange_strong(expected, 1);
+  while (!first && g_firstPrologue.load() != 2) sched_yield();
+  if (first) {
     t->setState(KLP_THREAD_EXIST);
     t->setName("Initial");
     t->hasHandle = 0;
@@ -372,7 +383,7 @@ int klpThread::prologue(klpThread* t) {
     t->sharedCmdList = klpSharedCmdList();
     hsvOneTimeOnly();
     t->threadId = hsvThreadID();
-    ids->makeShared("KlpThreadIDList", 0);
+    if (!ids->locked) ids->makeShared("KlpThreadIDList", 0);  // never under a user
     ids->putTail(&t->tid);
     msgSetThreadNameProvider(threadNameForLogger);
     t->setState(KLP_THREAD_RUN);
@@ -383,7 +394,7 @@ int klpThread::prologue(klpThread* t) {
   tlsThread = t;
   int rc = recoveryMgr::erSetRecovery(&t->rcvyMgr);
   if (rc != 0) logInternalError("klpThread::prologue", rc, "recoveryMgr::erSetRecovery");
-  g_firstPrologueDone = 1;
+  if (first) g_firstPrologue.store(2);
   return rc;
 }
 
@@ -428,8 +439,10 @@ int klpThread::stop(klpThread* t) {
         if (rc != 0) logInternalError("klpThread::stop", KLP_RC_THREAD, "TerminateThread");
       } else {
         // A waiting thread is woken by the signal rather than cut off; it goes
-        // back to its own recovery point.
-        pthread_kill(t->handle, SIGTERM);
+        // back to its own recovery point. Our own signal, not SIGTERM: the
+        // thread blocks that one, and should it have given up its recovery
+        // point meanwhile, ours is ignored where SIGTERM would end the process.
+        pthread_kill(t->handle, erStopSignal());
       }
     }
     trcExit(kTrcComp, 2, TRC_RET_NONE);  // "Stopped thread "
@@ -442,11 +455,13 @@ int klpThread::stop(klpThread* t) {
   joinIfEnded(t);
   ordListDeChain(&t->ole);
   ordListDeChain(&t->tid);
-  if (t->cmdList != nullptr) {
+  // Only a list of its own is emptied: the shared one holds the other
+  // threads' commands.
+  if (t->cmdList != nullptr && t->cmdList != t->sharedCmdList) {
     t->cmdList->delList();
-    if (t->cmdList != t->sharedCmdList) delete t->cmdList;
-    t->cmdList = nullptr;
+    delete t->cmdList;
   }
+  t->cmdList = nullptr;
   free(t->workBuffer);
   t->workBuffer = nullptr;
   if (t != klpMainThread()) delete t;
@@ -495,6 +510,7 @@ int supervise(OrdList* list, int stopping, int* highestEndCode) {
         klpThread::stop(t);
       } else {
         joinIfEnded(t);
+        t->rcvyMgr.reset();  // the new run starts with no returns and no resources
         klpThread::start(t, nullptr);
         alive = true;
       }

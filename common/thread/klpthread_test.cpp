@@ -16,6 +16,7 @@ std::atomic<int> g_runs{0};
 std::atomic<int> g_endWith{0};         // end code of the "end" body
 std::atomic<klpThread*> g_seenCurrent{nullptr};
 std::atomic<int> g_seenState{0};
+sigset_t g_seenMask;
 
 // Ends at once with g_endWith.
 void endBody(klpThread* t) {
@@ -29,6 +30,7 @@ void workBody(klpThread* t) {
   klpThread::prologue(t);
   g_seenState = t->getState();
   g_seenCurrent = currentThread();
+  pthread_sigmask(SIG_BLOCK, nullptr, &g_seenMask);
   logKlpMsg(8006, "workBody", KLP_DEST_SEVERITY, "fromWorker", nullptr, 0);
   t->setState(KLP_THREAD_RUN);
   while (!g_release) hsvSleep(2);
@@ -172,6 +174,11 @@ TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
   ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
   EXPECT_EQ(t, g_seenCurrent.load());
   EXPECT_EQ(KLP_THREAD_INIT, g_seenState.load());
+  // Sent to the process, SIGINT and SIGTERM are the main thread's; a stop
+  // must still reach the thread.
+  EXPECT_TRUE(sigismember(&g_seenMask, SIGINT));
+  EXPECT_TRUE(sigismember(&g_seenMask, SIGTERM));
+  EXPECT_FALSE(sigismember(&g_seenMask, erStopSignal()));
   EXPECT_EQ(KLP_THREAD_RUN, threadStateByName(&list, "Worker"));
   EXPECT_EQ(0, threadStateByName(&list, "Work"));
   EXPECT_STREQ("Worker", t->cmdList->qName);
@@ -190,7 +197,9 @@ TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
   EXPECT_NE(std::string::npos, log.rfind("Worker\"", at)) << log;
 }
 
-TEST_F(MtThread, ABodyThatReturnsEndsAs2011AndTheSharedCommandListCanBeUsed) {
+TEST_F(MtThread, ABodyThatReturnsEndsAs2011AndItsStopLeavesTheSharedCommandsAlone) {
+  OrdListElement* pending[2] = {new OrdListElement, new OrdListElement};
+  for (OrdListElement* e : pending) klpSharedCmdList()->putTail(e);  // other threads' commands
   int code = -1;
   klpThread* t = createThread(&code, &list, returningBody, "Returner", "MYDB", 1, nullptr, 1, 0);
   ASSERT_EQ(0, code);
@@ -198,8 +207,36 @@ TEST_F(MtThread, ABodyThatReturnsEndsAs2011AndTheSharedCommandListCanBeUsed) {
   EXPECT_EQ(0, strncmp(t->dbCtx.dbAlias, "MYDB    ", 8));
   ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
   EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));  // the shared list survives
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));
   EXPECT_EQ(1, klpSharedCmdList()->locked);
+  EXPECT_EQ(2, klpSharedCmdList()->count);
+  for (OrdListElement* e : pending) {
+    EXPECT_EQ(e, klpSharedCmdList()->getHead());
+    delete e;
+  }
+}
+
+// Two threads run their first prologue at once; exits 0 when exactly one
+// of them took the process's first prologue. The first to take it is held
+// at the thread-id list's lock meanwhile, so the other surely comes by.
+void firstPrologueRace() {
+  OrdList* ids = klpThreadIdList();
+  ids->makeShared("KlpThreadIDList", 0);
+  ids->lockList();
+  klpThread a, b;
+  std::thread ta(klpThread::prologue, &a), tb(klpThread::prologue, &b);
+  hsvSleep(200);  // not needed for the verdict: lets both threads come by
+  ids->unlockList();
+  ta.join();
+  tb.join();
+  int initial = (strcmp(a.name, "Initial") == 0) + (strcmp(b.name, "Initial") == 0);
+  _exit(initial == 1 && ids->count == 2 ? 0 : 1);
+}
+
+TEST(KlpThreadFirst, OnlyOneOfTwoThreadsAtOnceTakesTheFirstPrologue) {
+  // In a process of its own, where no prologue has run yet.
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(firstPrologueRace(), ::testing::ExitedWithCode(0), "");
 }
 
 TEST_F(MtThread, StopOfAnEndedThreadReturnsItsEndCodeAndRemovesIt) {

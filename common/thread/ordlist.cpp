@@ -72,12 +72,45 @@ void ordListCheckElement(const OrdListElement* e, const char* where) {
 // ---------------------------------------------------------------------------
 // The owned lock
 // ---------------------------------------------------------------------------
+namespace {
+
+// The locks the calling thread holds, in the order taken. A thread holds
+// few at a time (the engine two); one beyond the table is still a lock, it
+// only cannot be given up by klpReleaseHeldLocks.
+constexpr int kHeldMax = 8;
+struct HeldLocks {
+  klpOwnedLock* locks[kHeldMax];
+  int count;
+  int cancelState;  // before the first lock was taken
+};
+thread_local HeldLocks tlsHeld;
+
+void noteTaken(klpOwnedLock* l) {
+  HeldLocks& h = tlsHeld;
+  if (h.count == 0) pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &h.cancelState);
+  if (h.count < kHeldMax) h.locks[h.count] = l;
+  ++h.count;
+}
+
+void noteReleased(klpOwnedLock* l) {
+  HeldLocks& h = tlsHeld;
+  int n = h.count < kHeldMax ? h.count : kHeldMax;
+  for (int i = n - 1; i >= 0; --i) {
+    if (h.locks[i] != l) continue;
+    for (int j = i; j + 1 < n; ++j) h.locks[j] = h.locks[j + 1];
+    break;
+  }
+  if (h.count > 0 && --h.count == 0) pthread_setcancelstate(h.cancelState, nullptr);
+}
+
+}  // namespace
+
 klpOwnedLock::klpOwnedLock() { pthread_mutex_init(&mutex, nullptr); }
 klpOwnedLock::~klpOwnedLock() { pthread_mutex_destroy(&mutex); }
 
 int klpOwnedLock::lock() {
   lastError.store(0, std::memory_order_relaxed);
-  if (ownerCheck && holder.load(std::memory_order_relaxed) == selfId()) {
+  if (holder.load(std::memory_order_relaxed) == selfId()) {
     depth.fetch_add(1, std::memory_order_relaxed);
     return 0;
   }
@@ -86,22 +119,18 @@ int klpOwnedLock::lock() {
     lastError.store(rc, std::memory_order_relaxed);
     return rc;
   }
+  noteTaken(this);
   depth.fetch_add(1, std::memory_order_relaxed);
-  if (ownerCheck) {
-    owner.store(currentThread(), std::memory_order_relaxed);
-    holder.store(selfId(), std::memory_order_relaxed);
-  }
+  holder.store(selfId(), std::memory_order_relaxed);
+  // The thread-id list runs without owner checking: looking up the owner
+  // would take that very list.
+  if (ownerCheck) owner.store(currentThread(), std::memory_order_relaxed);
   return 0;
 }
 
 int klpOwnedLock::unlock(const char* what) {
   lastError.store(0, std::memory_order_relaxed);
-  if (!ownerCheck) {
-    depth.fetch_sub(1, std::memory_order_relaxed);
-    pthread_mutex_unlock(&mutex);
-    return 0;
-  }
-  if (holder.load(std::memory_order_relaxed) != selfId()) {
+  if (ownerCheck && holder.load(std::memory_order_relaxed) != selfId()) {
     char caller[48], holderText[48], err[16], dep[16];
     threadLabel(currentThread(), caller, sizeof caller);
     threadLabel(owner.load(std::memory_order_relaxed), holderText, sizeof holderText);
@@ -114,10 +143,29 @@ int klpOwnedLock::unlock(const char* what) {
   if (depth.fetch_sub(1, std::memory_order_relaxed) - 1 <= 0) {
     depth.store(0, std::memory_order_relaxed);
     owner.store(nullptr, std::memory_order_relaxed);
+    bool mine = holder.load(std::memory_order_relaxed) == selfId();
     holder.store(0, std::memory_order_relaxed);
     pthread_mutex_unlock(&mutex);
+    if (mine) noteReleased(this);
   }
   return 0;
+}
+
+void klpReleaseHeldLocks() {
+  HeldLocks& h = tlsHeld;
+  while (h.count > 0 && h.count <= kHeldMax) {
+    klpOwnedLock* l = h.locks[h.count - 1];
+    if (l->holder.load(std::memory_order_relaxed) != selfId()) {
+      noteReleased(l);
+      continue;
+    }
+    l->depth.store(1, std::memory_order_relaxed);
+    l->unlock("klpReleaseHeldLocks");
+  }
+  if (h.count > 0) {  // more than the table kept: forgotten, cancellable again
+    h.count = 0;
+    pthread_setcancelstate(h.cancelState, nullptr);
+  }
 }
 
 // ---------------------------------------------------------------------------

@@ -30,12 +30,18 @@ struct OrdListElement {
   }
 };
 
-// The lock shared by OrdList and Queue: a mutex that, with owner checking on,
-// lets its owning thread nest and refuses a release by anyone else.
+// The lock shared by OrdList and Queue: a mutex that its holding thread may
+// take again (depth counts the nesting), with or without owner checking.
+// With owner checking on, a release by any other thread is refused.
 // Ownership is decided by the OS thread, so that threads without a klpThread
 // are told apart too; `owner` keeps the klpThread for messages and prints.
 // The fields other threads may look at while one thread holds the lock (for
 // the refusal message) are atomics.
+//
+// While a thread holds any of these locks it cannot be cancelled (a stop
+// must leave every lock as it was), and each thread keeps the locks it holds
+// so that a return to its recovery point can give them up: the jump out of a
+// signal handler abandons whatever operation held them.
 struct klpOwnedLock {
   std::atomic<int32_t> depth{0};
   pthread_mutex_t mutex;
@@ -51,10 +57,15 @@ struct klpOwnedLock {
 
   // 0, or the system error number of a failed enter.
   int lock();
-  // 0, or 1005 (message 624) when the caller does not hold the lock.
-  // `what` names the structure in the message.
+  // 0, or 1005 (message 624) when the caller does not hold the lock and
+  // owner checking is on. `what` names the structure in the message.
   int unlock(const char* what);
 };
+
+// Gives up every klpOwnedLock the calling thread still holds, whatever its
+// nesting. For a thread that came back to its recovery point, or ends from
+// a signal handler, out of the middle of a locked operation.
+void klpReleaseHeldLocks();
 
 class OrdList {
  public:

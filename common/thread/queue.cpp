@@ -121,6 +121,23 @@ void Queue::notify() {
   }
 }
 
+namespace {
+
+// Counts a waiter off again however its wait ends, also when the waiting
+// thread is cancelled: a stop must leave the queue's counts as they were.
+struct WaiterCount {
+  Queue* q;
+  bool counted = true;
+  ~WaiterCount() {
+    if (!counted) return;
+    q->lk.lock();
+    --q->waiters;
+    q->lk.unlock("Queue");
+  }
+};
+
+}  // namespace
+
 void Queue::waitStep(int32_t* waitMs) {
   if (*waitMs <= 0) {
     *waitMs = 0;
@@ -135,28 +152,42 @@ void Queue::waitStep(int32_t* waitMs) {
   }
   ++waiters;
   lk.unlock("Queue");
+  WaiterCount waiter{this};
   HSVTimeUTC before = hsvTimeGetUTC();
-  hsvRC rc = waitpost.wait(*waitMs);
-  int kind = 0;  // 1 wakeup, 2 timeout, 0 error
-  if (rc == 0) {
-    kind = 1;
-  } else if (rc == ECF_TIMEOUT) {
-    kind = 2;
-  } else {
-    printf("Error from HSVHIPCWaitpost::wait %d: %s\n", static_cast<int>(rc), waitErrorName(rc));
-    fflush(stdout);
+  int32_t elapsed = 0;
+  for (;;) {
+    hsvRC rc = waitpost.wait(*waitMs > elapsed ? *waitMs - elapsed : 0);
+    int kind = 0;  // 1 wakeup, 2 timeout, 0 error
+    if (rc == 0) {
+      kind = 1;
+    } else if (rc == ECF_TIMEOUT) {
+      kind = 2;
+    } else {
+      printf("Error from HSVHIPCWaitpost::wait %d: %s\n", static_cast<int>(rc),
+             waitErrorName(rc));
+      fflush(stdout);
+    }
+    lk.lock();
+    elapsed = elapsedMs(before, hsvTimeGetUTC());
+    // A post whose element another consumer took first, or one left over
+    // from a waiter that timed out as it came, is no reason to give up
+    // while time is left: the queue itself decides.
+    if (kind == 1 && count == 0 && elapsed < *waitMs) {
+      lk.unlock("Queue");
+      continue;
+    }
+    --waiters;
+    waiter.counted = false;
+    if (kind == 1) {
+      ++wakeups;
+      wakeupTime += elapsed;
+    } else if (kind == 2) {
+      ++timeouts;
+      timeoutTime += elapsed;
+    }
+    lk.unlock("Queue");
+    break;
   }
-  lk.lock();
-  --waiters;
-  int32_t elapsed = elapsedMs(before, hsvTimeGetUTC());
-  if (kind == 1) {
-    ++wakeups;
-    wakeupTime += elapsed;
-  } else if (kind == 2) {
-    ++timeouts;
-    timeoutTime += elapsed;
-  }
-  lk.unlock("Queue");
   *waitMs = elapsed;
 }
 

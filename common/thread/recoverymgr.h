@@ -3,6 +3,9 @@
 // signal, runs its recovery resources (once, last registered first) and ends
 // or carries on. Also the global signal record and dump files.
 //
+// Faults (SIGSEGV, SIGBUS, SIGILL) are not recovered: the handler writes one
+// trap line and lets the fault end the process with its core as usual.
+//
 // Setting the recovery point must happen in the frame that is jumped back to,
 // so it is a macro around sigsetjmp:
 //
@@ -47,7 +50,8 @@ class recoveryMgr {
   recoveryMgr(const recoveryMgr&) = delete;
   recoveryMgr& operator=(const recoveryMgr&) = delete;
 
-  // Installs the process's signal handler once. 0.
+  // Installs the process's signal handler once. 0. Inside a control
+  // interface call (erLibraryCall) it installs nothing: the call does.
   static int erSetRecovery(recoveryMgr* mgr);
   // Installs the handler again, whatever was installed before.
   static void erReinstall();
@@ -55,13 +59,20 @@ class recoveryMgr {
   static void erUndoRecovery(recoveryMgr* mgr);
   // Steps of a return to the recovery point: ends the thread with 2010 when
   // it came back more than three times, else counts the return, reports the
-  // signal and answers 2009 (first return) or 2010.
+  // signal and answers 2009 (first return) or 2010. Locks the thread still
+  // held when the signal came are given up first. After an ending signal
+  // (erCatchEndingSignals) the clean-ups run and the signal's default action
+  // then ends the process.
   static int erRecover(recoveryMgr* mgr, klpThread* thread);
   // Reports the recorded signal (569/591) and, on the first return, runs the
   // resources last-first.
   static void erWhatSignal(recoveryMgr* mgr);
-  // Runs and frees every resource, last registered first.
-  void runResources();
+  // Runs and frees every resource, last registered first, down to (not
+  // including) `mark`; null runs them all.
+  void runResources(OrdListElement* mark = nullptr);
+  // A fresh state for a thread that starts again: resources the earlier run
+  // left are run, the counts and the recovery point are cleared.
+  void reset();
   // Marks the recovery point as set; answers rc (see KLP_SET_RECOVERY_POINT).
   static int erArmed(recoveryMgr* mgr, int rc);
   // Fatal unless the eye-catcher is intact.
@@ -84,6 +95,53 @@ void endRcvyRes(recoveryRes* res);
 // frame at or above the recovery point), never in a frame the jump discards.
 void erHSVIPCQdetach(uint64_t queueRef);
 void erHSVIPCQdestroy(uint64_t queueRef);
+
+// The signal a stop sends to a waiting thread: a real-time signal of our own,
+// which created threads leave unblocked (they block SIGINT and SIGTERM, so
+// that those reach the main thread only). The thread reports it as SIGTERM;
+// one that has no recovery point any more ignores it.
+int erStopSignal();
+// The signals a created thread blocks: SIGINT and SIGTERM.
+void erProcessSignals(sigset_t* set);
+
+// For a program whose recovery resources must not outlive it (the command
+// program's reply queue): every catchable signal whose default ends the
+// process jumps to the recovery point, where the clean-ups run before the
+// signal's default action ends the process. 0.
+int erCatchEndingSignals();
+
+// One call of the control interface. While it lives the process runs our
+// handler for SIGINT, SIGFPE, SIGABRT and SIGTERM (the caller's are saved by
+// the first call and restored when the last one returns); a signal on the
+// calling thread comes back to the call's own point, and one that reaches
+// another thread of the caller while a call waits is passed on to a waiting
+// call (SIGINT, SIGTERM) or to the caller's own handler. A calling thread the
+// library has not met is known as a thread of its own for the call.
+//
+//   erLibraryCall call;
+//   if (KLP_SET_CALL_POINT(call) != 0) return call.recover(text, len);  // 2010
+class erLibraryCall {
+ public:
+  sigjmp_buf point;
+  volatile sig_atomic_t armed;
+  volatile sig_atomic_t signal;  // as reported; 0 when none
+
+  erLibraryCall();
+  ~erLibraryCall();
+  erLibraryCall(const erLibraryCall&) = delete;
+  erLibraryCall& operator=(const erLibraryCall&) = delete;
+
+  // After a signal brought the call back: gives up the locks the call held,
+  // runs the clean-ups it registered (last first), puts the text of message
+  // 591 into text and answers 2010.
+  int recover(char* text, size_t textLen);
+  static int armedAt(erLibraryCall* call, int rc);
+
+ private:
+  erLibraryCall* outer_;
+  klpThread* own_;         // the thread object made for this call, if any
+  OrdListElement* mark_;   // last resource registered before the call
+};
 
 // Name of a signal: "SIGINT", "SIGILL", "SIGFPE", "SIGSEGV", "SIGTERM", else
 // the number as "%d" (buf of at least 12 characters).
@@ -108,3 +166,4 @@ extern const char erEndOfDumpMarker[17];  // "***E**O**D**M***" and its NUL
 // signal mask is saved so that a jump out of the handler unblocks the signal.
 #define KLP_SET_RECOVERY_POINT(mgr) \
   (::recoveryMgr::erArmed(&(mgr), sigsetjmp((mgr).recoveryPoint, 1)))
+#define KLP_SET_CALL_POINT(call) (::erLibraryCall::armedAt(&(call), sigsetjmp((call).point, 1)))

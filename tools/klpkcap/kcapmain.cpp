@@ -46,16 +46,6 @@ void installStopSignals() {
   sigaction(SIGTERM, &sa, nullptr);
 }
 
-// Workers inherit a mask without SIGINT and SIGTERM, so that these always
-// reach the main thread's handler rather than interrupting a worker.
-void blockStopSignals(bool block) {
-  sigset_t set;
-  sigemptyset(&set);
-  sigaddset(&set, SIGINT);
-  sigaddset(&set, SIGTERM);
-  pthread_sigmask(block ? SIG_BLOCK : SIG_UNBLOCK, &set, nullptr);
-}
-
 [[noreturn]] void finish(int rc) {
   delEnvIpcQRcvHdl(klpGetEnv());
   trcDetach();
@@ -121,9 +111,9 @@ int main(int argc, char** argv) {
 
   OrdList threads;
   threads.makeShared("KCAPThreads", 1);
-  blockStopSignals(true);
+  // Workers block SIGINT and SIGTERM (every created thread does): these
+  // reach the main thread's handler only.
   rc = kcapStartWorkers(&threads);
-  blockStopSignals(false);
   if (rc != 0) {
     logInternalError(kProgram, rc, "createThread");
     stopAll(&threads);
