@@ -78,6 +78,7 @@ void trcInitAnchor() {
   g_anchor->state = TRC_STATE_INITIAL;
   g_anchor->pid = hsvProcessID();
   g_stopSeenAt = 0;
+  trcint::prepareWriters();
 }
 
 trcAnchor* trcGetAnchor() { return g_anchor; }

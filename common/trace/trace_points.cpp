@@ -2,8 +2,6 @@
 // state inline (trace.h); only while Running does it come here, compute the
 // effective level from the block's filters and, when its bit is set, build
 // the record directly in the shared data area under the buffer lock.
-#include <pthread.h>
-
 #include <algorithm>
 #include <atomic>
 #include <cstdlib>
@@ -17,32 +15,6 @@
 trcAnchor g_trcAnchorStorage;
 
 namespace {
-
-std::atomic<int32_t> g_writers{0};
-std::atomic<size_t> g_mappedSize{0};
-
-// The kernel thread id costs a system call; each thread asks once. A forked
-// child is a new process whose main thread has another id, so a fork makes
-// every cached id stale.
-std::atomic<uint32_t> g_forkGeneration{1};
-__attribute__((tls_model("initial-exec"))) thread_local uint32_t t_threadId = 0;
-__attribute__((tls_model("initial-exec"))) thread_local uint32_t t_generation = 0;
-
-void afterForkInChild() {
-  g_forkGeneration.fetch_add(1, std::memory_order_relaxed);
-  g_trcAnchorStorage.pid = hsvProcessID();
-}
-
-[[maybe_unused]] const int g_atforkRegistered = pthread_atfork(nullptr, nullptr, afterForkInChild);
-
-inline uint32_t currentThreadId() {
-  uint32_t gen = g_forkGeneration.load(std::memory_order_relaxed);
-  if (t_generation != gen) {
-    t_threadId = static_cast<uint32_t>(hsvThreadID());
-    t_generation = gen;
-  }
-  return t_threadId;
-}
 
 inline void fillTime(trcTimeValue* t) {
   HSVTimeUTC now = hsvTimeGetUTC();
@@ -140,7 +112,7 @@ void buildRecord(trcBlockHeader* b, int component, int function, uint16_t levelM
   h.component = static_cast<uint16_t>(component);
   h.function = static_cast<uint16_t>(function);
   h.pid = g_trcAnchorStorage.pid;
-  h.threadId = currentThreadId();
+  h.threadId = trcint::threadId();
   memcpy(&h.time, timeOrName, sizeof h.time);
   h.type = type;
   memcpy(rec, &h, offsetof(trcRecordHeader, unused));  // bytes 37..39 are left as they were
@@ -193,38 +165,6 @@ void writeRecord(trcBlockHeader* b, int component, int function, uint16_t levelM
 }
 
 }  // namespace
-
-namespace trcint {
-
-trcBlockHeader* enterBlock() {
-  g_writers.fetch_add(1, std::memory_order_seq_cst);
-  trcBlockHeader* b = __atomic_load_n(&g_trcAnchorStorage.block, __ATOMIC_SEQ_CST);
-  if (b == nullptr || !trcIsRunning()) {
-    g_writers.fetch_sub(1, std::memory_order_release);
-    return nullptr;
-  }
-  return b;
-}
-
-void leaveBlock() { g_writers.fetch_sub(1, std::memory_order_release); }
-
-void publishBlock(trcBlockHeader* block, size_t size) {
-  if (block != nullptr) {
-    g_mappedSize.store(size, std::memory_order_relaxed);
-    __atomic_store_n(&g_trcAnchorStorage.block, block, __ATOMIC_SEQ_CST);
-    return;
-  }
-  __atomic_store_n(&g_trcAnchorStorage.block, static_cast<trcBlockHeader*>(nullptr),
-                   __ATOMIC_SEQ_CST);
-  while (g_writers.load(std::memory_order_seq_cst) != 0) hsvSleep(1);
-  g_mappedSize.store(0, std::memory_order_relaxed);
-}
-
-size_t mappedSize() { return g_mappedSize.load(std::memory_order_relaxed); }
-
-uint32_t threadId() { return currentThreadId(); }
-
-}  // namespace trcint
 
 void trcWriteRecord(int component, int function, uint16_t levelMask, const void* timeOrName,
                     uint8_t recordType, uint32_t recordLength, int objectCount, const int* types,

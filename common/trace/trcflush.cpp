@@ -205,6 +205,11 @@ int trcFlushToFile(const trcBlockHeader* image, bool report) {
   char path[TRC_KEY_SIZE];
   snprintf(path, sizeof path, "%.*s", static_cast<int>(sizeof image->fileName - 1),
            image->fileName);
+  // The image holds bufferSize bytes; its counters must lie within them.
+  if (const char* why = trcHeaderFault(image, image->bufferSize)) {
+    if (report) fprintf(out, "Trace buffer is damaged (%s), no data written to \"%s\".\n", why, path);
+    return 1;
+  }
   Flush f{image, path, report, out, nullptr, nullptr};
   f.header = static_cast<trcBlockHeader*>(malloc(TRC_HEADER_SIZE));
   if (f.header == nullptr) {
