@@ -16,7 +16,14 @@
 
 namespace {
 
-constexpr int kTrcComp = 6;  // trace component of the thread wrapper
+// The start and stop points name the thread: component 11, functions
+// "KlpThread::start" and "KlpThread::stop", basic data.
+constexpr int kTrcCommon = 11, kTrcStart = 8, kTrcStop = 9, kTrcBasic = 2;
+
+void traceThread(int function, const char* what, const klpThread* t) {
+  trcData(kTrcCommon, function, what, kTrcBasic, TRC_OBJ_NAME,
+          static_cast<uint32_t>(strnlen(t->name, sizeof t->name)), t->name);
+}
 
 thread_local klpThread* tlsThread = nullptr;
 std::atomic<int> g_firstPrologueDone{0};
@@ -328,7 +335,7 @@ klpThread* createThread(int* code, OrdList* list, klpThreadRoutine routine, cons
 int klpThread::start(klpThread* t, OrdList* list) {
   t->check("klpThread::start");
   if (t->hasHandle) return 0;
-  trcEntry(kTrcComp, 1);  // "Start thread   "
+  traceThread(kTrcStart, "Start thread   ", t);
   // A program that runs threads may dump from a signal handler: load the
   // stack walker now, outside any handler.
   hsvTrapFilePrepare();
@@ -354,7 +361,7 @@ int klpThread::start(klpThread* t, OrdList* list) {
   }
   t->handle = h;
   t->hasHandle = 1;
-  trcExit(kTrcComp, 1, TRC_RET_RC, 0, 0);  // "Thread started "
+  traceThread(kTrcStart, "Thread started ", t);
   if (list != nullptr) list->putTail(&t->ole);
   return 0;
 }
@@ -410,7 +417,7 @@ void threadEnd(klpThread* t, int code) {
 
 int klpThread::stop(klpThread* t) {
   t->check("klpThread::stop");
-  trcEntry(kTrcComp, 2);  // "Stop thread    "
+  traceThread(kTrcStop, "Stop thread    ", t);
   klpThread* caller = currentThread();
   char code[16];
   snprintf(code, sizeof code, "%d", t->getEndCode());
@@ -432,7 +439,7 @@ int klpThread::stop(klpThread* t) {
         pthread_kill(t->handle, SIGTERM);
       }
     }
-    trcExit(kTrcComp, 2, TRC_RET_NONE);  // "Stopped thread "
+    traceThread(kTrcStop, "Stopped thread ", t);
   }
   if (t->getState() != KLP_THREAD_STOP) {
     setWithdrawn(&t->ole);

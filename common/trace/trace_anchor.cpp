@@ -107,6 +107,11 @@ hsvRC trcOpenBlock(const char* keyPart1, const char* keyPart2, HSVHIPCMemory** m
   return ECF_OK;
 }
 
+void trcHoldBlock(HSVHIPCMemory* memory, trcBlockHeader* block) {
+  anchor().memory = memory;
+  trcint::publishBlock(block, memory->getSize());
+}
+
 void trcDropBlock(bool destroy) {
   trcAnchor& a = anchor();
   trcint::publishBlock(nullptr, 0);
@@ -130,8 +135,7 @@ int trcAttach(const char* keyPart1, const char* keyPart2, const klpAppVersion* a
   if (rc == ECF_NOT_FOUND) return 0;
   if (rc != ECF_OK) return TRC_RC_NO_ADDRESS;
   setState(TRC_STATE_STARTING);
-  a.memory = memory;
-  trcint::publishBlock(b, memory->getSize());
+  trcHoldBlock(memory, b);
   if (b->status != TRC_STATE_RUNNING) {
     setState(TRC_STATE_STOPPED);
     leaveBlock();
@@ -218,8 +222,7 @@ int trcCreate(uint32_t bufferSize, const char* keyPart1, const char* keyPart2,
   b->bufferLock = 0;
   b->fileLock = 0;
   trcLockBuffer(b);
-  a.memory = memory;
-  trcint::publishBlock(b, memory->getSize());
+  trcHoldBlock(memory, b);
   copyKey(a.keyPart1, keyPart1);
   copyKey(a.keyPart2, keyPart2);
 

@@ -50,6 +50,11 @@ void trcDropBlock(bool destroy);
 hsvRC trcOpenBlock(const char* keyPart1, const char* keyPart2, HSVHIPCMemory** memory,
                    trcBlockHeader** block);
 
+// Records a block opened with trcOpenBlock as this process's own: handle and
+// address go into the anchor, so the trace points of this process write
+// into it once the anchor is Running, and trcDropBlock lets go of it.
+void trcHoldBlock(HSVHIPCMemory* memory, trcBlockHeader* block);
+
 // Control side: creates and initialises a block of bufferSize bytes and
 // attaches this process to it (Running). fileName: trace directly to that
 // file (null or empty: not). standalone: called from the trace command in a

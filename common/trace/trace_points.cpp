@@ -71,12 +71,10 @@ trcBlockHeader* makeRoom(trcBlockHeader* b, uint32_t len) {
     b->highWaterOffset = b->writeOffset;
     if (b->fileName[0] != '\0') {
       trcLockFile(b);
-      copy = static_cast<trcBlockHeader*>(malloc(b->bufferSize));
+      copy = trcCopyBlock(b);
       if (copy == nullptr) {
         trcFlushToFile(b, false);
         trcUnlockFile(b);
-      } else {
-        memcpy(copy, b, b->bufferSize);
       }
     }
     b->writeOffset = 0;
@@ -165,6 +163,14 @@ void writeRecord(trcBlockHeader* b, int component, int function, uint16_t levelM
 }
 
 }  // namespace
+
+trcBlockHeader* trcCopyBlock(const trcBlockHeader* block) {
+  uint32_t size = block->bufferSize;
+  if (size < TRC_HEADER_SIZE || size > trcint::mappedSize()) return nullptr;
+  auto* copy = static_cast<trcBlockHeader*>(malloc(size));
+  if (copy != nullptr) memcpy(copy, block, size);
+  return copy;
+}
 
 void trcWriteRecord(int component, int function, uint16_t levelMask, const void* timeOrName,
                     uint8_t recordType, uint32_t recordLength, int objectCount, const int* types,

@@ -40,50 +40,12 @@ constexpr uint32_t TRC_FREE_KEY = 0xFFFFFFFF;     // a free thread data entry
 constexpr uint16_t TRC_FILTER_OVERRIDE = 0x8000;  // filter word overrides
 constexpr uint16_t TRC_FILTER_LEVELS = 0x000F;    // levels an override carries
 
-// Level bits of a record's level mask and of the filters.
-enum : uint16_t {
-  TRC_LVL_FLOW = 1,     // level 1: entry and exit
-  TRC_LVL_BASIC = 2,    // level 2
-  TRC_LVL_DETAIL = 4,   // level 3
-  TRC_LVL_PERF = 8,     // level 4
-  TRC_LVL_SQL = 16,     // level 5
-  TRC_LVL_XQ = 32,      // level 6
-};
-
 // Record types.
 enum : uint8_t {
   TRC_REC_ENTRY = 1,
   TRC_REC_EXIT = 2,
   TRC_REC_DATA = 3,
   TRC_REC_EXIT_VALUE = 4,  // exit with a return value object
-};
-
-// Object types; codes from TRC_OBJ_TYPE_COUNT on are unknown.
-enum : uint16_t {
-  TRC_OBJ_RAW = 0,
-  TRC_OBJ_SIGNED = 1,
-  TRC_OBJ_TRCSTRING = 2,
-  TRC_OBJ_STRING = 3,
-  TRC_OBJ_SQLCA = 4,
-  TRC_OBJ_SQLDA = 5,
-  TRC_OBJ_SQLSTMT = 6,
-  TRC_OBJ_NAME = 7,
-  TRC_OBJ_ORDLIST = 8,
-  TRC_OBJ_ORDLIST_ELEMENT = 9,
-  TRC_OBJ_ORDLIST_ELEMENT_ADDR = 10,
-  TRC_OBJ_XQ_ELEMENT = 11,
-  TRC_OBJ_THREAD = 12,
-  TRC_OBJ_RC = 13,
-  TRC_OBJ_TRANS = 14,
-  TRC_OBJ_NULL = 15,
-  TRC_OBJ_UNSIGNED = 16,
-  TRC_OBJ_BOOL = 17,
-  TRC_OBJ_POINTER = 18,
-  TRC_OBJ_TIMESTAMP = 19,
-  TRC_OBJ_GTRAN = 20,
-  TRC_OBJ_SQLSTMT_TYPE = 21,
-  TRC_OBJ_ADMIN_MSG_TYPE = 22,
-  TRC_OBJ_TYPE_COUNT = 23,
 };
 
 // ---------------------------------------------------------------------------

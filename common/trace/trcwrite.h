@@ -20,3 +20,8 @@ void trcWriteRecord(int component, int function, uint16_t levelMask, const void*
 // file. report: print every failure (the first two always print).
 // 0 written (or nothing to write); nonzero when it stopped on a failure.
 int trcFlushToFile(const trcBlockHeader* image, bool report);
+
+// A private copy of this process's attached block: bufferSize bytes, when
+// that is within what is mapped. The caller holds the buffer lock. Null
+// without memory or for a block whose size is impossible. free() it.
+trcBlockHeader* trcCopyBlock(const trcBlockHeader* block);
