@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <atomic>
 #include <cstdio>
 #include <cstring>
 #include <functional>
@@ -231,6 +232,10 @@ TEST(TraceWriter, WhatARecordHolds) {
        {{TRC_OBJ_POINTER, std::string("\2\1\0\0\0\0\0\0", 8)}}, nullptr},
       {"exit of another kind has no object", none,
        [] { trcExit(5, 7, 9, 12); return 1u; }, 1, 1, TRC_REC_EXIT, {}, nullptr},
+      {"a damaged area is started afresh, not stepped through forever",
+       [](trcBlockHeader* b) { b->highWaterOffset = kArea, b->entryCount = 5; },
+       [] { return trcData(5, 7, "x", 2, str, 1, "x"); }, 0x3F, 1, TRC_REC_DATA,
+       {{str, "x"}}, "x              "},
       {"a stopped block takes nothing", [](trcBlockHeader* b) { b->status = TRC_STATE_STOP; },
        [] { return trcEntry(5, 7); }, 0x3F, 0, 0, {}, ""},
       {"a record as large as the data area fits an empty buffer", none,
@@ -329,6 +334,23 @@ TEST(TraceWriter, RecordsFromTwoThreads) {
   }
   EXPECT_EQ(300, next[0]);
   EXPECT_EQ(1300, next[1]);
+}
+
+// Letting go of the block while another thread writes: the block is unmapped
+// only once the writer is out of it.
+TEST(TraceWriter, DetachWhileAnotherThreadWrites) {
+  Trace t;
+  std::atomic<bool> done{false};
+  std::thread writer([&] {
+    for (int v = 0; !done; ++v) put(v);
+  });
+  for (int i = 0; i < 200; ++i) {
+    trcDetach();
+    ASSERT_EQ(0, trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr));
+  }
+  done = true;
+  writer.join();
+  EXPECT_EQ(TRC_WALK_OK, t.read().error);
 }
 
 TEST(TraceFile, FlushFaults) {
