@@ -107,6 +107,8 @@ size_t mappedSize() { return g_mappedSize.load(std::memory_order_relaxed); }
 uint32_t threadId() {
   uint32_t gen = g_forkGeneration.load(std::memory_order_relaxed);
   if (t_generation != gen) {
+    pthread_once(&g_keyOnce, makeKey);  // so that a later fork marks this id stale
+    gen = g_forkGeneration.load(std::memory_order_relaxed);
     t_threadId = static_cast<uint32_t>(hsvThreadID());
     t_generation = gen;
   }
