@@ -18,7 +18,14 @@
 
 namespace {
 
-constexpr int kTrcComp = 6;  // trace component of the thread wrapper
+// The start and stop points name the thread: component 11, functions
+// "KlpThread::start" and "KlpThread::stop", basic data.
+constexpr int kTrcCommon = 11, kTrcStart = 8, kTrcStop = 9, kTrcBasic = 2;
+
+void traceThread(int function, const char* what, const klpThread* t) {
+  trcData(kTrcCommon, function, what, kTrcBasic, TRC_OBJ_NAME,
+          static_cast<uint32_t>(strnlen(t->name, sizeof t->name)), t->name);
+}
 
 thread_local klpThread* tlsThread = nullptr;
 // The first prologue: 0 not yet, 1 running on some thread, 2 done.
@@ -331,7 +338,7 @@ klpThread* createThread(int* code, OrdList* list, klpThreadRoutine routine, cons
 int klpThread::start(klpThread* t, OrdList* list) {
   t->check("klpThread::start");
   if (t->hasHandle) return 0;
-  trcEntry(kTrcComp, 1);  // "Start thread   "
+  traceThread(kTrcStart, "Start thread   ", t);
   pthread_attr_t attr;
   pthread_attr_init(&attr);
   pthread_attr_setstacksize(&attr, KLP_THREAD_STACK);
@@ -360,7 +367,7 @@ int klpThread::start(klpThread* t, OrdList* list) {
   }
   t->handle = h;
   t->hasHandle = 1;
-  trcExit(kTrcComp, 1, TRC_RET_RC, 0, 0);  // "Thread started "
+  traceThread(kTrcStart, "Thread started ", t);
   if (list != nullptr) list->putTail(&t->ole);
   return 0;
 }
@@ -421,7 +428,7 @@ void threadEnd(klpThread* t, int code) {
 
 int klpThread::stop(klpThread* t) {
   t->check("klpThread::stop");
-  trcEntry(kTrcComp, 2);  // "Stop thread    "
+  traceThread(kTrcStop, "Stop thread    ", t);
   klpThread* caller = currentThread();
   char code[16];
   snprintf(code, sizeof code, "%d", t->getEndCode());
@@ -445,7 +452,7 @@ int klpThread::stop(klpThread* t) {
         pthread_kill(t->handle, erStopSignal());
       }
     }
-    trcExit(kTrcComp, 2, TRC_RET_NONE);  // "Stopped thread "
+    traceThread(kTrcStop, "Stopped thread ", t);
   }
   if (t->getState() != KLP_THREAD_STOP) {
     setWithdrawn(&t->ole);
