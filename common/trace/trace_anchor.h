@@ -92,6 +92,8 @@ bool trcThreadTablesInUse();
 void trcLoadThreadTables(const trcBlockHeader* header);
 // Copies this process's tables into a block, under the thread-table lock.
 void trcCopyThreadTables(trcBlockHeader* block);
+// Sets every entry of a block's tables and of this process's own free.
+void trcClearThreadTables(trcBlockHeader* block);
 // The thread-table lock: process-local, recursive.
 void trcThreadTableLock();
 void trcThreadTableUnlock();

@@ -1,0 +1,538 @@
+// The trace writer, its reader and the attachment of a process to a block:
+// damaged images first, then what the writer keeps and drops.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <cstdio>
+#include <cstring>
+#include <functional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "common/trace/trace.h"
+#include "common/trace/trace_anchor.h"
+#include "common/trace/trcread.h"
+#include "common/trace/trcwrite.h"
+#include "tests/testing/klptest.h"
+
+namespace {
+
+constexpr uint32_t kArea = TRC_MIN_SIZE - TRC_HEADER_SIZE;  // 35808 bytes of records
+const char* const kKey = "TDB.KLP.KCAP";
+
+// What the trace messages said while an object lived.
+class Said {
+ public:
+  Said() : file_(tmpfile()) { g_trcAnchorStorage.out = file_; }
+  ~Said() {
+    g_trcAnchorStorage.out = nullptr;
+    fclose(file_);
+  }
+  std::string text() {
+    fflush(file_);
+    std::string s(static_cast<size_t>(ftell(file_)), '\0');
+    rewind(file_);
+    s.resize(fread(s.data(), 1, s.size(), file_));
+    return s;
+  }
+
+ private:
+  FILE* file_;
+};
+
+struct Rec {
+  int type, component, function, level;
+  uint32_t threadId;
+  int32_t pid;
+  std::string name;
+  std::vector<std::pair<int, std::string>> objects;  // type, data bytes
+  int value() const {
+    int v = 0;
+    memcpy(&v, objects.at(0).second.data(), sizeof v);
+    return v;
+  }
+};
+
+struct Walk {
+  std::vector<Rec> records;
+  int error = -1;
+  std::string said;
+};
+
+Walk walk(const trcBlockHeader* h, size_t size, bool fromFile) {
+  Walk w;
+  Said said;
+  trcIter it;
+  trcIterInit(&it, h, size, fromFile);
+  while (trcNextRecord(&it)) {
+    const trcRecordHeader* r = it.record;
+    Rec rec{r->type, r->component, r->function, r->levelMask, r->threadId, r->pid,
+            std::string(r->name, 16), {}};
+    uint32_t off = 0;
+    int index = 0;
+    trcObject o;
+    while (trcNextObject(r, &off, &index, &o))
+      rec.objects.push_back({o.type, std::string(reinterpret_cast<const char*>(o.data), o.length)});
+    w.records.push_back(rec);
+  }
+  w.error = it.error;
+  w.said = said.text();
+  return w;
+}
+
+// A trace block of this process, created as the trace command does.
+struct Trace {
+  klptest::TmpDir dir;
+  Trace(uint32_t size = TRC_MIN_SIZE, const std::string& file = "", uint32_t fileSize = TRC_MAX_SIZE,
+        uint16_t filter = 0x3F) {
+    trcInitAnchor();
+    EXPECT_EQ(0, trcCreate(size, dir.path().c_str(), kKey, file.empty() ? nullptr : file.c_str(),
+                           fileSize, filter, true));
+  }
+  ~Trace() {
+    trcFree();
+    EXPECT_FALSE(klptest::memoryExists(dir.path() + kKey + ".TRC"));
+  }
+  trcBlockHeader* b() const { return trcGetAnchor()->block; }
+  Walk read() const { return walk(b(), b()->bufferSize, false); }
+};
+
+void put(int v) { trcData(5, 7, "value", TRC_LVL_BASIC, TRC_OBJ_SIGNED, 4, &v); }
+
+// A hand-made image: header and data area, records placed by offset.
+struct Image {
+  std::vector<uint8_t> bytes = std::vector<uint8_t>(TRC_MIN_SIZE, 0);
+  trcBlockHeader* h() { return reinterpret_cast<trcBlockHeader*>(bytes.data()); }
+  Image(uint32_t write, uint32_t oldest, uint32_t high, uint32_t count) {
+    h()->dataOffset = TRC_HEADER_SIZE;
+    h()->writeOffset = write;
+    h()->oldestOffset = oldest;
+    h()->highWaterOffset = high;
+    h()->entryCount = count;
+    h()->bufferSize = TRC_MIN_SIZE;
+  }
+  Image& rec(uint32_t off, uint32_t length, uint16_t function = 1, uint16_t objects = 0,
+             uint16_t objectLength = 0) {
+    trcRecordHeader r{};
+    r.length = length;
+    r.function = function;
+    r.objectCount = objects;
+    r.type = TRC_REC_DATA;
+    memcpy(&bytes[TRC_HEADER_SIZE + off], &r, sizeof r);
+    trcObjectHeader o{TRC_OBJ_RAW, objectLength};
+    memcpy(&bytes[TRC_HEADER_SIZE + off + 40], &o, sizeof o);
+    return *this;
+  }
+};
+
+TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
+  struct Row {
+    const char* what;
+    Image image;
+    size_t records;
+    int error, fileError;
+    const char* said;
+  };
+  std::vector<Row> rows = {
+      {"length below 40", Image(80, 0, 80, 1).rec(0, 36), 0, TRC_WALK_BAD_RECORD,
+       TRC_WALK_BAD_RECORD, "impossible length 36"},
+      {"length not a multiple of 4", Image(80, 0, 80, 1).rec(0, 42), 0, TRC_WALK_BAD_RECORD,
+       TRC_WALK_BAD_RECORD, "impossible length 42"},
+      {"length 0 never loops", Image(80, 0, 80, 2).rec(0, 0), 0, TRC_WALK_BAD_RECORD,
+       TRC_WALK_BAD_RECORD, "impossible length 0"},
+      {"length past the high-water offset", Image(40, 0, 40, 1).rec(0, 80), 0,
+       TRC_WALK_BAD_RECORD, TRC_WALK_BAD_RECORD, "impossible length 80"},
+      {"entry count above the records held", Image(160, 0, 160, 3).rec(0, 80).rec(80, 80), 2,
+       TRC_WALK_SHORT, TRC_WALK_SHORT, "counts 3 records but only 2"},
+      {"data-area offset inside the header",
+       [] { Image i(40, 0, 40, 1); i.h()->dataOffset = 95260; return i; }(), 0,
+       TRC_WALK_BAD_HEADER, TRC_WALK_BAD_HEADER, "data-area offset"},
+      {"offsets not multiples of 4", Image(42, 0, 42, 1), 0, TRC_WALK_BAD_HEADER,
+       TRC_WALK_BAD_HEADER, "multiples of 4"},
+      {"oldest beyond the high-water offset", Image(40, 80, 40, 1), 0, TRC_WALK_BAD_HEADER,
+       TRC_WALK_BAD_HEADER, "beyond the high-water"},
+      {"more entries than bytes", Image(40, 0, 40, 2).rec(0, 40), 0, TRC_WALK_BAD_HEADER,
+       TRC_WALK_BAD_HEADER, "more entries"},
+      {"high-water offset beyond the buffer", Image(kArea + 40, 0, kArea + 40, 1), 0,
+       TRC_WALK_BAD_HEADER, TRC_WALK_BAD_RECORD, ""},
+      {"object runs past its record", Image(48, 0, 48, 1).rec(0, 48, 1, 1, 20), 1, TRC_WALK_OK,
+       TRC_WALK_OK, "Object 1 of length 20 runs past"},
+      {"more objects counted than fit", Image(48, 0, 48, 1).rec(0, 48, 1, 2, 4), 1, TRC_WALK_OK,
+       TRC_WALK_OK, "Object 2 lies beyond"},
+      {"wrapped: oldest to high water, then from 0",
+       Image(40, 80, 120, 2).rec(0, 40, 2).rec(40, 40, 9).rec(80, 40, 1), 2, TRC_WALK_OK,
+       TRC_WALK_OK, ""},
+      {"stale bytes beyond the write offset", Image(40, 0, 120, 1).rec(0, 40).rec(40, 40), 1,
+       TRC_WALK_OK, TRC_WALK_OK, ""},
+  };
+  klptest::TmpDir dir;
+  for (Row& row : rows) {
+    SCOPED_TRACE(row.what);
+    Walk mem = walk(row.image.h(), row.image.bytes.size(), false);
+    EXPECT_EQ(row.records, mem.records.size());
+    EXPECT_EQ(row.error, mem.error);
+    EXPECT_NE(std::string::npos, mem.said.find(row.said)) << mem.said;
+
+    // The same bytes as a trace file.
+    std::string path = dir.path() + "image.trc";
+    snprintf(row.image.h()->fileName, TRC_KEY_SIZE, "%s", path.c_str());
+    FILE* f = fopen(path.c_str(), "wb");
+    fwrite(row.image.bytes.data(), 1, row.image.bytes.size(), f);
+    fclose(f);
+    trcBlockHeader header;
+    ASSERT_EQ(TRC_READ_OK, trcReadFileHeader(path.c_str(), &header));
+    Walk file = walk(&header, 0, true);
+    EXPECT_EQ(row.records, file.records.size());
+    EXPECT_EQ(row.fileError, file.error);
+    if (row.error == TRC_WALK_OK && row.records == 2) {
+      EXPECT_EQ(1, mem.records[0].function);  // the oldest first
+      EXPECT_EQ(2, mem.records[1].function);
+    }
+  }
+}
+
+TEST(TraceWriter, WhatARecordHolds) {
+  struct Row {
+    const char* what;
+    std::function<void(trcBlockHeader*)> setup;
+    std::function<uint32_t()> point;
+    uint32_t level;
+    int records, type;
+    std::vector<std::pair<int, std::string>> objects;
+    const char* name;
+  };
+  const int str = TRC_OBJ_STRING;
+  auto none = [](trcBlockHeader*) {};
+  std::string big(kArea - 44, 'x');
+  std::vector<Row> rows = {
+      {"null pointer keeps its declared type", none,
+       [] { return trcData(5, 7, "nothing", 2, str, 10, nullptr); }, 0x3F, 1, TRC_REC_DATA,
+       {{TRC_OBJ_NULL, std::string("\3\0", 2)}}, "nothing        "},
+      {"name cut to 15", none,
+       [] { return trcData(5, 7, "a name much too long", 2, str, 2, "ab"); }, 0x3F, 1,
+       TRC_REC_DATA, {{str, "ab"}}, "a name much too"},
+      {"component 54 records nothing", none, [] { return trcEntry(54, 1); }, 0, 0, 0, {}, ""},
+      {"function 250 records nothing", none, [] { return trcEntry(5, 250); }, 0, 0, 0, {}, ""},
+      {"function override without levels silences",
+       [](trcBlockHeader* b) { b->functionFilters[5][7] = 0x8000; },
+       [] { return trcData(5, 7, "x", 2, str, 1, "x"); }, 0, 0, 0, {}, ""},
+      {"component override of level 2: no entry record",
+       [](trcBlockHeader* b) { b->componentFilters[5] = 0x8002; },
+       [] { return trcEntry(5, 7); }, 2, 0, 0, {}, ""},
+      {"exit with a return code", none,
+       [] { trcExit(5, 7, TRC_RET_RC, 12); return 1u; }, 1, 1, TRC_REC_EXIT_VALUE,
+       {{TRC_OBJ_RC, std::string("\14\0", 2)}}, nullptr},
+      {"exit with a boolean", none,
+       [] { trcExit(5, 7, TRC_RET_BOOL, 0, 1); return 1u; }, 1, 1, TRC_REC_EXIT_VALUE,
+       {{TRC_OBJ_BOOL, std::string("\1\0\0\0", 4)}}, nullptr},
+      {"exit with a pointer", none,
+       [] { trcExit(5, 7, TRC_RET_PTR, 0, 0, 0x0102); return 1u; }, 1, 1, TRC_REC_EXIT_VALUE,
+       {{TRC_OBJ_POINTER, std::string("\2\1\0\0\0\0\0\0", 8)}}, nullptr},
+      {"exit of another kind has no object", none,
+       [] { trcExit(5, 7, 9, 12); return 1u; }, 1, 1, TRC_REC_EXIT, {}, nullptr},
+      {"a stopped block takes nothing", [](trcBlockHeader* b) { b->status = TRC_STATE_STOP; },
+       [] { return trcEntry(5, 7); }, 0x3F, 0, 0, {}, ""},
+      {"a record as large as the data area fits an empty buffer", none,
+       [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 44, big.data()); }, 0x3F, 1,
+       TRC_REC_DATA, {{TRC_OBJ_RAW, big}}, "big            "},
+      {"one byte more is never written", none,
+       [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 43, big.data()); }, 0x3F, 0,
+       0, {}, ""},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.what);
+    Trace t;
+    row.setup(t.b());
+    EXPECT_EQ(row.level, row.point());
+    t.b()->status = TRC_STATE_RUNNING;
+    Walk w = t.read();
+    ASSERT_EQ(static_cast<size_t>(row.records), w.records.size());
+    if (row.records == 0) continue;
+    const Rec& r = w.records[0];
+    EXPECT_EQ(row.type, r.type);
+    EXPECT_EQ(row.objects, r.objects);
+    EXPECT_EQ(hsvProcessID(), r.pid);
+    if (row.name != nullptr) {
+      EXPECT_EQ(std::string(row.name) + '\0', r.name);
+    }
+  }
+
+  // The common body takes 32 objects of 33.
+  Trace t;
+  int types[33];
+  uint32_t lengths[33];
+  const void* pointers[33];
+  for (int i = 0; i < 33; ++i) types[i] = TRC_OBJ_STRING, lengths[i] = 1, pointers[i] = "z";
+  trcDataN(5, 7, "many", 2, 33, types, lengths, pointers);
+  EXPECT_EQ(32u, t.read().records.at(0).objects.size());
+}
+
+TEST(TraceWriter, WrapKeepsTheNewestRecords) {
+  Trace t;
+  for (int v = 0; v < 2000; ++v) put(v);
+  Walk w = t.read();
+  // 48-byte records: 746 fill the 35808-byte area exactly.
+  ASSERT_EQ(746u, w.records.size());
+  EXPECT_EQ(TRC_WALK_OK, w.error);
+  for (size_t i = 0; i < w.records.size(); ++i) EXPECT_EQ(1254 + static_cast<int>(i), w.records[i].value());
+}
+
+// The last lap of a direct-to-file trace, as turning the trace off writes it.
+void flushLastLap(trcBlockHeader* b) {
+  std::vector<uint8_t> copy(b->bufferSize);
+  trcLockBuffer(b);
+  memcpy(copy.data(), b, copy.size());
+  trcUnlockBuffer(b);
+  trcFlushToFile(reinterpret_cast<trcBlockHeader*>(copy.data()), true);
+}
+
+TEST(TraceWriter, DirectToFileLosesNothingUntilItsLimit) {
+  struct Row {
+    uint32_t fileSize;
+    int written, kept;
+  };
+  // Each wrap appends one full lap of 746 records; three laps fit 131072,
+  // and the last 500 records (24000 bytes) do not fit what is left.
+  for (const Row& row : std::vector<Row>{{TRC_MAX_SIZE, 5000, 5000}, {TRC_MIN_SIZE, 4230, 2238}}) {
+    SCOPED_TRACE(row.fileSize);
+    klptest::TmpDir files;
+    std::string path = files.path() + "direct.trc";
+    {
+      Trace t(TRC_MIN_SIZE, path, row.fileSize);
+      for (int v = 0; v < row.written; ++v) put(v);
+      flushLastLap(t.b());
+    }
+    trcBlockHeader header;
+    ASSERT_EQ(TRC_READ_OK, trcReadFileHeader(path.c_str(), &header));
+    Walk w = walk(&header, 0, true);
+    ASSERT_EQ(static_cast<size_t>(row.kept), w.records.size());
+    for (int i = 0; i < row.kept; ++i) ASSERT_EQ(i, w.records[i].value());
+  }
+}
+
+TEST(TraceWriter, RecordsFromTwoThreads) {
+  Trace t;
+  auto writer = [](int base, uint32_t* tid) {
+    *tid = static_cast<uint32_t>(hsvThreadID());
+    for (int i = 0; i < 300; ++i) put(base + i);
+  };
+  uint32_t tids[2];
+  std::thread a(writer, 0, &tids[0]), b(writer, 1000, &tids[1]);
+  a.join();
+  b.join();
+  int next[2] = {0, 1000};
+  for (const Rec& r : t.read().records) {
+    int k = r.threadId == tids[0] ? 0 : 1;
+    ASSERT_EQ(tids[k], r.threadId);
+    EXPECT_EQ(next[k]++, r.value());
+  }
+  EXPECT_EQ(300, next[0]);
+  EXPECT_EQ(1300, next[1]);
+}
+
+TEST(TraceFile, FlushFaults) {
+  struct Row {
+    const char* what;
+    std::function<void(const std::string&)> existing;  // file before the flush
+    int entries;                                        // in the image
+    size_t records;                                     // in the file afterwards
+    const char* said;
+  };
+  auto write = [](const std::string& path, const std::string& bytes) {
+    FILE* f = fopen(path.c_str(), "wb");
+    fwrite(bytes.data(), 1, bytes.size(), f);
+    fclose(f);
+  };
+  auto header = [&](const char* platform, uint32_t dataOffset) {
+    return [=](const std::string& path) {
+      std::vector<char> h(TRC_HEADER_SIZE, 0);
+      auto* b = reinterpret_cast<trcBlockHeader*>(h.data());
+      strcpy(b->platform, platform);
+      strcpy(b->structVersion, "0012");
+      b->dataOffset = dataOffset;
+      write(path, std::string(h.data(), h.size()));
+    };
+  };
+  std::vector<Row> rows = {
+      {"a header cut short is written afresh", [&](auto& p) { write(p, "short"); }, 3, 3, ""},
+      {"another platform's file is refused", header("Windows", TRC_HEADER_SIZE), 3, 0,
+       "File %s was generated by an incompatible Trace version."},
+      {"a damaged header is refused", header("Linux", 8), 3, 0, "is damaged"},
+      {"an empty image appends nothing", header("Linux", TRC_HEADER_SIZE), 0, 0,
+       "Trace buffer is empty"},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.what);
+    klptest::TmpDir files;
+    std::string path = files.path() + "f.trc";
+    row.existing(path);
+    Image img(48 * row.entries, 0, 48 * row.entries, row.entries);
+    for (int i = 0; i < row.entries; ++i) img.rec(48 * i, 48, 1, 1, 4);
+    snprintf(img.h()->fileName, TRC_KEY_SIZE, "%s", path.c_str());
+    strcpy(img.h()->platform, "Linux");
+    img.h()->maxFileSize = TRC_MAX_SIZE;
+    Said said;
+    trcFlushToFile(img.h(), true);
+    std::string expected = row.said;
+    if (expected.find("%s") != std::string::npos) expected.replace(expected.find("%s"), 2, path);
+    EXPECT_NE(std::string::npos, said.text().find(expected)) << said.text();
+    trcBlockHeader h;
+    if (trcReadFileHeader(path.c_str(), &h) == TRC_READ_OK && h.dataOffset == TRC_HEADER_SIZE) {
+      EXPECT_EQ(row.records, walk(&h, 0, true).records.size());
+    }
+  }
+
+  // A file that cannot be created is not left behind half written.
+  Image img(48, 0, 48, 1);
+  img.rec(0, 48, 1, 1, 4);
+  strcpy(img.h()->fileName, "/nonexistent-dir/f.trc");
+  Said said;
+  EXPECT_NE(0, trcFlushToFile(img.h(), true));
+  EXPECT_NE(std::string::npos, said.text().find("Unable to create file \"/nonexistent-dir/f.trc\""));
+
+  // Bytes beyond the write offset of an unwrapped image are stale: a new
+  // file holds the records only.
+  klptest::TmpDir files;
+  Image stale(48, 0, 96, 1);
+  stale.rec(0, 48, 1, 1, 4).rec(48, 48, 2, 1, 4);
+  snprintf(stale.h()->fileName, TRC_KEY_SIZE, "%sstale.trc", files.path().c_str());
+  ASSERT_EQ(0, trcFlushToFile(stale.h(), true));
+  EXPECT_EQ(TRC_HEADER_SIZE + 48u, klptest::readFile(stale.h()->fileName).size());
+}
+
+TEST(TraceVersion, IncompatibleHeadersAreRefused) {
+  struct Row {
+    const char *platform, *structure, *symbols;
+    uint16_t components, functions;
+    bool compatible;
+    const char* said;
+  };
+  std::vector<Row> rows = {
+      {"Linux", "0012", "0024", 54, 250, true, ""},
+      {"Windows", "0012", "0024", 54, 250, false,
+       "Shared buffer was generated by an incompatible Trace version.\nIt uses: platform "
+       "Windows, trace structure 0012, and symbol table 0024 (54x250)\nThis is: platform Linux, "
+       "trace structure 0012, and symbol table 0024 (54x250)\n"},
+      {"Linux", "0011", "0024", 54, 250, false, "incompatible"},
+      {"Linux", "0012", "0024", 55, 250, false, "incompatible"},
+      {"Linux", "0012", "0024", 54, 251, false, "incompatible"},
+      {"Linux", "0012", "0023", 50, 250, true,
+       "Warning: Shared buffer uses a different symbol table (0023, 50x250) than this version "
+       "of Trace (0024, 54x250).\n"},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.platform + std::string(row.structure) + row.symbols);
+    trcBlockHeader h{};
+    strcpy(h.platform, row.platform);
+    strcpy(h.structVersion, row.structure);
+    strcpy(h.symbolVersion, row.symbols);
+    h.componentCount = row.components;
+    h.functionsPerComponent = row.functions;
+    Said said;
+    EXPECT_EQ(row.compatible, trcCheckVersion(&h, nullptr, true));
+    std::string text = said.text();
+    EXPECT_TRUE(*row.said ? text.find(row.said) != std::string::npos : text.empty()) << text;
+  }
+}
+
+TEST(TraceThreads, HashedSlotsOverflowAndLookups) {
+  Trace t;  // entries are mirrored into the block while tracing
+  auto set = [](uint32_t id, const char* name) {
+    trcThreadData e{};
+    e.threadId = id;
+    strcpy(e.threadName, name);
+    trcSetThreadData(&e);
+  };
+  set(0x1234, "first");                   // slot 0x1234 % 150 = 10
+  set(0x1234 + 150, "collides");          // overflow entry 0
+  // Overflow entries 1..148, then entry 149 taken in turn by each new id.
+  for (uint32_t k = 2; k <= 151; ++k) set(0x1234 + 150 * k, "more");
+  set(0x1234 + 150 * 152, "last");
+
+  struct Row {
+    uint32_t id;
+    const char* name;
+  };
+  for (const Row& row : std::vector<Row>{{0x1234, "first"},
+                                         {0x1234 + 150, "collides"},
+                                         {0x1234 + 150 * 149, "more"},
+                                         {0x1234 + 150 * 150, "UNKNOWN THREAD2"},
+                                         {0x1234 + 150 * 151, "UNKNOWN THREAD2"},
+                                         {0x1234 + 150 * 152, "last"},
+                                         {11, "UNKNOWN THREAD1"},
+                                         {0xFFFFFFFF, "UNKNOWN THREAD1"}}) {
+    EXPECT_STREQ(row.name, trcGetThreadData(row.id)->threadName) << row.id;
+  }
+  EXPECT_STREQ("tid = 0x34120000", trcGetThreadData(0x1234)->threadIdText);
+  EXPECT_STREQ("first", t.b()->threadTable[10].threadName);
+  EXPECT_STREQ("last", t.b()->threadOverflow[149].threadName);
+}
+
+// A server process attaching to a block the trace command created.
+TEST(TraceAttach, ServerAttachesOnlyToASoundBlock) {
+  struct Row {
+    const char* what;
+    std::function<void(trcBlockHeader*, const std::string&)> spoil;
+    int rc;
+    size_t records;
+  };
+  auto shmPath = [](const std::string& dir) {
+    HSVResID id;
+    hsvIPCGetResID((dir + kKey + ".TRC").c_str(), HSV_MEMORY_RESID_OPTION, &id);
+    return std::string("/dev/shm") + id.posixName();
+  };
+  std::vector<Row> rows = {
+      {"sound", [](trcBlockHeader*, const std::string&) {}, 0, 1},
+      {"readable by others",
+       [&](trcBlockHeader*, const std::string& dir) { chmod(shmPath(dir).c_str(), 0644); },
+       TRC_RC_NO_ADDRESS, 0},
+      {"another platform",
+       [](trcBlockHeader* b, const std::string&) { strcpy(b->platform, "Windows"); },
+       TRC_RC_INCOMPATIBLE, 0},
+      {"still being built",
+       [](trcBlockHeader* b, const std::string&) { b->status = TRC_STATE_STARTING; }, 0, 0},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.what);
+    Trace t;
+    trcBlockHeader* shared = t.b();  // the child inherits this mapping
+    row.spoil(shared, t.dir.path());
+    klptest::Child c = klptest::inChild(t.dir.path(), [&] {
+      trcInitAnchor();
+      int rc = trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr);
+      bool attached = trcGetAnchor()->block != nullptr && shared->appAttached == TRC_APP_ATTACHED;
+      put(7);
+      trcDetach();
+      return rc == row.rc && attached == (row.rc == 0 && row.records == 1) ? 0 : 1;
+    });
+    EXPECT_TRUE(c.exited && c.exitCode == 0) << c.out << c.err;
+    t.b()->status = TRC_STATE_RUNNING;
+    strcpy(t.b()->platform, "Linux");
+    Walk w = t.read();
+    ASSERT_EQ(row.records, w.records.size());
+    if (row.records) {
+      EXPECT_NE(hsvProcessID(), w.records[0].pid);
+    }
+    EXPECT_EQ(0, t.b()->appAttached);
+  }
+}
+
+TEST(TraceAttach, TurnedOffStopsWritingAtTheNextCheck) {
+  Trace t;
+  trcBlockHeader* shared = t.b();
+  klptest::Child c = klptest::inChild(t.dir.path(), [&] {
+    trcInitAnchor();
+    if (trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr) != 0) return 1;
+    put(1);
+    shared->status = TRC_STATE_STOP;  // as "off" leaves it
+    trcCheckStop();
+    shared->status = TRC_STATE_RUNNING;  // the anchor alone keeps the point silent now
+    put(2);
+    return trcAnchorState() == TRC_STATE_STOPPING && trcGetAnchor()->block != nullptr ? 0 : 2;
+  });
+  EXPECT_EQ(0, c.exitCode) << c.out << c.err;
+  EXPECT_EQ(1u, t.read().records.size());
+}
+
+}  // namespace
