@@ -13,6 +13,7 @@
 #include "common/env/klpenv.h"
 #include "common/platform/hsv.h"
 #include "common/trace/trace_anchor.h"
+#include "common/trace/trc_internal.h"
 #include "common/trace/trcformat.h"
 #include "common/trace/trcopts.h"
 #include "common/trace/trcread.h"
@@ -86,7 +87,7 @@ void openOutputFile(Run* r) {
 // anchor forgets it.
 void dropBlock(trcAnchor* a, bool destroy) {
   trcDropBlock(destroy);
-  a->state = TRC_STATE_STOPPED;
+  __atomic_store_n(&a->state, TRC_STATE_STOPPED, __ATOMIC_SEQ_CST);
 }
 
 // Attaches to the block of the keys when there is one. False when the
@@ -106,7 +107,7 @@ bool attachBlock(Run* r) {
     return true;
   }
   a->memory = memory;
-  a->block = block;
+  trcint::publishBlock(block, memory->getSize());
   copyKey(a->keyPart2, r->keyPart2);
   if (block->status == TRC_STATE_RUNNING) {
     if (!trcCheckVersion(block, nullptr, false)) {
@@ -117,7 +118,7 @@ bool attachBlock(Run* r) {
     }
     if (trcThreadTablesInUse()) trcCopyThreadTables(block);
     if (!r->standalone) block->appAttached = TRC_APP_ATTACHED;
-    a->state = TRC_STATE_RUNNING;
+    __atomic_store_n(&a->state, TRC_STATE_RUNNING, __ATOMIC_SEQ_CST);
   } else if (!r->standalone) {
     // A server leaves a block that is not running as its detach would.
     trcDetach();

@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <initializer_list>
 
 #include "common/platform/hsv.h"
 #include "common/trace/trace_anchor.h"
