@@ -4,6 +4,7 @@
 #include <dirent.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstring>
 #include <fstream>
 #include <string>
@@ -141,11 +142,15 @@ TEST(Klptrc, ServerTracedFromItsStart) {
 
   std::string dump = dir.path() + "dump.trc";
   EXPECT_EQ(trc(std::vector<std::string>{"dmp", dump} + keys(srv)).out, "");
-  std::string full = trc({"fmt", "-fn", dump}).out;
+  // A trace file is read under the name it is given, not the one it was
+  // written under.
+  std::string moved = dir.path() + "moved.trc";
+  ASSERT_EQ(rename(dump.c_str(), moved.c_str()), 0);
+  std::string full = trc({"fmt", "-fn", moved}).out;
   EXPECT_TRUE(has(full, "cmdsHandleMessage fnc_data \"Got IPC Message\" lvl 3\n"
                         "         Object 1 of type \"Raw binary data\": (hex dump)\n")) << full;
-  EXPECT_TRUE(has(trc({"stat", "-fn", dump}).out, "LogDiagLvl : N/A\nStatus:      N/A\n"));
-  std::string json = trc({"json", "-fn", dump, "-d", "1"}).out;
+  EXPECT_TRUE(has(trc({"stat", "-fn", moved}).out, "LogDiagLvl : N/A\nStatus:      N/A\n"));
+  std::string json = trc({"json", "-fn", moved, "-d", "1"}).out;
   EXPECT_EQ(json.substr(0, 39), "{\"displayTimeUnit\":\"ms\",\"traceEvents\":[");
   EXPECT_EQ(json.substr(json.size() - 4), "\n]}\n");
   EXPECT_TRUE(has(json, "{\"name\":\"cmdsHandleMessage\",\"cat\":\"XKAPP Browser\",\"ph\":\"B\""));
