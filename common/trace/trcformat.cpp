@@ -70,6 +70,24 @@ void putReturnValue(FILE* out, const trcRecordHeader* r) {
   if (trcNextObject(r, &offset, &index, &obj)) trcPutReturnValue(out, obj);
 }
 
+// The text of an entry or exit record after its function name: "fnc_entry
+// at time ...", the plain exit text and the time, or "fnc_exit  at time ..."
+// and the return value. False for a data record.
+bool putCallEvent(FILE* out, const trcRecordHeader* r, const char* plainExit) {
+  switch (r->type) {
+    case TRC_REC_ENTRY: trcPuts(out, "fnc_entry at time "); break;
+    case TRC_REC_EXIT: trcPuts(out, plainExit); break;
+    case TRC_REC_EXIT_VALUE: trcPuts(out, "fnc_exit  at time "); break;
+    default: return false;
+  }
+  putTimeOf(out, r);
+  if (r->type == TRC_REC_EXIT_VALUE) {
+    putc_unlocked(' ', out);
+    putReturnValue(out, r);
+  }
+  return true;
+}
+
 // "fnc_data "name" "
 void putDataName(FILE* out, const trcRecordHeader* r) {
   trcPuts(out, "fnc_data \"");
@@ -196,39 +214,22 @@ void trcFormatFull(FILE* out, const trcImage& image, bool hex) {
     trcPuts(out, "\n         ");
     trcPuts(out, trcFunctionName(r->component, r->function));
     putc_unlocked(' ', out);
-    switch (r->type) {
-      case TRC_REC_ENTRY:
-        trcPuts(out, "fnc_entry at time ");
-        putTimeOf(out, r);
-        putc_unlocked('\n', out);
-        break;
-      case TRC_REC_EXIT:
-        trcPuts(out, "fnc_exit at time ");
-        putTimeOf(out, r);
-        putc_unlocked('\n', out);
-        break;
-      case TRC_REC_EXIT_VALUE:
-        trcPuts(out, "fnc_exit  at time ");
-        putTimeOf(out, r);
-        putc_unlocked(' ', out);
-        putReturnValue(out, r);
-        putc_unlocked('\n', out);
-        break;
-      default: {
-        putDataName(out, r);
-        trcPuts(out, trcFullLevelText(r->levelMask));
-        putc_unlocked('\n', out);
-        uint32_t offset = 0;
-        int index = 0;
-        trcObject obj;
-        while (trcNextObject(r, &offset, &index, &obj)) {
-          trcPuts(out, "         Object ");
-          trcPutInt(out, obj.number);
-          trcPuts(out, " of type \"");
-          trcPuts(out, trcObjectTypeName(obj.type));
-          trcPuts(out, "\": ");
-          trcFormatObject(out, obj.type, obj.length, obj.data, hex);
-        }
+    if (putCallEvent(out, r, "fnc_exit at time ")) {
+      putc_unlocked('\n', out);
+    } else {
+      putDataName(out, r);
+      trcPuts(out, trcFullLevelText(r->levelMask));
+      putc_unlocked('\n', out);
+      uint32_t offset = 0;
+      int index = 0;
+      trcObject obj;
+      while (trcNextObject(r, &offset, &index, &obj)) {
+        trcPuts(out, "         Object ");
+        trcPutInt(out, obj.number);
+        trcPuts(out, " of type \"");
+        trcPuts(out, trcObjectTypeName(obj.type));
+        trcPuts(out, "\": ");
+        trcFormatObject(out, obj.type, obj.length, obj.data, hex);
       }
     }
     putc_unlocked('\n', out);
@@ -272,34 +273,18 @@ void trcFormatFlow(FILE* out, const trcImage& image) {
       for (int64_t i = 0; i < indent; ++i) trcPutn(out, "| ", 2);
       trcPuts(out, trcFunctionName(r->component, r->function));
       putc_unlocked(' ', out);
-      switch (r->type) {
-        case TRC_REC_ENTRY:
-          trcPuts(out, "fnc_entry at time ");
-          putTimeOf(out, r);
-          break;
-        case TRC_REC_EXIT:
-          trcPuts(out, "fnc_exit  at time ");
-          putTimeOf(out, r);
-          break;
-        case TRC_REC_EXIT_VALUE:
-          trcPuts(out, "fnc_exit  at time ");
-          putTimeOf(out, r);
-          putc_unlocked(' ', out);
-          putReturnValue(out, r);
-          break;
-        default: {
-          putDataName(out, r);
-          trcPuts(out, trcFlowLevelText(r->levelMask));
-          uint32_t offset = 0;
-          int index = 0;
-          trcObject obj;
-          if ((r->levelMask & TRC_LVL_PERF) && trcNextObject(r, &offset, &index, &obj) &&
-              obj.type == TRC_OBJ_TIMESTAMP && obj.length >= sizeof(trcTimeValue)) {
-            trcTimeValue tv;
-            memcpy(&tv, obj.data, sizeof tv);
-            trcPuts(out, " at time ");
-            trcPutTime(out, static_cast<int32_t>(tv.seconds), tv.microseconds);
-          }
+      if (!putCallEvent(out, r, "fnc_exit  at time ")) {
+        putDataName(out, r);
+        trcPuts(out, trcFlowLevelText(r->levelMask));
+        uint32_t offset = 0;
+        int index = 0;
+        trcObject obj;
+        if ((r->levelMask & TRC_LVL_PERF) && trcNextObject(r, &offset, &index, &obj) &&
+            obj.type == TRC_OBJ_TIMESTAMP && obj.length >= sizeof(trcTimeValue)) {
+          trcTimeValue tv;
+          memcpy(&tv, obj.data, sizeof tv);
+          trcPuts(out, " at time ");
+          trcPutTime(out, static_cast<int32_t>(tv.seconds), tv.microseconds);
         }
       }
       putc_unlocked('\n', out);

@@ -57,6 +57,17 @@ std::string blockPath(const klptest::TmpDir& dir, const std::string& server) {
   return dir.path() + server + ".KLP.KCAP.TRC";
 }
 
+// Kills a trace a failed test left on, so that no block or keeper outlives
+// the test.
+struct KillLeftTrace {
+  const klptest::TmpDir& dir;
+  std::string server;
+  ~KillLeftTrace() {
+    if (klptest::memoryExists(blockPath(dir, server)))
+      trc(std::vector<std::string>{"kill"} + keys(server));
+  }
+};
+
 }  // namespace
 
 TEST(Klptrc, RefusalsWithoutATrace) {
@@ -119,6 +130,7 @@ TEST(Klptrc, RefusalsWithoutATrace) {
 TEST(Klptrc, ServerTracedFromItsStart) {
   klptest::TmpDir dir;
   const std::string srv = "TR1";
+  KillLeftTrace guard{dir, srv};
   klptest::ProcessResult on = trc(std::vector<std::string>{"on", "-d", "1,2,3"} + keys(srv));
   ASSERT_TRUE(has(on.out, "Trace is turned on, with IPC key '(shm, /klpm.")) << on.out;
   EXPECT_TRUE(has(trc(std::vector<std::string>{"on"} + keys(srv)).out,
@@ -183,6 +195,7 @@ TEST(Klptrc, ServerTracedFromItsStart) {
 TEST(Klptrc, TurnedOnForARunningServerThenKilled) {
   klptest::TmpDir dir;
   const std::string srv = "TR2";
+  KillLeftTrace guard{dir, srv};
   Server s(dir, srv);
   ASSERT_TRUE(s.ready());
   ASSERT_TRUE(has(trc(std::vector<std::string>{"on"} + keys(srv)).out, "Trace is turned on"));
@@ -204,6 +217,7 @@ TEST(Klptrc, TurnedOnForARunningServerThenKilled) {
 TEST(Klptrc, ResetlockFreesALockItsHolderLeft) {
   klptest::TmpDir dir;
   const std::string srv = "TR3";
+  KillLeftTrace guard{dir, srv};
   ASSERT_TRUE(has(trc(std::vector<std::string>{"on"} + keys(srv)).out, "Trace is turned on"));
   klptest::Child holder = klptest::inChild(dir.path(), [&] {
     HSVHIPCMemory* m = nullptr;
