@@ -1,7 +1,9 @@
 #!/usr/bin/env bash
 # Demonstration: starts the sample K Capture server under a private TMPDIR,
 # commands it with klpkccmd (STATUS, STATUS SHOW DETAILS, QRYPARMS, CHGPARMS,
-# QRYPARMS again, STOP), waits for it to end and shows the end of its log.
+# QRYPARMS again), turns its trace on with klptrc, formats a short trace and
+# turns it off, then STOPs it, waits for it to end and shows the end of its
+# log.
 # Leaves no process, queue or file behind, also when interrupted.
 #
 #   scripts/demo.sh BUILD_DIR      (e.g. scripts/demo.sh build)
@@ -9,7 +11,7 @@ set -euo pipefail
 
 BUILD_DIR=${1:-build}
 BIN="$BUILD_DIR/bin"
-for p in klpkcap klpkccmd; do
+for p in klpkcap klpkccmd klptrc klptrcbp; do
   if [[ ! -x "$BIN/$p" ]]; then
     echo "demo: $BIN/$p not found; build first (make build)" >&2
     exit 2
@@ -23,6 +25,7 @@ LOG="$DIR/$SERVER.KLP.KCAP.log"
 SERVER_QUEUE="$DIR/$SERVER.KLP.KCAP.IPC"
 SERVER_PID=""
 CLIENT_PID=""
+TRACE_ON=""
 
 # Removes the POSIX message queue of a path (named as docs/ipc-names.md says),
 # for the case where a process had to be killed before it could do so.
@@ -53,6 +56,7 @@ end_process() {
 
 cleanup() {
   trap - EXIT INT TERM
+  [[ -n "$TRACE_ON" ]] && "$BIN/klptrc" kill -db "$SERVER" -kcap >/dev/null 2>&1
   end_process "$CLIENT_PID"
   [[ -n "$CLIENT_PID" ]] && unlink_queue "$SERVER_QUEUE.CMD$CLIENT_PID"
   end_process "$SERVER_PID"
@@ -96,6 +100,29 @@ command STATUS SHOW DETAILS
 command QRYPARMS
 command CHGPARMS COMMIT_INTERVAL=1000
 command QRYPARMS
+# The trace: on for the running server (which attaches at once), a command
+# to have something to trace, the flow and the full format, and off.
+trace() {
+  echo
+  echo "\$ klptrc $*"
+  "$BIN/klptrc" "$@"
+}
+# A formatting style, less the version and thread-data header it starts with.
+records() {
+  echo
+  echo "\$ klptrc $*    (the records, without the header)"
+  "$BIN/klptrc" "$@" | sed '1,/Thread Specific Data End/d' | head -n 40
+}
+echo
+echo "--- a short trace"
+TRACE_ON=1
+trace on -db "$SERVER" -kcap
+command STATUS
+records flw -db "$SERVER" -kcap
+records fmt -db "$SERVER" -kcap
+trace off -db "$SERVER" -kcap
+TRACE_ON=""
+
 command STOP
 
 echo

@@ -196,6 +196,19 @@ void hsvSleep(uint32_t milliseconds);
 hsvRC hsvOneTimeOnly();
 
 // ---------------------------------------------------------------------------
+// Processes
+// ---------------------------------------------------------------------------
+// Starts program (a bare name is looked for in the directory of this
+// process's executable first, then on PATH) with argv, argv[0] included and
+// null-terminated, by posix_spawn: in a session of its own, its standard
+// streams on /dev/null, inheriting nothing else of the caller's state worth
+// holding on to. ECF_OK with *pid set; ECF_NOT_FOUND when it cannot be run.
+hsvRC hsvStartProcess(const char* program, const char* const* argv, int32_t* pid);
+// Waits for a process this one started; its exit code in *exitCode (-1 when
+// a signal ended it).
+hsvRC hsvWaitProcess(int32_t pid, int* exitCode);
+
+// ---------------------------------------------------------------------------
 // Shared libraries (dlopen)
 // ---------------------------------------------------------------------------
 class HSVSharedLib {

@@ -48,7 +48,9 @@ bool ioFailure(trcIter* it, const char* fmt) {
 
 bool readFromFile(trcIter* it, uint32_t room) {
   uint64_t pos = static_cast<uint64_t>(it->dataOffset) + it->offset;
-  if (fseeko(it->file, static_cast<off_t>(pos), SEEK_SET) != 0) {
+  // Records follow each other in the file: seek only where they do not, as
+  // a seek costs a system call even when the stream's buffer holds the bytes.
+  if (pos != it->filePos && fseeko(it->file, static_cast<off_t>(pos), SEEK_SET) != 0) {
     int err = errno;
     fprintf(trcOut(),
             "Unable to set file position in file \"%s\" to read next data record,\nfseek() "
@@ -77,6 +79,7 @@ bool readFromFile(trcIter* it, uint32_t room) {
   size_t rest = length - TRC_RECORD_HEADER_SIZE;
   if (rest != 0 && fread(it->buffer + TRC_RECORD_HEADER_SIZE, 1, rest, it->file) != rest)
     return ioFailure(it, "Error reading record %d.\n");
+  it->filePos = pos + length;
   it->record = reinterpret_cast<const trcRecordHeader*>(it->buffer);
   return true;
 }
@@ -127,6 +130,7 @@ bool start(trcIter* it) {
       return false;
     }
     it->bufferSize = kFirstBufferSize;
+    it->filePos = UINT64_MAX;
   } else if (it->fromFile) {
     finish(it, TRC_WALK_IO);
     return false;

@@ -35,6 +35,7 @@ struct trcIter {
   bool started, done, wrapped;
   uint32_t dataOffset, writeOffset, oldestOffset, highWater, entryCount;
   FILE* file;
+  uint64_t filePos;      // where the file stands after the last read; no seek needed there
   uint8_t* buffer;
   size_t bufferSize;
 };

@@ -1,0 +1,309 @@
+// The formatter against trace images built here byte by byte: every object
+// formatter (damaged objects first), the three styles and their filters,
+// and fields that fill their whole width.
+#include <gtest/gtest.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <string>
+#include <vector>
+
+#include "common/trace/trace_anchor.h"
+#include "common/trace/trcformat.h"
+#include "common/trace/trcobjfmt.h"
+#include "common/trace/trcopts.h"
+
+namespace {
+
+using Bytes = std::string;
+
+// Text written to a stream while the object lives.
+class Captured {
+ public:
+  Captured() : file_(open_memstream(&buf_, &size_)) {}
+  ~Captured() {
+    fclose(file_);
+    free(buf_);
+  }
+  FILE* file() { return file_; }
+  std::string text() {
+    fflush(file_);
+    return std::string(buf_, size_);
+  }
+
+ private:
+  char* buf_ = nullptr;
+  size_t size_ = 0;
+  FILE* file_;
+};
+
+std::string object(unsigned type, const Bytes& data, bool hex = false) {
+  Captured c;
+  trcFormatObject(c.file(), type, static_cast<uint32_t>(data.size()),
+                  reinterpret_cast<const uint8_t*>(data.data()), hex);
+  return c.text();
+}
+
+Bytes le16(uint16_t v) { return Bytes(reinterpret_cast<const char*>(&v), 2); }
+Bytes le32(uint32_t v) { return Bytes(reinterpret_cast<const char*>(&v), 4); }
+Bytes le64(uint64_t v) { return Bytes(reinterpret_cast<const char*>(&v), 8); }
+Bytes timeValue(int64_t seconds, int32_t micro) {
+  return le64(static_cast<uint64_t>(seconds)) + Bytes(4, '\0') + le32(static_cast<uint32_t>(micro));
+}
+// One 56-byte SQLDA column: type, length, name.
+Bytes column(uint16_t type, uint16_t length, const std::string& name, uint16_t nameLength) {
+  Bytes c = le16(type) + le16(length) + Bytes(20, '\0') + le16(nameLength) + name;
+  c.resize(56, '\0');
+  return c;
+}
+Bytes sqlda(int16_t count, const Bytes& columns) {
+  return Bytes(14, '\0') + le16(static_cast<uint16_t>(count)) + columns;
+}
+
+// A trace image: a header and the records appended to its data area.
+class Image {
+ public:
+  Image() : bytes_(TRC_HEADER_SIZE, '\0') {
+    trcBlockHeader* h = header();
+    strcpy(h->platform, "Linux");
+    strcpy(h->structVersion, "0012");
+    strcpy(h->symbolVersion, "0024");
+    h->componentCount = 54;
+    h->functionsPerComponent = 250;
+    h->dataOffset = TRC_HEADER_SIZE;
+    h->globalFilter = 0x7FFF;
+    for (int i = 0; i < 150; ++i) h->threadTable[i].key = h->threadOverflow[i].key = 0xFFFFFFFF;
+  }
+  trcBlockHeader* header() { return reinterpret_cast<trcBlockHeader*>(bytes_.data()); }
+  void nameThread(uint32_t tid, const std::string& name) {
+    trcThreadData& e = header()->threadTable[tid % 150];
+    e.key = e.threadId = tid;
+    memcpy(e.threadName, name.data(), std::min(name.size(), sizeof e.threadName));
+  }
+  // timeOrName: a time value (entry and exit) or the 16-byte name field.
+  void add(uint8_t type, uint16_t component, uint16_t function, uint32_t tid, uint16_t level,
+           const Bytes& timeOrName, const std::vector<std::pair<uint16_t, Bytes>>& objects = {}) {
+    Bytes body;
+    for (auto& [t, data] : objects) {
+      Bytes o = le16(t) + le16(static_cast<uint16_t>(data.size())) + data;
+      o.resize((o.size() + 3) & ~size_t{3}, '\0');
+      body += o;
+    }
+    Bytes rec = le32(static_cast<uint32_t>(40 + body.size())) + le16(level) +
+                le16(static_cast<uint16_t>(objects.size())) + le16(component) + le16(function) +
+                le32(7) + le32(tid) + timeOrName + Bytes(1, static_cast<char>(type)) +
+                Bytes(3, '\0') + body;
+    bytes_ += rec;
+    trcBlockHeader* h = header();
+    h->writeOffset = h->highWaterOffset = static_cast<uint32_t>(bytes_.size() - TRC_HEADER_SIZE);
+    ++h->entryCount;
+  }
+  trcImage image() { return trcImage{header(), bytes_.size(), false}; }
+
+ private:
+  Bytes bytes_;
+};
+
+Bytes name16(const std::string& n) {
+  Bytes b = n;
+  b.resize(15, ' ');
+  return b + Bytes(1, '\0');
+}
+
+// Two threads of process 7: 0x11 named "worker one", 0x22 not named.
+Image twoThreads() {
+  Image im;
+  im.nameThread(0x11, "worker one");
+  im.add(1, 11, 2, 0x11, 1, timeValue(1, 1));
+  im.add(3, 11, 2, 0x11, 2, name16("first data"), {{3, Bytes("hello", 6)}});
+  im.add(1, 23, 2, 0x22, 1, timeValue(1, 3));
+  im.add(4, 11, 2, 0x11, 1, timeValue(1, 4), {{13, le16(5)}});
+  im.add(4, 23, 2, 0x22, 1, timeValue(1, 5));  // an exit value without its object
+  im.add(3, 53, 200, 0x22, 4, name16("x"), {{1, le32(42)}});
+  return im;
+}
+
+enum Style { FLW, FMT, V7 };
+std::string format(Image& im, Style style, uint16_t level = 0x7FFF,
+                   std::vector<trcFilter> filters = {}) {
+  trcBlockHeader* h = im.header();
+  h->globalFilter = level;
+  trcApplyFilters(h, filters.data(), static_cast<int>(filters.size()));
+  trcLoadThreadTables(h);
+  Captured c;
+  if (style == FLW) trcFormatFlow(c.file(), im.image());
+  if (style == FMT) trcFormatFull(c.file(), im.image(), false);
+  if (style == V7) trcFormatV7(c.file(), im.image());
+  return c.text();
+}
+
+class Formatter : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    setenv("TZ", "UTC", 1);
+    tzset();
+  }
+};
+
+}  // namespace
+
+TEST_F(Formatter, ObjectsDamagedOrWhole) {
+  const std::string in = "\n         ";
+  struct Case {
+    unsigned type;
+    Bytes data;
+    std::string expected;
+  } cases[] = {
+      // Too short for what the type reads: a note and the bytes.
+      {1, Bytes("\x01\x02\x03", 3),
+       "(damaged: 3 bytes are too few for its type) (hex dump)" + in +
+           "010203                               |...             |\n"},
+      {19, le64(5), "(damaged: 8 bytes are too few for its type) (hex dump)" + in +
+                        "05000000 00000000                    |........        |\n"},
+      {18, Bytes(9, '\1'), "(damaged: 9 bytes are too few for its type) (hex dump)" + in +
+                               "01010101 01010101 01                 |.........       |\n"},
+      {15, Bytes(1, '\3'), "(damaged: 1 bytes are too few for its type) (hex dump)" + in +
+                               "03                                   |.               |\n"},
+      {5, sqlda(3, column(452, 10, "A", 1)),
+       "(damaged: SQLDA of 3 columns needs 184 bytes, it holds 72) (hex dump)"},
+      {5, sqlda(1, column(452, 10, "A", 31)),
+       "(damaged: SQLDA column 1 has a name of 31 bytes, at most 30 fit) (hex dump)"},
+      {19, timeValue(INT64_MAX, 0), in + "9223372036854775807 seconds 0 microseconds (no calendar time)\n"},
+      // Whole objects.
+      {1, Bytes("\xff", 1), in + "255\n"},
+      {1, le16(0xFFFE), in + "-2\n"},
+      {21, le32(16) + "\xaa", in + "16\n"},
+      {13, le16(0xFFFE), in + "65534\n"},
+      {16, le32(0xFFFFFFFF), in + "-1\n"},
+      {3, Bytes("a\nb", 4), in + "\"a" + in + "b\"\n"},
+      {2, "xyz", in + "\"xyz\"\n"},
+      {17, Bytes(4, '\0'), in + "FALSE\n"},
+      {17, Bytes("\0\1", 2), in + "TRUE\n"},
+      {18, le64(0x1234), in + "0x0000000000001234\n"},
+      {15, le16(3), in + "NULL pointer for object of type \"String\"\n"},
+      {15, le16(99), in + "NULL pointer for object of type \"UNKNOWN\"\n"},
+      {22, Bytes("\3", 1), in + "\"3\" equals KLPXQ_TODO_LOADDONE\n"},
+      {22, le32(9), in + "\"9\" equals KLPXQ_TODO_UNKNOWN\n"},
+      {19, timeValue(0, 5), in + "1970-01-01 00:00:00.000005\n"},
+      {4, Bytes(12, '\0') + le32(static_cast<uint32_t>(-204)),
+       "(hex dump)" + in + "00000000 00000000 00000000 34ffffff  |............4...|\n" + in +
+           "sqlcode: -204\n"},
+      {5, sqlda(2, column(485, 0x0207, "AMOUNT", 6) + column(452, 10, "NAME", 4)),
+       in + "SQLDA: numCols= 2\n                type  length  colname\n"
+            "                ----  ------  -------\n"
+            "                485   7 ,2    AMOUNT\n                452   10      NAME\n"},
+      {6, "", "\n"},
+      {6, "SELECT A FROM T", in + "SELECT A FROM T\n"},
+      {6, std::string(75, 'X') + " B", in + std::string(75, 'X') + " " + in + "B\n"},
+      {0, Bytes("AB\0\xff" "C", 5), "(hex dump)" + in + "414200ff 43                          |AB..C           |\n"},
+      {0, "", "(hex dump)\n"},
+      {30, "A", "(hex dump)" + in + "41                                   |A               |\n"},
+  };
+  for (const Case& c : cases) {
+    std::string got = object(c.type, c.data);
+    EXPECT_EQ(got.substr(0, c.expected.size()), c.expected) << "type " << c.type;
+  }
+  // -hex dumps every object, strings included.
+  EXPECT_EQ(object(3, "hi", true),
+            "(hex dump)" + in + "6869                                 |hi              |\n");
+}
+
+TEST_F(Formatter, StatementAndDescriptorListingsStopWhenFull) {
+  const std::string in = "\n         ";
+  Bytes tokens;
+  for (int i = 0; i < 8; ++i) tokens += "AAAAAAAAA ";
+  tokens.pop_back();
+  std::string six;
+  for (int i = 0; i < 6; ++i) six += "AAAAAAAAA ";
+  EXPECT_EQ(object(6, tokens), in + six + in + "AAAAAAAAA AAAAAAAAA\n");
+
+  std::string many;
+  for (int i = 0; i < 500; ++i) many += "AAAAAAAAAA ";  // lines of 76 characters
+  std::string listed = object(6, many);
+  EXPECT_LT(listed.size(), 4000u);
+  EXPECT_EQ(listed.substr(listed.size() - 15), "...buffer full\n");
+
+  Bytes columns;
+  for (int i = 0; i < 400; ++i) columns += column(452, 10, std::string(30, 'N'), 30);
+  std::string cols = object(5, sqlda(400, columns));
+  EXPECT_LT(cols.size(), 20000u);
+  EXPECT_EQ(cols.substr(cols.size() - 24), "         ...buffer full\n");
+}
+
+TEST_F(Formatter, ThreeStylesOfTwoThreads) {
+  Image im = twoThreads();
+  EXPECT_EQ(format(im, FMT),
+            "1        pid = 7, tid = 0x11000000 thr = worker one\n"
+            "         OrdList::putHead fnc_entry at time 1.000001\n\n"
+            "2        pid = 7, tid = 0x11000000 thr = worker one\n"
+            "         OrdList::putHead fnc_data \"first data     \" lvl 2\n"
+            "         Object 1 of type \"String\": \n         \"hello\"\n\n"
+            "3        pid = 7, tid = 0x22000000 thr = UNKNOWN THREAD1\n"
+            "         cmdsHandleMessage fnc_entry at time 1.000003\n\n"
+            "4        pid = 7, tid = 0x11000000 thr = worker one\n"
+            "         OrdList::putHead fnc_exit  at time 1.000004 with return code 5\n\n"
+            "5        pid = 7, tid = 0x22000000 thr = UNKNOWN THREAD1\n"
+            "         cmdsHandleMessage fnc_exit  at time 1.000005 \n\n"
+            "6        pid = 7, tid = 0x22000000 thr = UNKNOWN THREAD1\n"
+            "         UNKNOWN FUNCTION fnc_data \"x              \" lvl 3\n"
+            "         Object 1 of type \"Signed Integer\": \n         42\n\n");
+  EXPECT_EQ(format(im, FLW),
+            "pid = 7, tid = 0x11000000 thr = worker one\n"
+            "1        OrdList::putHead fnc_entry at time 1.000001\n"
+            "2        | OrdList::putHead fnc_data \"first data     \" lvl 2\n"
+            "4        OrdList::putHead fnc_exit  at time 1.000004 with return code 5\n\n"
+            "pid = 7, tid = 0x22000000 thr = UNKNOWN THREAD1\n"
+            "3        cmdsHandleMessage fnc_entry at time 1.000003\n"
+            "5        cmdsHandleMessage fnc_exit  at time 1.000005 \n"
+            "6        UNKNOWN FUNCTION fnc_data \"x              \" lvl 3\n\n");
+  EXPECT_EQ(format(im, V7), " hello\nx              \n");
+}
+
+TEST_F(Formatter, FiltersSelectRecords) {
+  Image im = twoThreads();
+  // Level 2 only: data of level 2; entries and exits need level 1.
+  EXPECT_EQ(format(im, FLW, 2),
+            "pid = 7, tid = 0x11000000 thr = worker one\n"
+            "2        OrdList::putHead fnc_data \"first data     \" lvl 2\n\n");
+  // A function override turns level 1 back on for that function alone.
+  std::string name = "CMDSHANDLEMESSAGE";
+  std::string flow = format(im, FLW, 2, {{name.c_str(), 1}});
+  EXPECT_NE(flow.find("3        cmdsHandleMessage fnc_entry"), std::string::npos) << flow;
+  EXPECT_EQ(flow.find("1        OrdList::putHead fnc_entry"), std::string::npos) << flow;
+
+  // Exits whose entries were overwritten: the flow indents from the
+  // smallest depth, so the first line has no indentation.
+  Image wrapped;
+  wrapped.add(2, 11, 3, 0x11, 1, timeValue(2, 1));
+  wrapped.add(2, 11, 2, 0x11, 1, timeValue(2, 2));
+  wrapped.add(1, 11, 4, 0x11, 1, timeValue(2, 3));
+  EXPECT_EQ(format(wrapped, FLW),
+            "pid = 7, tid = 0x11000000 thr = UNKNOWN THREAD1\n"
+            "1        | OrdList::putTail fnc_exit  at time 2.000001\n"
+            "2        OrdList::putHead fnc_exit  at time 2.000002\n"
+            "3        OrdList::getHead fnc_entry at time 2.000003\n\n");
+}
+
+TEST_F(Formatter, FullWidthFieldsStayWithinTheirFields) {
+  Image im;
+  trcBlockHeader* h = im.header();
+  memset(h->traceRelease.uniqueName, 'U', sizeof h->traceRelease.uniqueName);
+  memset(h->traceRelease.jobName, 'J', sizeof h->traceRelease.jobName);
+  im.nameThread(0x11, std::string(64, 'N'));
+  memset(h->threadTable[0x11].data, 'D', sizeof h->threadTable[0x11].data);
+  memset(h->threadTable[0x11].threadIdText, 'T', sizeof h->threadTable[0x11].threadIdText);
+  im.add(1, 11, 2, 0x11, 1, timeValue(1, 1));
+  Captured c;
+  trcFormatStyles(c.file(), im.image(), false, true, false, false);
+  std::string text = c.text();
+  for (const std::string& line :
+       {"  Unique Name:       " + std::string(161, 'U') + "\n  Arch Level:",
+        "  Job Name(Orl):     " + std::string(9, 'J') + "\n  Program",
+        std::string(64, 'T') + ", THREAD NAME:" + std::string(64, 'N') + "\nDATA:" +
+            std::string(80, 'D') + "\n-----------",
+        "thr = " + std::string(64, 'N') + "\n",
+        std::string("Application attached at: Thu Jan 01 1970 00:00:00 UTC\n")})
+    EXPECT_NE(text.find(line), std::string::npos) << line.substr(0, 30) << "\n" << text;
+}
