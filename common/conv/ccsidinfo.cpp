@@ -1,6 +1,9 @@
 // What the product knows about each CCSID: its character and companion
 // CCSIDs, and which ones are pure double-byte.
+#include <unicode/ucnv.h>
+
 #include <cstddef>
+#include <cstdio>
 #include <cstdint>
 
 #include "common/conv/convmgr.h"
@@ -75,11 +78,21 @@ const Pair* findPair(const Pair (&list)[N], uint32_t ccsid) {
   return nullptr;
 }
 
+// ICU's own name of the table for a CCSID, kept for the process: ICU's
+// alias data may be released by a cleanup of the conversion manager.
+const char* icuTableName(const char* alias, char (&keep)[48]) {
+  UErrorCode err = U_ZERO_ERROR;
+  const char* n = ucnv_getAlias(alias, 0, &err);
+  snprintf(keep, sizeof keep, "%s", U_SUCCESS(err) && n ? n : "unknown");
+  return keep;
+}
+
 const char* converterName(uint32_t ccsid) {
+  static char n37[48], n500[48], n1047[48];
   switch (ccsid) {
-    case 37: return "ibm-37_P100-1995";
-    case 500: return "ibm-500_P100-1995";
-    case 1047: return "ibm-1047_P100-1995";
+    case 37: { static const char* n = icuTableName("cp037", n37); return n; }
+    case 500: { static const char* n = icuTableName("cp500", n500); return n; }
+    case 1047: { static const char* n = icuTableName("cp1047", n1047); return n; }
     case 1208: return "UTF-8";
     default: return "unknown";
   }

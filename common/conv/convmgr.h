@@ -9,8 +9,13 @@
 // after every conversion.
 #pragma once
 
+#include <unicode/ucnv.h>
+
 #include <cstddef>
 #include <cstdint>
+
+// ICU's platform of CCSID numbers (platform 0): tables are opened by number.
+constexpr UConverterPlatform kCcsidPlatform = static_cast<UConverterPlatform>(0);
 
 struct UConverter;
 

@@ -24,7 +24,7 @@ const std::vector<char>& ebcdicValue() {
     while (text.size() < kValueBytes) text += "Zoë's café order #42: crème brûlée, 3 × ½ kg. ";
     UErrorCode err = U_ZERO_ERROR;
     std::vector<char> out(kValueBytes * 2);
-    int32_t n = ucnv_convert("ibm-37", "UTF-8", out.data(), static_cast<int32_t>(out.size()),
+    int32_t n = ucnv_convert("cp037", "UTF-8", out.data(), static_cast<int32_t>(out.size()),
                              text.data(), static_cast<int32_t>(text.size()), &err);
     out.resize(static_cast<size_t>(n));
     out.resize(kValueBytes);
@@ -50,7 +50,7 @@ void BM_Cpcvc(benchmark::State& state) {
 void BM_IcuConvertEx(benchmark::State& state) {
   const std::vector<char>& in = ebcdicValue();
   UErrorCode err = U_ZERO_ERROR;
-  UConverter* src = ucnv_openCCSID(37, UCNV_IBM, &err);
+  UConverter* src = ucnv_openCCSID(37, kCcsidPlatform, &err);
   UConverter* tgt = ucnv_open("UTF-8", &err);
   UChar pivot[1024];
   char out[4 * kValueBytes];
@@ -71,9 +71,9 @@ void BM_IcuConvertEx(benchmark::State& state) {
 
 void BM_Iconv(benchmark::State& state) {
   const std::vector<char>& in = ebcdicValue();
-  iconv_t cd = iconv_open("UTF-8", "IBM037");
+  iconv_t cd = iconv_open("UTF-8", "CP037");
   if (cd == reinterpret_cast<iconv_t>(-1)) {
-    state.SkipWithError("iconv has no IBM037");
+    state.SkipWithError("iconv has no CP037");
     return;
   }
   char out[4 * kValueBytes];

@@ -73,25 +73,25 @@ TEST(ConvMgr, ConvertsRealDataAsIcuDoesDirectly) {
     int graphic;
   };
   const Row rows[] = {
-      {"EBCDIC 37 with accents", 37, 1208, "ibm-37", "UTF-8",
+      {"EBCDIC 37 with accents", 37, 1208, "cp037", "UTF-8",
        {0xC8, 0x85, 0x93, 0x93, 0x96, 0x6B, 0x40, 0x63, 0xEC, 0xFC, 0x5A}, {}, 0},
-      {"UTF-8 with a bad byte and a cut sequence", 1208, 37, "UTF-8", "ibm-37",
+      {"UTF-8 with a bad byte and a cut sequence", 1208, 37, "UTF-8", "cp037",
        {'G', 'r', 0xC3, 0xBC, 0xC3, 0x9F, 0xFF, 'e', 0xE2, 0x82}, {}, 0},
-      {"930 mixed", 930, 1208, "ibm-930", "UTF-8",
+      {"930 mixed", 930, 1208, "cp930", "UTF-8",
        {0xC1, 0x0E, 0x42, 0xC1, 0x42, 0xC2, 0x0F, 0xF1}, {}, 0},
-      {"939 mixed, shift-out never closed", 939, 1208, "ibm-939", "UTF-8",
+      {"939 mixed, shift-out never closed", 939, 1208, "cp939", "UTF-8",
        {0x81, 0x0E, 0x42, 0xC1, 0x42}, {}, 0},
-      {"939 shift-in without shift-out", 939, 1208, "ibm-939", "UTF-8", {0x81, 0x0F, 0x82}, {}, 0},
-      {"933 broken: closed as if a shift-in ended it", 933, 1208, "ibm-933", "UTF-8",
+      {"939 shift-in without shift-out", 939, 1208, "cp939", "UTF-8", {0x81, 0x0F, 0x82}, {}, 0},
+      {"933 broken: closed as if a shift-in ended it", 933, 1208, "cp933", "UTF-8",
        {0xC1, 0x0E, 0x42, 0xC1}, {0xC1, 0x0E, 0x42, 0xC1, 0x0F}, 0},
-      {"930 graphic gets its shift bytes", 930, 1208, "ibm-930", "UTF-8",
+      {"930 graphic gets its shift bytes", 930, 1208, "cp930", "UTF-8",
        {0x42, 0xC1, 0x42, 0xC2}, {0x0E, 0x42, 0xC1, 0x42, 0xC2, 0x0F}, 1},
-      {"UTF-8 to 939 adds shift bytes", 1208, 939, "UTF-8", "ibm-939",
+      {"UTF-8 to 939 adds shift bytes", 1208, 939, "UTF-8", "cp939",
        {'a', 0xEF, 0xBC, 0xA1, 'b'}, {}, 0},
       {"UTF-16 to UTF-8", 1200, 1208, "UTF-16LE", "UTF-8",
        {'Z', 0, 0xFC, 0, 0xAC, 0x20, 0x3D, 0xD8, 0x00, 0xDE}, {}, 0},
-      {"EBCDIC 37 to UTF-16", 37, 1200, "ibm-37", "UTF-16LE", {0xC1, 0x63, 0x40}, {}, 0},
-      {"UTF-8 to 933", 1208, 933, "UTF-8", "ibm-933", {'k', 0xEA, 0xB0, 0x80, 'x'}, {}, 0},
+      {"EBCDIC 37 to UTF-16", 37, 1200, "cp037", "UTF-16LE", {0xC1, 0x63, 0x40}, {}, 0},
+      {"UTF-8 to 933", 1208, 933, "UTF-8", "cp933", {'k', 0xEA, 0xB0, 0x80, 'x'}, {}, 0},
   };
   LogFile log;
   ConvMgr m(4);
@@ -242,7 +242,7 @@ TEST(ConvMgr, CcsidAttributes) {
     const char* name = nullptr;
     getCcsidInfo(ccsid, nullptr, nullptr, &name);
     UErrorCode err = U_ZERO_ERROR;
-    UConverter* c = ucnv_openCCSID(static_cast<int32_t>(ccsid), UCNV_IBM, &err);
+    UConverter* c = ucnv_openCCSID(static_cast<int32_t>(ccsid), kCcsidPlatform, &err);
     EXPECT_STREQ(name, ccsid == 930 ? "unknown" : ucnv_getName(c, &err)) << ccsid;
     ucnv_close(c);
   }
@@ -256,7 +256,13 @@ TEST(ConvMgr, ListNamesAndTheEndOfTheProcessState) {
   EXPECT_STREQ(buf, "No converters in the list.\n\n");
   const char* name = nullptr;
   ASSERT_EQ(m.getName(37, &name, 0), 0);
-  EXPECT_STREQ(name, "ibm-37_P100-1995");
+  {  // ICU's name of a table for CCSID 37
+    UErrorCode err = U_ZERO_ERROR;
+    UConverter* c = ucnv_open(name, &err);
+    ASSERT_TRUE(U_SUCCESS(err)) << name;
+    EXPECT_EQ(ucnv_getCCSID(c, &err), 37) << name;
+    ucnv_close(c);
+  }
   ASSERT_EQ(m.getName(1208, &name, 0), 0);
   m.printList(buf, sizeof buf);
   EXPECT_STREQ(buf, "List: 37 1208 \n");

@@ -69,26 +69,24 @@ int guardUnlock() {
   return 0;
 }
 
-// The ICU converter name for CCSIDs that need a particular table; null
-// for those opened by CCSID.
-const char* icuNameFor(uint32_t ccsid) {
+// The CCSID whose ICU table serves a CCSID that needs a particular one;
+// the CCSID itself otherwise. Every table is opened by number.
+uint32_t tableFor(uint32_t ccsid) {
   switch (ccsid) {
-    case 300: case 4396: return "ibm-16684";
-    case 834: case 933: return "ibm-933";
-    case 301: case 932: case 942: return "ibm-942";
-    case 897: case 941: case 943: case 1351: case 5039: return "ibm-943";
-    case 949: case 951: return "ibm-949";
-    case 947: case 950: case 1114: return "ibm-950";
-    case 954: return "ibm-33722";
-    case 964: return "ibm-964";
-    case 970: case 971: return "ibm-970";
-    case 1362: case 1363: return "ibm-1363";
-    case 1370: case 1373: return "ibm-1373_P100-2002";
-    case 1380: case 1381: return "ibm-1381";
-    case 1382: case 1383: return "ibm-1383";
-    case 1385: case 1386: return "ibm-1386";
-    case 1392: return "ibm-1392";
-    default: return nullptr;
+    case 300: case 4396: return 16684;
+    case 834: case 933: return 933;
+    case 301: case 932: case 942: return 942;
+    case 897: case 941: case 943: case 1351: case 5039: return 943;
+    case 949: case 951: return 949;
+    case 947: case 950: case 1114: return 950;
+    case 954: return 33722;
+    case 970: case 971: return 970;
+    case 1362: case 1363: return 1363;
+    case 1370: case 1373: return 1373;  // its only table, version "_P100-2002"
+    case 1380: case 1381: return 1381;
+    case 1382: case 1383: return 1383;
+    case 1385: case 1386: return 1386;
+    default: return ccsid;
   }
 }
 
@@ -128,9 +126,7 @@ int ConvMgr::openConverter(uint32_t ccsid, UConverter** conv, int encoding) {
     }
   }
   if (!*conv) {
-    const char* name = icuNameFor(ccsid);
-    *conv = name ? ucnv_open(name, &err)
-                 : ucnv_openCCSID(static_cast<int32_t>(ccsid), UCNV_IBM, &err);
+    *conv = ucnv_openCCSID(static_cast<int32_t>(tableFor(ccsid)), kCcsidPlatform, &err);
   }
   trcData(kTrcComp, kFnOpen, "ICU return code", 2, 0, 4, &err);
   int rc = 0;

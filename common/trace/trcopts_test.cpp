@@ -67,13 +67,13 @@ TEST(TraceOptions, ComplaintsEndParsingOrGoOn) {
 
 TEST(TraceOptions, ValuesAndLevels) {
   Parsed p = parse({"ON", "Fmt", "-Db", "sample", "-kcap", "-b", "3m", "-fs", "3000000000", "-o",
-                    "1,3", "-schema", "asn", "dmp", "/tmp/x"});
+                    "1,3", "-schema", "qa", "dmp", "/tmp/x"});
   EXPECT_FALSE(p.o.error) << p.said;
   EXPECT_EQ(p.said, "File size adjusted to 2147483647\n");
   EXPECT_TRUE(p.o.on && p.o.fmt && p.o.dmp);
   EXPECT_EQ(std::string(p.o.dbName), "sample");
   EXPECT_EQ(std::string(p.o.kind), "KCAP");
-  EXPECT_EQ(std::string(p.o.schema), "asn");
+  EXPECT_EQ(std::string(p.o.schema), "qa");
   EXPECT_EQ(std::string(p.o.fileName), "/tmp/x");
   EXPECT_EQ(p.o.bufferSize, 3145728u);
   EXPECT_EQ(p.o.outLevel, 5);
