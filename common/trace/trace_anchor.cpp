@@ -29,8 +29,13 @@ void setState(uint32_t state) {
   __atomic_store_n(&g_trcAnchorStorage.state, state, __ATOMIC_SEQ_CST);
 }
 
+// A caller may pass the anchor's own keys: the copy must survive src being
+// dst itself.
 void copyKey(char (&dst)[TRC_KEY_SIZE], const char* src) {
-  snprintf(dst, sizeof dst, "%s", src != nullptr ? src : "");
+  if (src == nullptr) src = "";
+  size_t n = strnlen(src, TRC_KEY_SIZE - 1);
+  memmove(dst, src, n);
+  dst[n] = '\0';
 }
 
 // "<key part 1><key part 2>.TRC"; false when it does not fit.

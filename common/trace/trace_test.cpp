@@ -82,14 +82,20 @@ Walk walk(const trcBlockHeader* h, size_t size, bool fromFile) {
   return w;
 }
 
-// A trace block of this process, created as the trace command does.
+// A trace block of this process, created as the trace command does, from
+// the keys the anchor already holds.
 struct Trace {
   klptest::TmpDir dir;
   Trace(uint32_t size = TRC_MIN_SIZE, const std::string& file = "", uint32_t fileSize = TRC_MAX_SIZE,
         uint16_t filter = 0x3F) {
     trcInitAnchor();
-    EXPECT_EQ(0, trcCreate(size, dir.path().c_str(), kKey, file.empty() ? nullptr : file.c_str(),
+    trcAnchor* a = trcGetAnchor();
+    snprintf(a->keyPart1, TRC_KEY_SIZE, "%s", dir.path().c_str());
+    snprintf(a->keyPart2, TRC_KEY_SIZE, "%s", kKey);
+    EXPECT_EQ(0, trcCreate(size, a->keyPart1, a->keyPart2, file.empty() ? nullptr : file.c_str(),
                            fileSize, filter, true));
+    EXPECT_EQ(dir.path(), a->keyPart1);
+    EXPECT_STREQ(kKey, a->keyPart2);
   }
   ~Trace() {
     trcFree();

@@ -37,10 +37,7 @@ struct Run {
   trcOptions o;
   trcAnchor* anchor;
   bool standalone;
-  // The keys, kept apart from the anchor's copies: the attachment functions
-  // copy them into the anchor.
-  char keyPart1[TRC_KEY_SIZE];
-  char keyPart2[TRC_KEY_SIZE];
+  char keyPart2[TRC_KEY_SIZE];  // built from the options; key part 1 is the anchor's
   bool formatted;  // the -d and -df were used up by formatting
 };
 
@@ -100,10 +97,10 @@ bool attachBlock(Run* r) {
   if (a->block != nullptr) return true;
   HSVHIPCMemory* memory = nullptr;
   trcBlockHeader* block = nullptr;
-  hsvRC rc = trcOpenBlock(r->keyPart1, r->keyPart2, &memory, &block);
+  hsvRC rc = trcOpenBlock(a->keyPart1, r->keyPart2, &memory, &block);
   if (rc == ECF_NOT_FOUND) return true;
   if (rc != ECF_OK) {
-    char* key = trcKeyText(r->keyPart1, r->keyPart2);
+    char* key = trcKeyText(a->keyPart1, r->keyPart2);
     fprintf(trcOut(), "Function 'HSVHIPCMemory::attach' with IPC key '%s' failed with HSVE reason "
             "'%s'.\n", key != nullptr ? key : "UNKNOWN", ecfErrorGetDescription(rc));
     free(key);
@@ -130,11 +127,12 @@ bool attachBlock(Run* r) {
 }
 
 void turnOn(Run* r) {
+  trcAnchor* a = r->anchor;
   FILE* out = trcOut();
   const trcOptions& o = r->o;
-  int rc = trcCreate(o.bufferSize, r->keyPart1, r->keyPart2, o.fileName, o.maxFileSize,
+  int rc = trcCreate(o.bufferSize, a->keyPart1, r->keyPart2, o.fileName, o.maxFileSize,
                      o.logLevel, r->standalone);
-  char* key = trcKeyText(r->keyPart1, r->keyPart2);
+  char* key = trcKeyText(a->keyPart1, r->keyPart2);
   if (rc != 0) {
     fprintf(out, "Trace failed to start with return code %d.\n", rc);
     fprintf(out, "Key token was '%s'\n", r->keyPart2);
@@ -148,7 +146,7 @@ void turnOn(Run* r) {
     fputs("Trace is turned on, but an error occurred retrieving IPC key.\n", out);
   free(key);
   // The keeper starts the process that holds the block and ends at once.
-  const char* argv[] = {kKeeper, r->keyPart1, r->keyPart2, nullptr};
+  const char* argv[] = {kKeeper, a->keyPart1, r->keyPart2, nullptr};
   int32_t pid = 0;
   int exitCode = -1;
   if (hsvStartProcess(kKeeper, argv, &pid) != ECF_OK || hsvWaitProcess(pid, &exitCode) != ECF_OK ||
@@ -279,7 +277,7 @@ void runAction(Run* r) {
     } else {
       fputs("Trace is already on, no action taken.\n", out);
     }
-    if (r->standalone) _trcSendIPCMsg(r->keyPart1, r->keyPart2, 10);
+    if (r->standalone) _trcSendIPCMsg(a->keyPart1, r->keyPart2, 10);
   } else if (o.off) {
     turnOff(r);
   } else if (o.kill) {
@@ -336,8 +334,7 @@ bool checkKeys(Run* r) {
 void run(Run* r) {
   trcAnchor* a = r->anchor;
   trcOptions& o = r->o;
-  copyKey(r->keyPart1, getEnvIPCDir(klpGetEnv()));
-  copyKey(a->keyPart1, r->keyPart1);
+  copyKey(a->keyPart1, getEnvIPCDir(klpGetEnv()));
   if (o.outFileName != nullptr) openOutputFile(r);
   if (o.help) return trcUsage();
   if (o.listsymbols) return trcListSymbols();
