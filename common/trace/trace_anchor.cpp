@@ -4,9 +4,6 @@
 // printable key and the trace-on notice to a server.
 #include "common/trace/trace_anchor.h"
 
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <new>
 #include <cstdio>
@@ -43,18 +40,6 @@ bool blockPath(const char* keyPart1, const char* keyPart2, char (&path)[2 * TRC_
   int n = snprintf(path, sizeof path, "%s%s.TRC", keyPart1 ? keyPart1 : "",
                    keyPart2 ? keyPart2 : "");
   return n > 0 && static_cast<size_t>(n) < sizeof path;
-}
-
-// Only a block of this user, readable and writable by nobody else, is used:
-// another user's block could feed a server's trace points anything. The
-// platform names shared memory under /dev/shm.
-hsvRC checkOwner(const HSVResID& id) {
-  char path[64];
-  snprintf(path, sizeof path, "/dev/shm%.*s", static_cast<int>(sizeof id.part2), id.part2);
-  struct stat st {};
-  if (stat(path, &st) != 0) return ECF_NOT_FOUND;
-  if (st.st_uid != geteuid() || (st.st_mode & 0777) != 0600) return ECF_ACCESS_DENIED;
-  return ECF_OK;
 }
 
 void copyModules(trcBlockHeader* b, const klpModuleList* list) {
@@ -99,8 +84,7 @@ hsvRC trcOpenBlock(const char* keyPart1, const char* keyPart2, HSVHIPCMemory** m
   if (rc != ECF_OK) return rc;
   HSVHIPCMemory* m = new (std::nothrow) HSVHIPCMemory;
   if (m == nullptr) return ECF_NO_MEMORY;
-  rc = m->attach(id);
-  if (rc == ECF_OK) rc = checkOwner(id);
+  rc = m->attach(id);  // refuses a block of another user or open to others
   if (rc == ECF_OK && (m->getAddress() == nullptr || m->getSize() < TRC_HEADER_SIZE))
     rc = ECF_INVALID_ARGUMENT;
   if (rc != ECF_OK) {

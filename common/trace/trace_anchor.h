@@ -43,8 +43,9 @@ void trcFree();
 // detaches the handle. The anchor's state is left to the caller.
 void trcDropBlock(bool destroy);
 
-// Opens the existing block of the two key parts: derives its id, attaches,
-// and checks that it is this user's, mode 0600, and at least a header long.
+// Opens the existing block of the two key parts: derives its id, attaches
+// (the platform refuses a block of another user or open to others), and
+// checks that it is at least a header long.
 // ECF_OK with *memory and *block set; ECF_NOT_FOUND when there is none;
 // another platform code when it exists but may not be used.
 hsvRC trcOpenBlock(const char* keyPart1, const char* keyPart2, HSVHIPCMemory** memory,
