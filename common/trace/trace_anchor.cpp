@@ -19,6 +19,7 @@ namespace {
 
 trcAnchor* g_anchor = nullptr;  // the process-wide pointer; null until initialised
 int64_t g_stopSeenAt = 0;       // when trcCheckStop first saw the block Stop
+bool g_application = false;     // this process is the traced server (trcDeclareApplication)
 
 trcAnchor& anchor() { return g_trcAnchorStorage; }
 
@@ -49,15 +50,17 @@ void copyModules(trcBlockHeader* b, const klpModuleList* list) {
   b->moduleCount = static_cast<uint16_t>(n);
 }
 
-// Lets go of the block after the anchor stopped tracing: not application-
-// attached any more, then destroyed when it is Stop, detached otherwise.
+// Lets go of the block after the anchor stopped tracing. The traced
+// application withdraws its mark; a Stop block is then destroyed unless the
+// application still holds it (it frees the block itself), detached otherwise.
 void leaveBlock() {
   trcBlockHeader* b = anchor().block;
   if (b == nullptr) return;
   trcLockBuffer(b);
-  b->appAttached = 0;
+  if (g_application) b->appAttached = 0;
+  bool held = b->appAttached == TRC_APP_ATTACHED;
   trcUnlockBuffer(b);
-  trcDropBlock(b->status == TRC_STATE_STOP);
+  trcDropBlock(b->status == TRC_STATE_STOP && !held);
 }
 
 }  // namespace
@@ -68,7 +71,18 @@ void trcInitAnchor() {
   g_anchor->state = TRC_STATE_INITIAL;
   g_anchor->pid = hsvProcessID();
   g_stopSeenAt = 0;
+  g_application = false;
   trcint::prepareWriters();
+}
+
+void trcDeclareApplication() { g_application = true; }
+
+void trcStartTracing(trcBlockHeader* block) {
+  if (g_application) {
+    if (trcThreadTablesInUse()) trcCopyThreadTables(block);
+    block->appAttached = TRC_APP_ATTACHED;
+  }
+  setState(TRC_STATE_RUNNING);
 }
 
 trcAnchor* trcGetAnchor() { return g_anchor; }
@@ -137,13 +151,13 @@ int trcAttach(const char* keyPart1, const char* keyPart2, const klpAppVersion* a
   }
   copyKey(a.keyPart1, keyPart1);
   copyKey(a.keyPart2, keyPart2);
-  trcLockBuffer(b);
-  if (appVersion != nullptr) memcpy(&b->appVersion, appVersion, sizeof b->appVersion);
-  if (moduleList != nullptr) copyModules(b, moduleList);
-  trcUnlockBuffer(b);
-  if (trcThreadTablesInUse()) trcCopyThreadTables(b);
-  b->appAttached = TRC_APP_ATTACHED;
-  setState(TRC_STATE_RUNNING);
+  if (g_application) {  // the block describes the traced program only
+    trcLockBuffer(b);
+    if (appVersion != nullptr) memcpy(&b->appVersion, appVersion, sizeof b->appVersion);
+    if (moduleList != nullptr) copyModules(b, moduleList);
+    trcUnlockBuffer(b);
+  }
+  trcStartTracing(b);
   return 0;
 }
 
@@ -232,7 +246,7 @@ int trcCreate(uint32_t bufferSize, const char* keyPart1, const char* keyPart2,
     trcCopyThreadTables(b);
   else
     trcClearThreadTables(b);
-  if (!standalone) b->appAttached = TRC_APP_ATTACHED;
+  if (!standalone && g_application) b->appAttached = TRC_APP_ATTACHED;
 
   snprintf(b->traceRelease.programName, sizeof b->traceRelease.programName, "%s",
            TRC_RELEASE_NAME);

@@ -116,9 +116,7 @@ bool attachBlock(Run* r) {
       dropBlock(a, false);
       return false;
     }
-    if (trcThreadTablesInUse()) trcCopyThreadTables(block);
-    if (!r->standalone) block->appAttached = TRC_APP_ATTACHED;
-    __atomic_store_n(&a->state, TRC_STATE_RUNNING, __ATOMIC_SEQ_CST);
+    trcStartTracing(block);
   } else if (!r->standalone) {
     // A server leaves a block that is not running as its detach would.
     trcDetach();

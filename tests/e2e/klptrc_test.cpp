@@ -178,6 +178,15 @@ TEST(Klptrc, ServerTracedFromItsStart) {
   EXPECT_TRUE(has(trc(std::vector<std::string>{"clr", "stat"} + keys(srv)).out, ""));
   EXPECT_TRUE(has(trc(std::vector<std::string>{"stat"} + keys(srv)).out, "Num Entries: 0\n"));
 
+  // The command program traces into the block while it runs and leaves the
+  // server's hold on it, and its description, alone.
+  auto status = [&] {
+    return klptest::run({klptest::binPath("klpkccmd"), "CAPTURE_SERVER=" + srv, "STATUS"});
+  };
+  ASSERT_EQ(status().exitCode, 0);
+  EXPECT_TRUE(has(trc(std::vector<std::string>{"stat"} + keys(srv)).out,
+                  "Replication version info:\n  klpkcap 9.7.8\n"));
+
   // Off while the server holds the block leaves the freeing to it.
   std::string off = trc(std::vector<std::string>{"off"} + keys(srv)).out;
   EXPECT_EQ(off,
@@ -185,6 +194,7 @@ TEST(Klptrc, ServerTracedFromItsStart) {
             "application will free the trace buffer while it is running or when it is "
             "restarted.\nUse the klptrc \"kill\" option to free the trace buffer, if the \"KCAP\" "
             "application is stopped.\n");
+  ASSERT_EQ(status().exitCode, 0);  // finds the block turned off
   EXPECT_TRUE(klptest::memoryExists(blockPath(dir, srv)));
   EXPECT_TRUE(e2e::waitFor([&] { return !keeperRunning(dir); }, 10000));
   ASSERT_TRUE(c.ask(14, &r));
