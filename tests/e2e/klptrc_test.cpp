@@ -150,6 +150,8 @@ TEST(Klptrc, ServerTracedFromItsStart) {
   EXPECT_TRUE(has(stat, "Module-level version information:\n  name           apar      compiled\n"));
   std::string flow = trc(std::vector<std::string>{"flw"} + keys(srv)).out;
   EXPECT_GE(e2e::countOf(flow, "\npid = "), 2u) << flow;  // records of two threads at least
+  EXPECT_TRUE(has(flow, " thr = AdminThread\n")) << flow;   // the threads are named
+  EXPECT_TRUE(has(flow, " thr = Initial\n")) << flow;
   EXPECT_TRUE(has(flow, "| cmdsHandleMessage fnc_data \"Got IPC Message\" lvl 3\n")) << flow;
 
   std::string dump = dir.path() + "dump.trc";
