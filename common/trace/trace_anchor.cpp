@@ -262,6 +262,7 @@ int trcCreate(uint32_t bufferSize, const char* keyPart1, const char* keyPart2,
 
   b->dataOffset = TRC_HEADER_SIZE;
   b->writeOffset = b->oldestOffset = b->highWaterOffset = b->entryCount = 0;
+  b->fileFull = 0;
   b->bufferSize = bufferSize;
   b->maxFileSize = maxFileSize;
   b->globalFilter = globalFilter;

@@ -290,30 +290,32 @@ TEST(TraceWriter, WrapKeepsTheNewestRecords) {
   for (size_t i = 0; i < w.records.size(); ++i) EXPECT_EQ(1254 + static_cast<int>(i), w.records[i].value());
 }
 
-// The last lap of a direct-to-file trace, as turning the trace off writes it.
-void flushLastLap(trcBlockHeader* b) {
-  std::vector<uint8_t> copy(b->bufferSize);
-  trcLockBuffer(b);
-  memcpy(copy.data(), b, copy.size());
-  trcUnlockBuffer(b);
-  trcFlushToFile(reinterpret_cast<trcBlockHeader*>(copy.data()), true);
-}
-
 TEST(TraceWriter, DirectToFileLosesNothingUntilItsLimit) {
   struct Row {
     uint32_t fileSize;
     int written, kept;
+    bool said;  // the file was reported full (once)
   };
-  // Each wrap appends one full lap of 746 records; three laps fit 131072,
-  // and the last 500 records (24000 bytes) do not fit what is left.
-  for (const Row& row : std::vector<Row>{{TRC_MAX_SIZE, 5000, 5000}, {TRC_MIN_SIZE, 4230, 2238}}) {
-    SCOPED_TRACE(row.fileSize);
+  // Each wrap appends one full lap of 746 records (35808 bytes); three laps
+  // fit 131072, and 23648 bytes are left. The last lap (turning the trace
+  // off) holds the rest: 500 records (24000 bytes) do not fit what is left,
+  // 100 would, but after the laps refused before them.
+  for (const Row& row : std::vector<Row>{
+           {TRC_MAX_SIZE, 5000, 5000, false},
+           {TRC_MIN_SIZE, 4230, 2238, true},
+           {TRC_MIN_SIZE, 3830, 2238, true}}) {
+    SCOPED_TRACE(row.written);
     klptest::TmpDir files;
     std::string path = files.path() + "direct.trc";
     {
       Trace t(TRC_MIN_SIZE, path, row.fileSize);
+      Said said;
       for (int v = 0; v < row.written; ++v) put(v);
-      flushLastLap(t.b());
+      trcFlushLastLap(t.b());
+      EXPECT_EQ(row.said ? "Trace file \"" + path + "\" has reached its maximum size of 131072 "
+                           "bytes, no more records are written to it.\n"
+                         : "",
+                said.text());
     }
     trcBlockHeader header;
     ASSERT_EQ(TRC_READ_OK, trcReadFileHeader(path.c_str(), &header));

@@ -152,25 +152,6 @@ void turnOn(Run* r) {
     fputs("Create Process failed!!\n", out);
 }
 
-// Writes the block to its trace file one last time.
-void lastFlush(trcBlockHeader* block, size_t size) {
-  trcLockBuffer(block);
-  trcBlockHeader* copy = static_cast<trcBlockHeader*>(malloc(size));
-  if (copy != nullptr) {
-    memcpy(copy, block, size);
-    trcLockFile(block);
-    trcUnlockBuffer(block);
-    trcFlushToFile(copy, false);
-    trcUnlockFile(block);
-    free(copy);
-    return;
-  }
-  trcLockFile(block);
-  trcFlushToFile(block, false);
-  trcUnlockFile(block);
-  trcUnlockBuffer(block);
-}
-
 void turnOff(Run* r) {
   trcAnchor* a = r->anchor;
   FILE* out = trcOut();
@@ -183,7 +164,7 @@ void turnOff(Run* r) {
   block->status = TRC_STATE_STOP;
   trcUnlockBuffer(block);
   fputs("Trace is turned off.\n", out);
-  if (block->fileName[0] != '\0') lastFlush(block, a->memory->getSize());
+  if (block->fileName[0] != '\0') trcFlushLastLap(block);
   if (block->appAttached == 0) {
     trcFree();
   } else if (r->standalone) {
