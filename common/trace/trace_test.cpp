@@ -15,7 +15,9 @@
 #include "common/trace/trace.h"
 #include "common/trace/trace_anchor.h"
 #include "common/trace/trcread.h"
+#include "common/trace/trcsymbols.h"
 #include "common/trace/trcwrite.h"
+#include "common/util/klpfmt.h"
 #include "tests/testing/klptest.h"
 
 namespace {
@@ -209,6 +211,7 @@ TEST(TraceWriter, WhatARecordHolds) {
     int records, type;
     std::vector<std::pair<int, std::string>> objects;
     const char* name;
+    const char* function = nullptr;  // the symbol row the first record names
   };
   const int str = TRC_OBJ_STRING;
   auto none = [](trcBlockHeader*) {};
@@ -248,6 +251,9 @@ TEST(TraceWriter, WhatARecordHolds) {
       {"a record as large as the data area fits an empty buffer", none,
        [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 44, big.data()); }, 0x3F, 1,
        TRC_REC_DATA, {{TRC_OBJ_RAW, big}}, "big            "},
+      {"a library routine's points name its own row", none,
+       [] { return static_cast<uint32_t>(compareIgnTransCriteria("A%C", "ABBC")); }, 1, 2,
+       TRC_REC_ENTRY, {}, nullptr, "compareIgnTransCriteria"},
       {"one byte more is never written", none,
        [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 43, big.data()); }, 0x3F, 0,
        0, {}, ""},
@@ -267,6 +273,9 @@ TEST(TraceWriter, WhatARecordHolds) {
     EXPECT_EQ(hsvProcessID(), r.pid);
     if (row.name != nullptr) {
       EXPECT_EQ(std::string(row.name) + '\0', r.name);
+    }
+    if (row.function != nullptr) {
+      EXPECT_STREQ(row.function, trcFunctionName(r.component, r.function));
     }
   }
 

@@ -167,7 +167,8 @@ TEST(Klptrc, ServerTracedFromItsStart) {
   std::string json = trc({"json", "-fn", moved, "-d", "1"}).out;
   EXPECT_EQ(json.substr(0, 39), "{\"displayTimeUnit\":\"ms\",\"traceEvents\":[");
   EXPECT_EQ(json.substr(json.size() - 4), "\n]}\n");
-  EXPECT_TRUE(has(json, "{\"name\":\"cmdsHandleMessage\",\"cat\":\"XKAPP Browser\",\"ph\":\"B\""));
+  EXPECT_TRUE(has(json, "{\"name\":\"cmdsHandleMessage\",\"cat\":\"Capture/Apply Common Function\","
+                        "\"ph\":\"B\""));
   EXPECT_FALSE(has(json, "\"ph\":\"i\""));  // level 1 only: no data records
 
   // Filters change while the trace runs; diag shows them.
@@ -176,7 +177,7 @@ TEST(Klptrc, ServerTracedFromItsStart) {
   EXPECT_EQ(trc(std::vector<std::string>{"diag"} + keys(srv)).out,
             "\nDiag Settings\n=============\nGlobal filter = 2\n"
             "Component: \"Capture Prune\" = 4\n"
-            "Component: \"XKAPP Browser\"\n Function: \"cmdsEngine\" = 1\n\n");
+            "Component: \"Capture/Apply Common Function\"\n Function: \"cmdsEngine\" = 1\n\n");
   EXPECT_TRUE(has(trc(std::vector<std::string>{"clr", "stat"} + keys(srv)).out, ""));
   EXPECT_TRUE(has(trc(std::vector<std::string>{"stat"} + keys(srv)).out, "Num Entries: 0\n"));
 
