@@ -1,6 +1,8 @@
 // The trace writer, its reader and the attachment of a process to a block:
-// damaged images first, then what the writer keeps and drops.
+// damaged images first, then what the writer keeps and drops; last, the
+// trace command called inside the server and short of memory.
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -18,7 +20,12 @@
 #include "common/trace/trcsymbols.h"
 #include "common/trace/trcwrite.h"
 #include "common/util/klpfmt.h"
+#include "include/klptrc.h"
 #include "tests/testing/klptest.h"
+
+// A process short of memory gets null from malloc, as it does without the
+// address sanitizer, whose default is to end the process instead.
+extern "C" const char* __asan_default_options() { return "allocator_may_return_null=1"; }
 
 namespace {
 
@@ -592,6 +599,81 @@ TEST(TraceAttach, TurnedOffStopsWritingAtTheNextCheck) {
   });
   EXPECT_EQ(0, c.exitCode) << c.out << c.err;
   EXPECT_EQ(1u, t.read().records.size());
+}
+
+// Leaves this process `spare` bytes of private memory beyond what it maps
+// now, as a machine short of memory would; shared memory does not count.
+void leaveOnly(rlim_t spare) {
+  std::string status = klptest::readFile("/proc/self/status");
+  rlim_t used = std::stoull(status.substr(status.find("VmData:") + 7)) * 1024;
+  rlimit limit{used + spare, used + spare};
+  ASSERT_EQ(0, setrlimit(RLIMIT_DATA, &limit));
+}
+
+TEST(TraceCommand, InsideTheServerOrShortOfMemory) {
+  struct Row {
+    const char* what;
+    bool server;    // called in the traced server (declared, attached unless turned off)
+    bool stopped;   // the block was turned off before
+    bool short_;    // no memory for a copy of the 16 MB block
+    std::vector<std::string> args;
+    const char* said;  // all of the output in the server, within it otherwise
+    uint16_t flag;     // the block's attached flag afterwards
+    bool kept;      // the block's name still exists
+    size_t dumped;  // records in the dump file
+  };
+  klptest::TmpDir files;
+  const std::string dump = files.path() + "dump.trc";
+  const char* hint =
+      "Unable to obtain memory to copy buffer for formatting.\nEither make more memory available "
+      "or use the '-holdlock' option\n(this will impact the performance of the running "
+      "application.)\n";
+  std::vector<Row> rows = {
+      {"off in the server leaves the freeing to its stop check", true, false, false, {"off"},
+       "Trace is turned off.\n", 0xFFFF, true, 0},
+      {"a server finding the trace turned off lets go of it", true, true, false, {"stat"},
+       "Trace is not on.\n", 0, false, 0},
+      {"fmt without a copy names the way out", false, false, true, {"fmt"}, hint, 0, true, 0},
+      {"fmt -holdlock formats the live block", false, false, true,
+       {"fmt", "-holdlock", "-d", "2"}, "fnc_data \"value          \" lvl 2\n", 0, true, 0},
+      {"dmp -holdlock dumps the live block", false, false, true, {"dmp", dump, "-holdlock"}, "",
+       0, true, 1},
+      {"dmp without a copy dumps nothing", false, false, true, {"dmp", dump}, "", 0, true, 0},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.what);
+    remove(dump.c_str());
+    Trace t(16 << 20);
+    put(1);
+    if (row.stopped) t.b()->status = TRC_STATE_STOP;
+    klptest::Child c = klptest::inChild(files.path(), [&] {
+      klpEnvClear(klpGetEnv());
+      if (row.server) {
+        trcInitAnchor();
+        trcDeclareApplication();
+        trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr);
+      }
+      if (row.short_) leaveOnly(8 << 20);
+      std::vector<std::string> args = row.args;
+      args.insert(args.begin(), "klptrc");
+      args.insert(args.end(), {"-db", "TDB", "-kcap"});
+      std::vector<char*> argv;
+      for (std::string& a : args) argv.push_back(a.data());
+      return _klpTrace(static_cast<int>(argv.size()), argv.data());
+    });
+    EXPECT_EQ(0, c.exitCode) << c.err;
+    // In the server all it says is said; a formatted trace says more.
+    EXPECT_TRUE(row.server ? c.out == row.said : c.out.find(row.said) != std::string::npos)
+        << c.out;
+    EXPECT_EQ(0, t.b()->bufferLock);
+    EXPECT_EQ(0x3F, t.b()->globalFilter);  // the format filters are given back
+    EXPECT_STREQ("", t.b()->fileName);     // so is the block's own file name
+    EXPECT_EQ(row.flag, t.b()->appAttached);
+    EXPECT_EQ(row.kept, klptest::memoryExists(t.dir.path() + kKey + ".TRC"));
+    trcBlockHeader h;
+    bool wrote = trcReadFileHeader(dump.c_str(), &h) == TRC_READ_OK;
+    EXPECT_EQ(row.dumped, wrote ? walk(&h, 0, true).records.size() : 0u);
+  }
 }
 
 }  // namespace
