@@ -27,15 +27,6 @@ void setState(uint32_t state) {
   __atomic_store_n(&g_trcAnchorStorage.state, state, __ATOMIC_SEQ_CST);
 }
 
-// A caller may pass the anchor's own keys: the copy must survive src being
-// dst itself.
-void copyKey(char (&dst)[TRC_KEY_SIZE], const char* src) {
-  if (src == nullptr) src = "";
-  size_t n = strnlen(src, TRC_KEY_SIZE - 1);
-  memmove(dst, src, n);
-  dst[n] = '\0';
-}
-
 // "<key part 1><key part 2>.TRC"; false when it does not fit.
 bool blockPath(const char* keyPart1, const char* keyPart2, char (&path)[2 * TRC_KEY_SIZE + 8]) {
   int n = snprintf(path, sizeof path, "%s%s.TRC", keyPart1 ? keyPart1 : "",
@@ -64,6 +55,15 @@ void leaveBlock() {
 }
 
 }  // namespace
+
+// A caller may pass the anchor's own keys: the copy must survive src being
+// dst itself.
+void trcCopyKey(char (&dst)[TRC_KEY_SIZE], const char* src) {
+  if (src == nullptr) src = "";
+  size_t n = strnlen(src, TRC_KEY_SIZE - 1);
+  memmove(dst, src, n);
+  dst[n] = '\0';
+}
 
 void trcInitAnchor() {
   g_anchor = &g_trcAnchorStorage;
@@ -149,8 +149,8 @@ int trcAttach(const char* keyPart1, const char* keyPart2, const klpAppVersion* a
     trcDropBlock(false);
     return TRC_RC_INCOMPATIBLE;
   }
-  copyKey(a.keyPart1, keyPart1);
-  copyKey(a.keyPart2, keyPart2);
+  trcCopyKey(a.keyPart1, keyPart1);
+  trcCopyKey(a.keyPart2, keyPart2);
   if (g_application) {  // the block describes the traced program only
     trcLockBuffer(b);
     if (appVersion != nullptr) memcpy(&b->appVersion, appVersion, sizeof b->appVersion);
@@ -226,8 +226,8 @@ int trcCreate(uint32_t bufferSize, const char* keyPart1, const char* keyPart2,
   b->fileLock = 0;
   trcLockBuffer(b);
   trcHoldBlock(memory, b);
-  copyKey(a.keyPart1, keyPart1);
-  copyKey(a.keyPart2, keyPart2);
+  trcCopyKey(a.keyPart1, keyPart1);
+  trcCopyKey(a.keyPart2, keyPart2);
 
   snprintf(b->platform, sizeof b->platform, "%s", TRC_PLATFORM);
   snprintf(b->structVersion, sizeof b->structVersion, "%s", TRC_STRUCT_VERSION);

@@ -19,6 +19,9 @@ constexpr int TRC_RC_NOT_CREATED = 3000;  // a block is held and not Stop, or cr
 // Seconds a server keeps a block that was turned off before it lets go.
 constexpr int TRC_STOP_GRACE_SECONDS = 60;
 
+// Copies a key part (at most 1039 characters, NUL-ended); src may be dst.
+void trcCopyKey(char (&dst)[TRC_KEY_SIZE], const char* src);
+
 // Points the anchor at its static storage, zeroes it, sets state Initial and
 // the process id. First thing in a program's main routine.
 void trcInitAnchor();

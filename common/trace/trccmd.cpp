@@ -41,11 +41,6 @@ struct Run {
   bool formatted;  // the -d and -df were used up by formatting
 };
 
-void copyKey(char* dst, const char* src) {
-  strncpy(dst, src, TRC_KEY_SIZE - 1);
-  dst[TRC_KEY_SIZE - 1] = '\0';
-}
-
 void upper(const char* in, char* out, size_t size) {
   size_t i = 0;
   for (; in[i] != '\0' && i + 1 < size; ++i)
@@ -108,7 +103,7 @@ bool attachBlock(Run* r) {
   }
   a->memory = memory;
   trcint::publishBlock(block, memory->getSize());
-  copyKey(a->keyPart2, r->keyPart2);
+  trcCopyKey(a->keyPart2, r->keyPart2);
   if (block->status == TRC_STATE_RUNNING) {
     if (!trcCheckVersion(block, nullptr, false)) {
       fputs("Unable to attach to trace\n", trcOut());
@@ -313,7 +308,7 @@ bool checkKeys(Run* r) {
 void run(Run* r) {
   trcAnchor* a = r->anchor;
   trcOptions& o = r->o;
-  copyKey(a->keyPart1, getEnvIPCDir(klpGetEnv()));
+  trcCopyKey(a->keyPart1, getEnvIPCDir(klpGetEnv()));
   if (o.outFileName != nullptr) openOutputFile(r);
   if (o.help) return trcUsage();
   if (o.listsymbols) return trcListSymbols();
