@@ -113,6 +113,8 @@ void runCommand(int argc, char** argv) {
   if (schema && schema->strValue) r.logger->setProgramQualifier(schema->strValue);
 
   // The server's queue is named by the prefix; a trace may be on for it.
+  // The command program writes its own trace points into the server's
+  // block and leaves the block's holding and freeing to the server.
   klpEnv* env = klpGetEnv();
   int prc = setEnvNamePrefix(env, "KCAP");
   if (prc != KLP_OK) {

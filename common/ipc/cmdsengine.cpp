@@ -22,13 +22,14 @@
 
 namespace {
 
-constexpr int kTrcComp = 23;  // trace component of the command engine
+// Trace rows of the command engine: common functions (component 11).
+constexpr int kTrcComp = 11;
 enum : int {
-  kFnEngine = 1,
-  kFnHandle = 2,
-  kFnReply = 3,
-  kFnStop = 4,
-  kFnDbCheck = 5,
+  kFnEngine = 41,
+  kFnHandle = 42,
+  kFnReply = 43,
+  kFnStop = 44,
+  kFnDbCheck = 45,
 };
 
 constexpr const char* kOrigin = "cmdsEngine";

@@ -129,12 +129,15 @@ class HSVHIPCMemory {
   void* getAddress() const { return addr_; }
   size_t getSize() const { return size_; }
   hsvRC detach();
-  hsvRC destroy();  // unmaps and removes the name; attached processes keep their mapping
+  // Unmaps and removes the name while it still names this block (not one
+  // made under the same name since); attached processes keep their mapping.
+  hsvRC destroy();
 
  private:
   void* addr_ = nullptr;
   size_t size_ = 0;
   HSVResID id_{};
+  uint64_t dev_ = 0, ino_ = 0;  // the object this handle maps
 };
 
 // ---------------------------------------------------------------------------

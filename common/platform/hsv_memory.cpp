@@ -38,7 +38,8 @@ hsvRC HSVHIPCMemory::create(const HSVResID& id, size_t size, int /*option*/) {
   int fd = shm_open(name, O_RDWR | O_CREAT | O_EXCL, 0600);
   if (fd < 0) return errno == EEXIST ? takenBy(name) : hsvErrnoToECF(errno);
   // A new object is zero-filled by the kernel; ftruncate only sizes it.
-  if (ftruncate(fd, static_cast<off_t>(size)) != 0) {
+  struct stat st{};
+  if (fstat(fd, &st) != 0 || ftruncate(fd, static_cast<off_t>(size)) != 0) {
     int err = errno;
     close(fd);
     shm_unlink(name);
@@ -54,6 +55,8 @@ hsvRC HSVHIPCMemory::create(const HSVResID& id, size_t size, int /*option*/) {
   addr_ = p;
   size_ = size;
   id_ = id;
+  dev_ = st.st_dev;
+  ino_ = st.st_ino;
   return ECF_OK;
 }
 
@@ -83,6 +86,8 @@ hsvRC HSVHIPCMemory::attach(const HSVResID& id) {
   addr_ = p;
   size_ = size;
   id_ = id;
+  dev_ = st.st_dev;
+  ino_ = st.st_ino;
   return ECF_OK;
 }
 
@@ -94,12 +99,25 @@ hsvRC HSVHIPCMemory::detach() {
   return ECF_OK;
 }
 
+// Another process may have removed the name and made a new block under it
+// since this one was attached: only the name of the object still mapped
+// here is removed. Compared while it is mapped, so its inode cannot have
+// been handed on.
 hsvRC HSVHIPCMemory::destroy() {
   if (!addr_) return ECF_NOT_ATTACHED;
   char name[sizeof(HSVResID::part2)];
   bool named = posixName(id_, name);
+  hsvRC rc = named ? ECF_OK : ECF_INVALID_ARGUMENT;
+  if (named) {
+    int fd = shm_open(name, O_RDONLY, 0);
+    struct stat st{};
+    if (fd < 0)
+      rc = hsvErrnoToECF(errno);
+    else if (fstat(fd, &st) != 0 || st.st_dev != dev_ || st.st_ino != ino_)
+      rc = ECF_NOT_FOUND;
+    if (fd >= 0) close(fd);
+  }
   detach();
-  if (!named) return ECF_INVALID_ARGUMENT;
-  if (shm_unlink(name) != 0) return hsvErrnoToECF(errno);
-  return ECF_OK;
+  if (rc == ECF_OK && shm_unlink(name) != 0) rc = hsvErrnoToECF(errno);
+  return rc;
 }

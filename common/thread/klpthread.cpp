@@ -13,7 +13,7 @@
 #include "common/msg/msglogger.h"
 #include "common/platform/hsv.h"
 #include "common/thread/threadlocal.h"
-#include "common/trace/trace.h"
+#include "common/trace/trace_anchor.h"
 #include "common/util/klprc.h"
 
 namespace {
@@ -66,6 +66,7 @@ struct ThreadExitGuard {
 void* threadTrampoline(void* arg) {
   klpThread* t = static_cast<klpThread*>(arg);
   t->threadId = hsvThreadID();
+  trcSetThreadName(t->name);  // so that a formatter names the thread's records
   ThreadExitGuard guard{t};
   if (t->startRoutine != nullptr) t->startRoutine(t);
   // A body that returns without ending itself ends as with 0.
@@ -390,6 +391,7 @@ int klpThread::prologue(klpThread* t) {
     t->sharedCmdList = klpSharedCmdList();
     hsvOneTimeOnly();
     t->threadId = hsvThreadID();
+    trcSetThreadName(t->name);
     if (!ids->locked) ids->makeShared("KlpThreadIDList", 0);  // never under a user
     ids->putTail(&t->tid);
     msgSetThreadNameProvider(threadNameForLogger);

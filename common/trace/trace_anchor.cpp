@@ -4,9 +4,6 @@
 // printable key and the trace-on notice to a server.
 #include "common/trace/trace_anchor.h"
 
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <new>
 #include <cstdio>
@@ -22,15 +19,12 @@ namespace {
 
 trcAnchor* g_anchor = nullptr;  // the process-wide pointer; null until initialised
 int64_t g_stopSeenAt = 0;       // when trcCheckStop first saw the block Stop
+bool g_application = false;     // this process is the traced server (trcDeclareApplication)
 
 trcAnchor& anchor() { return g_trcAnchorStorage; }
 
 void setState(uint32_t state) {
   __atomic_store_n(&g_trcAnchorStorage.state, state, __ATOMIC_SEQ_CST);
-}
-
-void copyKey(char (&dst)[TRC_KEY_SIZE], const char* src) {
-  snprintf(dst, sizeof dst, "%s", src != nullptr ? src : "");
 }
 
 // "<key part 1><key part 2>.TRC"; false when it does not fit.
@@ -40,18 +34,6 @@ bool blockPath(const char* keyPart1, const char* keyPart2, char (&path)[2 * TRC_
   return n > 0 && static_cast<size_t>(n) < sizeof path;
 }
 
-// Only a block of this user, readable and writable by nobody else, is used:
-// another user's block could feed a server's trace points anything. The
-// platform names shared memory under /dev/shm.
-hsvRC checkOwner(const HSVResID& id) {
-  char path[64];
-  snprintf(path, sizeof path, "/dev/shm%.*s", static_cast<int>(sizeof id.part2), id.part2);
-  struct stat st {};
-  if (stat(path, &st) != 0) return ECF_NOT_FOUND;
-  if (st.st_uid != geteuid() || (st.st_mode & 0777) != 0600) return ECF_ACCESS_DENIED;
-  return ECF_OK;
-}
-
 void copyModules(trcBlockHeader* b, const klpModuleList* list) {
   int n = std::min<int>(list->count, TRC_MODULES);
   memcpy(b->modules, klpModuleRecords(const_cast<klpModuleList*>(list)),
@@ -59,18 +41,29 @@ void copyModules(trcBlockHeader* b, const klpModuleList* list) {
   b->moduleCount = static_cast<uint16_t>(n);
 }
 
-// Lets go of the block after the anchor stopped tracing: not application-
-// attached any more, then destroyed when it is Stop, detached otherwise.
+// Lets go of the block after the anchor stopped tracing. The traced
+// application withdraws its mark; a Stop block is then destroyed unless the
+// application still holds it (it frees the block itself), detached otherwise.
 void leaveBlock() {
   trcBlockHeader* b = anchor().block;
   if (b == nullptr) return;
   trcLockBuffer(b);
-  b->appAttached = 0;
+  if (g_application) b->appAttached = 0;
+  bool held = b->appAttached == TRC_APP_ATTACHED;
   trcUnlockBuffer(b);
-  trcDropBlock(b->status == TRC_STATE_STOP);
+  trcDropBlock(b->status == TRC_STATE_STOP && !held);
 }
 
 }  // namespace
+
+// A caller may pass the anchor's own keys: the copy must survive src being
+// dst itself.
+void trcCopyKey(char (&dst)[TRC_KEY_SIZE], const char* src) {
+  if (src == nullptr) src = "";
+  size_t n = strnlen(src, TRC_KEY_SIZE - 1);
+  memmove(dst, src, n);
+  dst[n] = '\0';
+}
 
 void trcInitAnchor() {
   g_anchor = &g_trcAnchorStorage;
@@ -78,7 +71,18 @@ void trcInitAnchor() {
   g_anchor->state = TRC_STATE_INITIAL;
   g_anchor->pid = hsvProcessID();
   g_stopSeenAt = 0;
+  g_application = false;
   trcint::prepareWriters();
+}
+
+void trcDeclareApplication() { g_application = true; }
+
+void trcStartTracing(trcBlockHeader* block) {
+  if (g_application) {
+    if (trcThreadTablesInUse()) trcCopyThreadTables(block);
+    block->appAttached = TRC_APP_ATTACHED;
+  }
+  setState(TRC_STATE_RUNNING);
 }
 
 trcAnchor* trcGetAnchor() { return g_anchor; }
@@ -94,8 +98,7 @@ hsvRC trcOpenBlock(const char* keyPart1, const char* keyPart2, HSVHIPCMemory** m
   if (rc != ECF_OK) return rc;
   HSVHIPCMemory* m = new (std::nothrow) HSVHIPCMemory;
   if (m == nullptr) return ECF_NO_MEMORY;
-  rc = m->attach(id);
-  if (rc == ECF_OK) rc = checkOwner(id);
+  rc = m->attach(id);  // refuses a block of another user or open to others
   if (rc == ECF_OK && (m->getAddress() == nullptr || m->getSize() < TRC_HEADER_SIZE))
     rc = ECF_INVALID_ARGUMENT;
   if (rc != ECF_OK) {
@@ -146,15 +149,15 @@ int trcAttach(const char* keyPart1, const char* keyPart2, const klpAppVersion* a
     trcDropBlock(false);
     return TRC_RC_INCOMPATIBLE;
   }
-  copyKey(a.keyPart1, keyPart1);
-  copyKey(a.keyPart2, keyPart2);
-  trcLockBuffer(b);
-  if (appVersion != nullptr) memcpy(&b->appVersion, appVersion, sizeof b->appVersion);
-  if (moduleList != nullptr) copyModules(b, moduleList);
-  trcUnlockBuffer(b);
-  if (trcThreadTablesInUse()) trcCopyThreadTables(b);
-  b->appAttached = TRC_APP_ATTACHED;
-  setState(TRC_STATE_RUNNING);
+  trcCopyKey(a.keyPart1, keyPart1);
+  trcCopyKey(a.keyPart2, keyPart2);
+  if (g_application) {  // the block describes the traced program only
+    trcLockBuffer(b);
+    if (appVersion != nullptr) memcpy(&b->appVersion, appVersion, sizeof b->appVersion);
+    if (moduleList != nullptr) copyModules(b, moduleList);
+    trcUnlockBuffer(b);
+  }
+  trcStartTracing(b);
   return 0;
 }
 
@@ -223,8 +226,8 @@ int trcCreate(uint32_t bufferSize, const char* keyPart1, const char* keyPart2,
   b->fileLock = 0;
   trcLockBuffer(b);
   trcHoldBlock(memory, b);
-  copyKey(a.keyPart1, keyPart1);
-  copyKey(a.keyPart2, keyPart2);
+  trcCopyKey(a.keyPart1, keyPart1);
+  trcCopyKey(a.keyPart2, keyPart2);
 
   snprintf(b->platform, sizeof b->platform, "%s", TRC_PLATFORM);
   snprintf(b->structVersion, sizeof b->structVersion, "%s", TRC_STRUCT_VERSION);
@@ -243,7 +246,7 @@ int trcCreate(uint32_t bufferSize, const char* keyPart1, const char* keyPart2,
     trcCopyThreadTables(b);
   else
     trcClearThreadTables(b);
-  if (!standalone) b->appAttached = TRC_APP_ATTACHED;
+  if (!standalone && g_application) b->appAttached = TRC_APP_ATTACHED;
 
   snprintf(b->traceRelease.programName, sizeof b->traceRelease.programName, "%s",
            TRC_RELEASE_NAME);
@@ -259,6 +262,7 @@ int trcCreate(uint32_t bufferSize, const char* keyPart1, const char* keyPart2,
 
   b->dataOffset = TRC_HEADER_SIZE;
   b->writeOffset = b->oldestOffset = b->highWaterOffset = b->entryCount = 0;
+  b->fileFull = 0;
   b->bufferSize = bufferSize;
   b->maxFileSize = maxFileSize;
   b->globalFilter = globalFilter;

@@ -19,19 +19,32 @@ constexpr int TRC_RC_NOT_CREATED = 3000;  // a block is held and not Stop, or cr
 // Seconds a server keeps a block that was turned off before it lets go.
 constexpr int TRC_STOP_GRACE_SECONDS = 60;
 
+// Copies a key part (at most 1039 characters, NUL-ended); src may be dst.
+void trcCopyKey(char (&dst)[TRC_KEY_SIZE], const char* src);
+
 // Points the anchor at its static storage, zeroes it, sets state Initial and
 // the process id. First thing in a program's main routine.
 void trcInitAnchor();
 // The anchor, or null while trcInitAnchor was never called.
 trcAnchor* trcGetAnchor();
 
+// Declares this process the traced application (the server), after
+// trcInitAnchor. Only the application marks a block application-attached
+// and withdraws the mark, and records its version block, module list and
+// thread tables in it. Any other process that attaches (the command
+// program, the trace command) traces its own points into the block and
+// leaves all of that, and the freeing of a block the application holds,
+// alone.
+void trcDeclareApplication();
+
 // Server side: attaches to the block "<keyPart1><keyPart2>.TRC" when one is
 // on and Running, records the program's version block and module list in it
-// (when given) and starts tracing. 0 (also when no trace is on), 1000 or 1004.
+// (when given, in the application) and starts tracing. 0 (also when no trace is on), 1000 or 1004.
 int trcAttach(const char* keyPart1, const char* keyPart2, const klpAppVersion* appVersion,
               const klpModuleList* moduleList);
 // Stops tracing and lets go of the block: destroys this process's hold when
-// the block's status is Stop, detaches otherwise.
+// the block's status is Stop and the application no longer holds it,
+// detaches otherwise.
 void trcDetach();
 // On every pass of a server's command loop: once the block is Stop, stops
 // writing, and lets go of it more than 60 seconds later.
@@ -43,12 +56,17 @@ void trcFree();
 // detaches the handle. The anchor's state is left to the caller.
 void trcDropBlock(bool destroy);
 
-// Opens the existing block of the two key parts: derives its id, attaches,
-// and checks that it is this user's, mode 0600, and at least a header long.
+// Opens the existing block of the two key parts: derives its id, attaches
+// (the platform refuses a block of another user or open to others), and
+// checks that it is at least a header long.
 // ECF_OK with *memory and *block set; ECF_NOT_FOUND when there is none;
 // another platform code when it exists but may not be used.
 hsvRC trcOpenBlock(const char* keyPart1, const char* keyPart2, HSVHIPCMemory** memory,
                    trcBlockHeader** block);
+
+// Starts tracing into the block this process holds: the application copies
+// its thread tables into it and marks it attached; the anchor is Running.
+void trcStartTracing(trcBlockHeader* block);
 
 // Records a block opened with trcOpenBlock as this process's own: handle and
 // address go into the anchor, so the trace points of this process write

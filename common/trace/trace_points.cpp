@@ -73,7 +73,7 @@ trcBlockHeader* makeRoom(trcBlockHeader* b, uint32_t len) {
       trcLockFile(b);
       copy = trcCopyBlock(b);
       if (copy == nullptr) {
-        trcFlushToFile(b, false);
+        trcFlushLap(b, b);
         trcUnlockFile(b);
       }
     }
@@ -156,7 +156,7 @@ void writeRecord(trcBlockHeader* b, int component, int function, uint16_t levelM
   if (copy != nullptr) {
     // The block stays mapped while this thread is inside it, so its file
     // lock can always be released here.
-    trcFlushToFile(copy, false);
+    trcFlushLap(b, copy);
     trcUnlockFile(b);
     free(copy);
   }
@@ -170,6 +170,21 @@ trcBlockHeader* trcCopyBlock(const trcBlockHeader* block) {
   auto* copy = static_cast<trcBlockHeader*>(malloc(size));
   if (copy != nullptr) memcpy(copy, block, size);
   return copy;
+}
+
+void trcFlushLastLap(trcBlockHeader* block) {
+  trcLockBuffer(block);
+  trcBlockHeader* copy = trcCopyBlock(block);
+  trcLockFile(block);
+  if (copy != nullptr) {
+    trcUnlockBuffer(block);
+    trcFlushLap(block, copy);
+    free(copy);
+  } else if (block->bufferSize <= trcint::mappedSize()) {
+    trcFlushLap(block, block);
+  }
+  trcUnlockFile(block);
+  if (copy == nullptr) trcUnlockBuffer(block);
 }
 
 void trcWriteRecord(int component, int function, uint16_t levelMask, const void* timeOrName,

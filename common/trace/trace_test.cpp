@@ -1,7 +1,10 @@
 // The trace writer, its reader and the attachment of a process to a block:
-// damaged images first, then what the writer keeps and drops.
+// damaged images first, then what the writer keeps and drops; last, the
+// trace command called inside the server and short of memory.
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <cstdio>
@@ -14,8 +17,15 @@
 #include "common/trace/trace.h"
 #include "common/trace/trace_anchor.h"
 #include "common/trace/trcread.h"
+#include "common/trace/trcsymbols.h"
 #include "common/trace/trcwrite.h"
+#include "common/util/klpfmt.h"
+#include "include/klptrc.h"
 #include "tests/testing/klptest.h"
+
+// A process short of memory gets null from malloc, as it does without the
+// address sanitizer, whose default is to end the process instead.
+extern "C" const char* __asan_default_options() { return "allocator_may_return_null=1"; }
 
 namespace {
 
@@ -82,14 +92,20 @@ Walk walk(const trcBlockHeader* h, size_t size, bool fromFile) {
   return w;
 }
 
-// A trace block of this process, created as the trace command does.
+// A trace block of this process, created as the trace command does, from
+// the keys the anchor already holds.
 struct Trace {
   klptest::TmpDir dir;
   Trace(uint32_t size = TRC_MIN_SIZE, const std::string& file = "", uint32_t fileSize = TRC_MAX_SIZE,
         uint16_t filter = 0x3F) {
     trcInitAnchor();
-    EXPECT_EQ(0, trcCreate(size, dir.path().c_str(), kKey, file.empty() ? nullptr : file.c_str(),
+    trcAnchor* a = trcGetAnchor();
+    snprintf(a->keyPart1, TRC_KEY_SIZE, "%s", dir.path().c_str());
+    snprintf(a->keyPart2, TRC_KEY_SIZE, "%s", kKey);
+    EXPECT_EQ(0, trcCreate(size, a->keyPart1, a->keyPart2, file.empty() ? nullptr : file.c_str(),
                            fileSize, filter, true));
+    EXPECT_EQ(dir.path(), a->keyPart1);
+    EXPECT_STREQ(kKey, a->keyPart2);
   }
   ~Trace() {
     trcFree();
@@ -202,6 +218,7 @@ TEST(TraceWriter, WhatARecordHolds) {
     int records, type;
     std::vector<std::pair<int, std::string>> objects;
     const char* name;
+    const char* function = nullptr;  // the symbol row the first record names
   };
   const int str = TRC_OBJ_STRING;
   auto none = [](trcBlockHeader*) {};
@@ -241,6 +258,9 @@ TEST(TraceWriter, WhatARecordHolds) {
       {"a record as large as the data area fits an empty buffer", none,
        [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 44, big.data()); }, 0x3F, 1,
        TRC_REC_DATA, {{TRC_OBJ_RAW, big}}, "big            "},
+      {"a library routine's points name its own row", none,
+       [] { return static_cast<uint32_t>(compareIgnTransCriteria("A%C", "ABBC")); }, 1, 2,
+       TRC_REC_ENTRY, {}, nullptr, "compareIgnTransCriteria"},
       {"one byte more is never written", none,
        [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 43, big.data()); }, 0x3F, 0,
        0, {}, ""},
@@ -260,6 +280,9 @@ TEST(TraceWriter, WhatARecordHolds) {
     EXPECT_EQ(hsvProcessID(), r.pid);
     if (row.name != nullptr) {
       EXPECT_EQ(std::string(row.name) + '\0', r.name);
+    }
+    if (row.function != nullptr) {
+      EXPECT_STREQ(row.function, trcFunctionName(r.component, r.function));
     }
   }
 
@@ -283,30 +306,32 @@ TEST(TraceWriter, WrapKeepsTheNewestRecords) {
   for (size_t i = 0; i < w.records.size(); ++i) EXPECT_EQ(1254 + static_cast<int>(i), w.records[i].value());
 }
 
-// The last lap of a direct-to-file trace, as turning the trace off writes it.
-void flushLastLap(trcBlockHeader* b) {
-  std::vector<uint8_t> copy(b->bufferSize);
-  trcLockBuffer(b);
-  memcpy(copy.data(), b, copy.size());
-  trcUnlockBuffer(b);
-  trcFlushToFile(reinterpret_cast<trcBlockHeader*>(copy.data()), true);
-}
-
 TEST(TraceWriter, DirectToFileLosesNothingUntilItsLimit) {
   struct Row {
     uint32_t fileSize;
     int written, kept;
+    bool said;  // the file was reported full (once)
   };
-  // Each wrap appends one full lap of 746 records; three laps fit 131072,
-  // and the last 500 records (24000 bytes) do not fit what is left.
-  for (const Row& row : std::vector<Row>{{TRC_MAX_SIZE, 5000, 5000}, {TRC_MIN_SIZE, 4230, 2238}}) {
-    SCOPED_TRACE(row.fileSize);
+  // Each wrap appends one full lap of 746 records (35808 bytes); three laps
+  // fit 131072, and 23648 bytes are left. The last lap (turning the trace
+  // off) holds the rest: 500 records (24000 bytes) do not fit what is left,
+  // 100 would, but after the laps refused before them.
+  for (const Row& row : std::vector<Row>{
+           {TRC_MAX_SIZE, 5000, 5000, false},
+           {TRC_MIN_SIZE, 4230, 2238, true},
+           {TRC_MIN_SIZE, 3830, 2238, true}}) {
+    SCOPED_TRACE(row.written);
     klptest::TmpDir files;
     std::string path = files.path() + "direct.trc";
     {
       Trace t(TRC_MIN_SIZE, path, row.fileSize);
+      Said said;
       for (int v = 0; v < row.written; ++v) put(v);
-      flushLastLap(t.b());
+      trcFlushLastLap(t.b());
+      EXPECT_EQ(row.said ? "Trace file \"" + path + "\" has reached its maximum size of 131072 "
+                           "bytes, no more records are written to it.\n"
+                         : "",
+                said.text());
     }
     trcBlockHeader header;
     ASSERT_EQ(TRC_READ_OK, trcReadFileHeader(path.c_str(), &header));
@@ -491,29 +516,45 @@ TEST(TraceThreads, HashedSlotsOverflowAndLookups) {
   EXPECT_STREQ("last", t.b()->threadOverflow[149].threadName);
 }
 
-// A server process attaching to a block the trace command created.
-TEST(TraceAttach, ServerAttachesOnlyToASoundBlock) {
+// A process attaching to a block the trace command created: the server
+// (declared the traced application) or another one, such as the command
+// program, which must leave the server's hold on the block alone.
+TEST(TraceAttach, OnlyTheServerHoldsTheBlock) {
   struct Row {
     const char* what;
+    bool application;
     std::function<void(trcBlockHeader*, const std::string&)> spoil;
-    int rc;
-    size_t records;
+    const char* seen;  // trcAttach's answer, attached or not, the flag while attached
+    uint16_t flagAfter;
+    bool kept;         // the block's name still exists afterwards
   };
   auto shmPath = [](const std::string& dir) {
     HSVResID id;
     hsvIPCGetResID((dir + kKey + ".TRC").c_str(), HSV_MEMORY_RESID_OPTION, &id);
     return std::string("/dev/shm") + id.posixName();
   };
+  auto held = [](trcBlockHeader* b, const std::string&) { b->appAttached = TRC_APP_ATTACHED; };
+  auto heldStopped = [](trcBlockHeader* b, const std::string&) {
+    b->appAttached = TRC_APP_ATTACHED;
+    b->status = TRC_STATE_STOP;
+  };
   std::vector<Row> rows = {
-      {"sound", [](trcBlockHeader*, const std::string&) {}, 0, 1},
-      {"readable by others",
+      {"the server", true, [](trcBlockHeader*, const std::string&) {}, "0 1 ffff", 0, true},
+      {"another process while the server holds it", false, held, "0 1 ffff", 0xFFFF, true},
+      {"another process finds it turned off, the server still holding it", false, heldStopped,
+       "0 0 ffff", 0xFFFF, true},
+      {"the server finds it turned off", true,
+       [](trcBlockHeader* b, const std::string&) { b->status = TRC_STATE_STOP; }, "0 0 0", 0,
+       false},
+      {"readable by others", true,
        [&](trcBlockHeader*, const std::string& dir) { chmod(shmPath(dir).c_str(), 0644); },
-       TRC_RC_NO_ADDRESS, 0},
-      {"another platform",
+       "1000 0 0", 0, true},
+      {"another platform", true,
        [](trcBlockHeader* b, const std::string&) { strcpy(b->platform, "Windows"); },
-       TRC_RC_INCOMPATIBLE, 0},
-      {"still being built",
-       [](trcBlockHeader* b, const std::string&) { b->status = TRC_STATE_STARTING; }, 0, 0},
+       "1004 0 0", 0, true},
+      {"still being built", true,
+       [](trcBlockHeader* b, const std::string&) { b->status = TRC_STATE_STARTING; }, "0 0 0",
+       0, true},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.what);
@@ -522,21 +563,24 @@ TEST(TraceAttach, ServerAttachesOnlyToASoundBlock) {
     row.spoil(shared, t.dir.path());
     klptest::Child c = klptest::inChild(t.dir.path(), [&] {
       trcInitAnchor();
+      if (row.application) trcDeclareApplication();
       int rc = trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr);
-      bool attached = trcGetAnchor()->block != nullptr && shared->appAttached == TRC_APP_ATTACHED;
+      printf("%d %d %x", rc, trcGetAnchor()->block != nullptr, shared->appAttached);
       put(7);
       trcDetach();
-      return rc == row.rc && attached == (row.rc == 0 && row.records == 1) ? 0 : 1;
+      return 0;
     });
-    EXPECT_TRUE(c.exited && c.exitCode == 0) << c.out << c.err;
+    EXPECT_EQ(0, c.exitCode) << c.err;
+    EXPECT_EQ(row.seen, c.out);
+    EXPECT_EQ(row.flagAfter, shared->appAttached);
+    EXPECT_EQ(row.kept, access(shmPath(t.dir.path()).c_str(), F_OK) == 0);
     t.b()->status = TRC_STATE_RUNNING;
     strcpy(t.b()->platform, "Linux");
     Walk w = t.read();
-    ASSERT_EQ(row.records, w.records.size());
-    if (row.records) {
+    ASSERT_EQ(row.seen[2] == '1' ? 1u : 0u, w.records.size());
+    if (!w.records.empty()) {
       EXPECT_NE(hsvProcessID(), w.records[0].pid);
     }
-    EXPECT_EQ(0, t.b()->appAttached);
   }
 }
 
@@ -555,6 +599,81 @@ TEST(TraceAttach, TurnedOffStopsWritingAtTheNextCheck) {
   });
   EXPECT_EQ(0, c.exitCode) << c.out << c.err;
   EXPECT_EQ(1u, t.read().records.size());
+}
+
+// Leaves this process `spare` bytes of private memory beyond what it maps
+// now, as a machine short of memory would; shared memory does not count.
+void leaveOnly(rlim_t spare) {
+  std::string status = klptest::readFile("/proc/self/status");
+  rlim_t used = std::stoull(status.substr(status.find("VmData:") + 7)) * 1024;
+  rlimit limit{used + spare, used + spare};
+  ASSERT_EQ(0, setrlimit(RLIMIT_DATA, &limit));
+}
+
+TEST(TraceCommand, InsideTheServerOrShortOfMemory) {
+  struct Row {
+    const char* what;
+    bool server;    // called in the traced server (declared, attached unless turned off)
+    bool stopped;   // the block was turned off before
+    bool short_;    // no memory for a copy of the 16 MB block
+    std::vector<std::string> args;
+    const char* said;  // all of the output in the server, within it otherwise
+    uint16_t flag;     // the block's attached flag afterwards
+    bool kept;      // the block's name still exists
+    size_t dumped;  // records in the dump file
+  };
+  klptest::TmpDir files;
+  const std::string dump = files.path() + "dump.trc";
+  const char* hint =
+      "Unable to obtain memory to copy buffer for formatting.\nEither make more memory available "
+      "or use the '-holdlock' option\n(this will impact the performance of the running "
+      "application.)\n";
+  std::vector<Row> rows = {
+      {"off in the server leaves the freeing to its stop check", true, false, false, {"off"},
+       "Trace is turned off.\n", 0xFFFF, true, 0},
+      {"a server finding the trace turned off lets go of it", true, true, false, {"stat"},
+       "Trace is not on.\n", 0, false, 0},
+      {"fmt without a copy names the way out", false, false, true, {"fmt"}, hint, 0, true, 0},
+      {"fmt -holdlock formats the live block", false, false, true,
+       {"fmt", "-holdlock", "-d", "2"}, "fnc_data \"value          \" lvl 2\n", 0, true, 0},
+      {"dmp -holdlock dumps the live block", false, false, true, {"dmp", dump, "-holdlock"}, "",
+       0, true, 1},
+      {"dmp without a copy dumps nothing", false, false, true, {"dmp", dump}, "", 0, true, 0},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.what);
+    remove(dump.c_str());
+    Trace t(16 << 20);
+    put(1);
+    if (row.stopped) t.b()->status = TRC_STATE_STOP;
+    klptest::Child c = klptest::inChild(files.path(), [&] {
+      klpEnvClear(klpGetEnv());
+      if (row.server) {
+        trcInitAnchor();
+        trcDeclareApplication();
+        trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr);
+      }
+      if (row.short_) leaveOnly(8 << 20);
+      std::vector<std::string> args = row.args;
+      args.insert(args.begin(), "klptrc");
+      args.insert(args.end(), {"-db", "TDB", "-kcap"});
+      std::vector<char*> argv;
+      for (std::string& a : args) argv.push_back(a.data());
+      return _klpTrace(static_cast<int>(argv.size()), argv.data());
+    });
+    EXPECT_EQ(0, c.exitCode) << c.err;
+    // In the server all it says is said; a formatted trace says more.
+    EXPECT_TRUE(row.server ? c.out == row.said : c.out.find(row.said) != std::string::npos)
+        << c.out;
+    EXPECT_EQ(0, t.b()->bufferLock);
+    EXPECT_EQ(0x3F, t.b()->globalFilter);  // the format filters are given back
+    EXPECT_STREQ("", t.b()->fileName);     // so is the block's own file name
+    EXPECT_EQ(row.flag, t.b()->appAttached);
+    EXPECT_EQ(row.kept, klptest::memoryExists(t.dir.path() + kKey + ".TRC"));
+    trcBlockHeader h;
+    bool wrote = trcReadFileHeader(dump.c_str(), &h) == TRC_READ_OK;
+    EXPECT_EQ(row.dumped, wrote ? walk(&h, 0, true).records.size() : 0u);
+  }
 }
 
 }  // namespace

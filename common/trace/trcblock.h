@@ -96,7 +96,8 @@ struct trcBlockHeader {
   uint8_t reserved3[6];               // 3334
   uint8_t bufferLock;                 // 3340: byte lock over the block
   uint8_t fileLock;                   // 3341: byte lock over writing the trace file
-  uint8_t reserved4[2];               // 3342
+  uint8_t fileFull;                   // 3342: 1 once the trace file reached its maximum size
+  uint8_t reserved4;                  // 3343
   uint32_t status;                    // 3344: a status word
   uint16_t componentFilters[TRC_COMPONENTS];                 // 3348
   uint16_t functionFilters[TRC_COMPONENTS][TRC_FUNCTIONS];   // 3456
@@ -170,6 +171,7 @@ static_assert(offsetof(trcBlockHeader, dataOffset) == 2264 &&
                   offsetof(trcBlockHeader, reserved3) == 3334 &&
                   offsetof(trcBlockHeader, bufferLock) == 3340 &&
                   offsetof(trcBlockHeader, fileLock) == 3341 &&
+                  offsetof(trcBlockHeader, fileFull) == 3342 &&
                   offsetof(trcBlockHeader, status) == 3344,
               "control block header: counters and locks");
 static_assert(offsetof(trcBlockHeader, componentFilters) == 3348 &&

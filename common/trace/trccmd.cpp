@@ -37,17 +37,9 @@ struct Run {
   trcOptions o;
   trcAnchor* anchor;
   bool standalone;
-  // The keys, kept apart from the anchor's copies: the attachment functions
-  // copy them into the anchor.
-  char keyPart1[TRC_KEY_SIZE];
-  char keyPart2[TRC_KEY_SIZE];
+  char keyPart2[TRC_KEY_SIZE];  // built from the options; key part 1 is the anchor's
   bool formatted;  // the -d and -df were used up by formatting
 };
-
-void copyKey(char* dst, const char* src) {
-  strncpy(dst, src, TRC_KEY_SIZE - 1);
-  dst[TRC_KEY_SIZE - 1] = '\0';
-}
 
 void upper(const char* in, char* out, size_t size) {
   size_t i = 0;
@@ -100,10 +92,10 @@ bool attachBlock(Run* r) {
   if (a->block != nullptr) return true;
   HSVHIPCMemory* memory = nullptr;
   trcBlockHeader* block = nullptr;
-  hsvRC rc = trcOpenBlock(r->keyPart1, r->keyPart2, &memory, &block);
+  hsvRC rc = trcOpenBlock(a->keyPart1, r->keyPart2, &memory, &block);
   if (rc == ECF_NOT_FOUND) return true;
   if (rc != ECF_OK) {
-    char* key = trcKeyText(r->keyPart1, r->keyPart2);
+    char* key = trcKeyText(a->keyPart1, r->keyPart2);
     fprintf(trcOut(), "Function 'HSVHIPCMemory::attach' with IPC key '%s' failed with HSVE reason "
             "'%s'.\n", key != nullptr ? key : "UNKNOWN", ecfErrorGetDescription(rc));
     free(key);
@@ -111,7 +103,7 @@ bool attachBlock(Run* r) {
   }
   a->memory = memory;
   trcint::publishBlock(block, memory->getSize());
-  copyKey(a->keyPart2, r->keyPart2);
+  trcCopyKey(a->keyPart2, r->keyPart2);
   if (block->status == TRC_STATE_RUNNING) {
     if (!trcCheckVersion(block, nullptr, false)) {
       fputs("Unable to attach to trace\n", trcOut());
@@ -119,9 +111,7 @@ bool attachBlock(Run* r) {
       dropBlock(a, false);
       return false;
     }
-    if (trcThreadTablesInUse()) trcCopyThreadTables(block);
-    if (!r->standalone) block->appAttached = TRC_APP_ATTACHED;
-    __atomic_store_n(&a->state, TRC_STATE_RUNNING, __ATOMIC_SEQ_CST);
+    trcStartTracing(block);
   } else if (!r->standalone) {
     // A server leaves a block that is not running as its detach would.
     trcDetach();
@@ -130,11 +120,12 @@ bool attachBlock(Run* r) {
 }
 
 void turnOn(Run* r) {
+  trcAnchor* a = r->anchor;
   FILE* out = trcOut();
   const trcOptions& o = r->o;
-  int rc = trcCreate(o.bufferSize, r->keyPart1, r->keyPart2, o.fileName, o.maxFileSize,
+  int rc = trcCreate(o.bufferSize, a->keyPart1, r->keyPart2, o.fileName, o.maxFileSize,
                      o.logLevel, r->standalone);
-  char* key = trcKeyText(r->keyPart1, r->keyPart2);
+  char* key = trcKeyText(a->keyPart1, r->keyPart2);
   if (rc != 0) {
     fprintf(out, "Trace failed to start with return code %d.\n", rc);
     fprintf(out, "Key token was '%s'\n", r->keyPart2);
@@ -148,31 +139,12 @@ void turnOn(Run* r) {
     fputs("Trace is turned on, but an error occurred retrieving IPC key.\n", out);
   free(key);
   // The keeper starts the process that holds the block and ends at once.
-  const char* argv[] = {kKeeper, r->keyPart1, r->keyPart2, nullptr};
+  const char* argv[] = {kKeeper, a->keyPart1, r->keyPart2, nullptr};
   int32_t pid = 0;
   int exitCode = -1;
   if (hsvStartProcess(kKeeper, argv, &pid) != ECF_OK || hsvWaitProcess(pid, &exitCode) != ECF_OK ||
       exitCode != 0)
     fputs("Create Process failed!!\n", out);
-}
-
-// Writes the block to its trace file one last time.
-void lastFlush(trcBlockHeader* block, size_t size) {
-  trcLockBuffer(block);
-  trcBlockHeader* copy = static_cast<trcBlockHeader*>(malloc(size));
-  if (copy != nullptr) {
-    memcpy(copy, block, size);
-    trcLockFile(block);
-    trcUnlockBuffer(block);
-    trcFlushToFile(copy, false);
-    trcUnlockFile(block);
-    free(copy);
-    return;
-  }
-  trcLockFile(block);
-  trcFlushToFile(block, false);
-  trcUnlockFile(block);
-  trcUnlockBuffer(block);
 }
 
 void turnOff(Run* r) {
@@ -187,7 +159,7 @@ void turnOff(Run* r) {
   block->status = TRC_STATE_STOP;
   trcUnlockBuffer(block);
   fputs("Trace is turned off.\n", out);
-  if (block->fileName[0] != '\0') lastFlush(block, a->memory->getSize());
+  if (block->fileName[0] != '\0') trcFlushLastLap(block);
   if (block->appAttached == 0) {
     trcFree();
   } else if (r->standalone) {
@@ -279,7 +251,7 @@ void runAction(Run* r) {
     } else {
       fputs("Trace is already on, no action taken.\n", out);
     }
-    if (r->standalone) _trcSendIPCMsg(r->keyPart1, r->keyPart2, 10);
+    if (r->standalone) _trcSendIPCMsg(a->keyPart1, r->keyPart2, 10);
   } else if (o.off) {
     turnOff(r);
   } else if (o.kill) {
@@ -336,8 +308,7 @@ bool checkKeys(Run* r) {
 void run(Run* r) {
   trcAnchor* a = r->anchor;
   trcOptions& o = r->o;
-  copyKey(r->keyPart1, getEnvIPCDir(klpGetEnv()));
-  copyKey(a->keyPart1, r->keyPart1);
+  trcCopyKey(a->keyPart1, getEnvIPCDir(klpGetEnv()));
   if (o.outFileName != nullptr) openOutputFile(r);
   if (o.help) return trcUsage();
   if (o.listsymbols) return trcListSymbols();

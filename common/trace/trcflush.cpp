@@ -59,50 +59,51 @@ void refreshFromImage(trcBlockHeader* h, const trcBlockHeader* image) {
   memcpy(h->threadOverflow, image->threadOverflow, sizeof h->threadOverflow);
 }
 
-// Appends to an existing file. Answers 0 when done (or nothing to do), 1
-// after a failure, 2 when the header could not be read whole (the caller
-// then creates the file afresh).
+// appendToFile: the header could not be read whole; the file is made afresh.
+constexpr int kRecreate = -1;
+
+// Appends to an existing file: TRC_FLUSH_* or kRecreate.
 int appendToFile(Flush& f) {
   const trcBlockHeader* img = f.image;
   if (img->entryCount == 0) {
     say(f, "Trace buffer is empty, no action taken.\n", nullptr);
-    return 0;
+    return TRC_FLUSH_DONE;
   }
   f.file = fopen(f.path, "r+b");
   if (f.file == nullptr) {
     say(f, "Unable to update file \"%s\"\n", f.path);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   if (!seekTo(f.file, 0)) {
     sayErrno(f,
              "Unable to set file position to start of existing file \"%s\" to read trace "
              "control block,\nfseek() error:  \"%d\", reason:  \"%s\".\n",
              errno);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
-  if (fread(f.header, 1, TRC_HEADER_SIZE, f.file) != TRC_HEADER_SIZE) return 2;
+  if (fread(f.header, 1, TRC_HEADER_SIZE, f.file) != TRC_HEADER_SIZE) return kRecreate;
   trcBlockHeader* h = f.header;
-  if (!trcCheckVersion(h, f.path, f.report)) return 1;
+  if (!trcCheckVersion(h, f.path, f.report)) return TRC_FLUSH_FAILED;
   if (const char* why = trcHeaderFault(h, 0)) {
     if (f.report)
       fprintf(f.out, "Header of file \"%s\" is damaged (%s), no data appended.\n", f.path, why);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   bool limited = strncmp(f.path, "//'", 3) != 0;
   if (limited && static_cast<uint64_t>(img->writeOffset) + h->writeOffset > img->maxFileSize)
-    return 1;
+    return TRC_FLUSH_FULL;
   refreshFromImage(h, img);
   if (!seekTo(f.file, static_cast<uint64_t>(h->dataOffset) + h->writeOffset)) {
     sayErrno(f,
              "Unable to set file position in file \"%s\" to write next data record,\nfseek() "
              "error:  \"%d\", reason:  \"%s\".\n",
              errno);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   const uint8_t* data = reinterpret_cast<const uint8_t*>(img) + img->dataOffset;
   if (!writeAll(f.file, data, img->writeOffset)) {
     say(f, "Error writing data to file \"%s\"\n", f.path);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   h->writeOffset += img->writeOffset;
   h->highWaterOffset = h->writeOffset;
@@ -112,13 +113,13 @@ int appendToFile(Flush& f) {
              "Unable to set file position to start of existing file \"%s\" to update trace "
              "control block,\nfseek() error:  \"%d\", reason:  \"%s\".\n",
              errno);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   if (!writeAll(f.file, h, TRC_HEADER_SIZE)) {
     say(f, "Error updating header for file \"%s\"\n", f.path);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
-  return 0;
+  return TRC_FLUSH_DONE;
 }
 
 // Writes the records of the image, oldest first; answers the bytes written
@@ -144,7 +145,7 @@ int createFile(Flush& f) {
   f.file = fopen(f.path, "wb");
   if (f.file == nullptr) {
     say(f, "Unable to create file \"%s\"\n", f.path);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   trcBlockHeader* h = f.header;
   memset(h, 0, TRC_HEADER_SIZE);
@@ -158,12 +159,12 @@ int createFile(Flush& f) {
                "Unable to set file position in file \"%s\" to start of data buffer to write "
                "next data record,\nfseek() error:  \"%d\", reason:  \"%s\".\n",
                errno);
-      return 1;
+      return TRC_FLUSH_FAILED;
     }
     int64_t written = writeRecords(f);
     if (written < 0) {
       say(f, "Error writing data to file \"%s\"\n", f.path);
-      return 1;
+      return TRC_FLUSH_FAILED;
     }
     h->writeOffset = h->highWaterOffset = static_cast<uint32_t>(written);
   }
@@ -172,19 +173,19 @@ int createFile(Flush& f) {
              "Unable to set file position to start of new file \"%s\" to update trace control "
              "block,\nfseek() error:  \"%d\", reason:  \"%s\".\n",
              errno);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   if (!writeAll(f.file, h, TRC_HEADER_SIZE)) {
     say(f, "Error writing header for file \"%s\"\n", f.path);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   if (img->dataOffset > TRC_HEADER_SIZE &&
       !writeAll(f.file, reinterpret_cast<const uint8_t*>(img) + TRC_HEADER_SIZE,
                 img->dataOffset - TRC_HEADER_SIZE)) {
     say(f, "Error writing service info for file \"%s\"\n", f.path);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
-  return 0;
+  return TRC_FLUSH_DONE;
 }
 
 bool fileExists(const char* path) {
@@ -200,7 +201,7 @@ int trcFlushToFile(const trcBlockHeader* image, bool report) {
   FILE* out = trcOut();
   if (image == nullptr) {
     fputs("Trace buffer not specified, no action taken.\n", out);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   char path[TRC_KEY_SIZE];
   snprintf(path, sizeof path, "%.*s", static_cast<int>(sizeof image->fileName - 1),
@@ -208,7 +209,7 @@ int trcFlushToFile(const trcBlockHeader* image, bool report) {
   // The image holds bufferSize bytes; its counters must lie within them.
   if (const char* why = trcHeaderFault(image, image->bufferSize)) {
     if (report) fprintf(out, "Trace buffer is damaged (%s), no data written to \"%s\".\n", why, path);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
   Flush f{image, path, report, out, nullptr, nullptr};
   f.header = static_cast<trcBlockHeader*>(malloc(TRC_HEADER_SIZE));
@@ -217,22 +218,32 @@ int trcFlushToFile(const trcBlockHeader* image, bool report) {
             "Unable to allocate storage for local copy of trace control block for file "
             "\"%s\".\n",
             path);
-    return 1;
+    return TRC_FLUSH_FAILED;
   }
-  int rc = 2;
+  int rc = kRecreate;
   if (fileExists(path)) {
     rc = appendToFile(f);
     if (f.file != nullptr) fclose(f.file);
     f.file = nullptr;
   }
-  if (rc == 2) {
+  if (rc == kRecreate) {
     rc = createFile(f);
     if (f.file != nullptr && fclose(f.file) != 0 && rc == 0) {
       say(f, "Error writing header for file \"%s\"\n", path);
-      rc = 1;
+      rc = TRC_FLUSH_FAILED;
     }
     if (rc != 0 && f.file != nullptr) remove(path);
   }
   free(f.header);
   return rc;
+}
+
+void trcFlushLap(trcBlockHeader* live, const trcBlockHeader* image) {
+  if (live->fileFull) return;
+  if (trcFlushToFile(image, false) != TRC_FLUSH_FULL) return;
+  live->fileFull = 1;
+  fprintf(trcOut(),
+          "Trace file \"%.*s\" has reached its maximum size of %u bytes, no more records are "
+          "written to it.\n",
+          static_cast<int>(sizeof live->fileName - 1), live->fileName, live->maxFileSize);
 }

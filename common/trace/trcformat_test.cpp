@@ -118,9 +118,9 @@ Image twoThreads() {
   im.nameThread(0x11, "worker one");
   im.add(1, 11, 2, 0x11, 1, timeValue(1, 1));
   im.add(3, 11, 2, 0x11, 2, name16("first data"), {{3, Bytes("hello", 6)}});
-  im.add(1, 23, 2, 0x22, 1, timeValue(1, 3));
+  im.add(1, 11, 42, 0x22, 1, timeValue(1, 3));
   im.add(4, 11, 2, 0x11, 1, timeValue(1, 4), {{13, le16(5)}});
-  im.add(4, 23, 2, 0x22, 1, timeValue(1, 5));  // an exit value without its object
+  im.add(4, 11, 42, 0x22, 1, timeValue(1, 5));  // an exit value without its object
   im.add(3, 53, 200, 0x22, 4, name16("x"), {{1, le32(42)}});
   return im;
 }

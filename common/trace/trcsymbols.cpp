@@ -84,13 +84,16 @@ constexpr NamedRow kNamedRows[] = {
     {0, 0, "main"}, {0, 1, "printcb"}, {0, 2, "smallsample"}, {0, 3, "alldcs"},
     {0, 4, "mediumsample"}, {0, 5, "longsample"}, {0, 6, "thesepoints"}, {0, 7, "functionA"},
     {0, 8, "functionB"}, {0, 9, "noflow"}, {0, 10, "exits"},
-    // The thread wrapper and the recovery manager.
-    {6, 1, "klpThread::start"}, {6, 2, "klpThread::stop"},
+    {6, 53, "compareIgnTransCriteria"},
+    // The recovery manager.
     {7, 1, "recoveryMgr::erSetRecovery"}, {7, 2, "recoveryMgr::erUndoRecovery"},
     {11, 1, "OrdList::delList"}, {11, 2, "OrdList::putHead"}, {11, 3, "OrdList::putTail"},
     {11, 4, "OrdList::getHead"}, {11, 5, "OrdList::getTail"}, {11, 6, "ordListDeChain"},
     {11, 7, "KlpThread::init"}, {11, 8, "KlpThread::start"}, {11, 9, "KlpThread::stop"},
     {11, 10, "HoldLockMain"},
+    // The command engine.
+    {11, 41, "cmdsEngine"}, {11, 42, "cmdsHandleMessage"}, {11, 43, "cmdsSendReply"},
+    {11, 44, "cmdsStartStop"}, {11, 45, "cmdsCheckDbStatus"},
     {11, 93, "klpdll::loadLib"}, {11, 94, "getFileHandle"},
     // The OCI call wrappers, one row each in the order of their table.
     {11, 168, "ORADL::OCIInit"},
@@ -109,9 +112,6 @@ constexpr NamedRow kNamedRows[] = {
     {11, 205, "OCIDefineArrayOfStruct"}, {11, 206, "OCIStmtRelease"},
     // Code-page conversion.
     {42, 1, "ConvMgr::ConvMgr"}, {42, 11, "ConvMgr::openConverter"}, {42, 13, "ConvMgr::convert"},
-    // The command engine.
-    {23, 1, "cmdsEngine"}, {23, 2, "cmdsHandleMessage"}, {23, 3, "cmdsSendReply"},
-    {23, 4, "cmdsStartStop"}, {23, 5, "cmdsCheckDbStatus"},
 };
 
 struct Table {

@@ -94,7 +94,7 @@ void trcSetThreadData(const trcThreadData* entry) {
   if (stored != nullptr) copy = *stored;
   trcThreadTableUnlock();
 
-  if (stored == nullptr) return;
+  if (stored == nullptr || !trcIsRunning()) return;
   trcBlockHeader* b = trcint::enterBlock();
   if (b == nullptr) return;
   trcLockBuffer(b);

@@ -674,11 +674,14 @@ int32_t prepareIgnTransCriteria(char* pattern) {
   return kind;
 }
 
+// Its trace row: the last of component 6 ("Capture Transactions").
+constexpr int kTrcIgnTrans = 6, kFnIgnTrans = 53;
+
 int compareIgnTransCriteria(const char* pattern, const char* text) {
-  trcEntry(6, 54);
+  trcEntry(kTrcIgnTrans, kFnIgnTrans);
   int result = 0;
   if (!pattern || !text) {
-    trcExit(6, 54, TRC_RET_RC, 0, 0);
+    trcExit(kTrcIgnTrans, kFnIgnTrans, TRC_RET_RC, 0, 0);
     return 0;
   }
   const char* p = pattern;
@@ -740,6 +743,6 @@ int compareIgnTransCriteria(const char* pattern, const char* text) {
       backP = nullptr;
     }
   }
-  trcExit(6, 54, TRC_RET_RC, 0, result);
+  trcExit(kTrcIgnTrans, kFnIgnTrans, TRC_RET_RC, 0, result);
   return result;
 }

@@ -150,6 +150,8 @@ TEST(Klptrc, ServerTracedFromItsStart) {
   EXPECT_TRUE(has(stat, "Module-level version information:\n  name           apar      compiled\n"));
   std::string flow = trc(std::vector<std::string>{"flw"} + keys(srv)).out;
   EXPECT_GE(e2e::countOf(flow, "\npid = "), 2u) << flow;  // records of two threads at least
+  EXPECT_TRUE(has(flow, " thr = AdminThread\n")) << flow;   // the threads are named
+  EXPECT_TRUE(has(flow, " thr = Initial\n")) << flow;
   EXPECT_TRUE(has(flow, "| cmdsHandleMessage fnc_data \"Got IPC Message\" lvl 3\n")) << flow;
 
   std::string dump = dir.path() + "dump.trc";
@@ -165,7 +167,8 @@ TEST(Klptrc, ServerTracedFromItsStart) {
   std::string json = trc({"json", "-fn", moved, "-d", "1"}).out;
   EXPECT_EQ(json.substr(0, 39), "{\"displayTimeUnit\":\"ms\",\"traceEvents\":[");
   EXPECT_EQ(json.substr(json.size() - 4), "\n]}\n");
-  EXPECT_TRUE(has(json, "{\"name\":\"cmdsHandleMessage\",\"cat\":\"XKAPP Browser\",\"ph\":\"B\""));
+  EXPECT_TRUE(has(json, "{\"name\":\"cmdsHandleMessage\",\"cat\":\"Capture/Apply Common Function\","
+                        "\"ph\":\"B\""));
   EXPECT_FALSE(has(json, "\"ph\":\"i\""));  // level 1 only: no data records
 
   // Filters change while the trace runs; diag shows them.
@@ -174,9 +177,18 @@ TEST(Klptrc, ServerTracedFromItsStart) {
   EXPECT_EQ(trc(std::vector<std::string>{"diag"} + keys(srv)).out,
             "\nDiag Settings\n=============\nGlobal filter = 2\n"
             "Component: \"Capture Prune\" = 4\n"
-            "Component: \"XKAPP Browser\"\n Function: \"cmdsEngine\" = 1\n\n");
+            "Component: \"Capture/Apply Common Function\"\n Function: \"cmdsEngine\" = 1\n\n");
   EXPECT_TRUE(has(trc(std::vector<std::string>{"clr", "stat"} + keys(srv)).out, ""));
   EXPECT_TRUE(has(trc(std::vector<std::string>{"stat"} + keys(srv)).out, "Num Entries: 0\n"));
+
+  // The command program traces into the block while it runs and leaves the
+  // server's hold on it, and its description, alone.
+  auto status = [&] {
+    return klptest::run({klptest::binPath("klpkccmd"), "CAPTURE_SERVER=" + srv, "STATUS"});
+  };
+  ASSERT_EQ(status().exitCode, 0);
+  EXPECT_TRUE(has(trc(std::vector<std::string>{"stat"} + keys(srv)).out,
+                  "Replication version info:\n  klpkcap 9.7.8\n"));
 
   // Off while the server holds the block leaves the freeing to it.
   std::string off = trc(std::vector<std::string>{"off"} + keys(srv)).out;
@@ -185,6 +197,7 @@ TEST(Klptrc, ServerTracedFromItsStart) {
             "application will free the trace buffer while it is running or when it is "
             "restarted.\nUse the klptrc \"kill\" option to free the trace buffer, if the \"KCAP\" "
             "application is stopped.\n");
+  ASSERT_EQ(status().exitCode, 0);  // finds the block turned off
   EXPECT_TRUE(klptest::memoryExists(blockPath(dir, srv)));
   EXPECT_TRUE(e2e::waitFor([&] { return !keeperRunning(dir); }, 10000));
   ASSERT_TRUE(c.ask(14, &r));

@@ -64,6 +64,7 @@ void setUpLogFile(msgLogger* logger, klpParmClass* parms, const char* prefix) {
 
 int main(int argc, char** argv) {
   trcInitAnchor();
+  trcDeclareApplication();  // the traced server: it holds a trace block while attached
   msgLogger* logger = createMsgLoggerU(kAppKCapture, 0);
   if (logger == nullptr) return 12;
   klpSetProcessLogger(logger);
