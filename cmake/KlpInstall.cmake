@@ -26,6 +26,7 @@ endforeach()
 file(RELATIVE_PATH KLP_PC_TO_PREFIX ${CMAKE_INSTALL_FULL_LIBDIR}/pkgconfig ${CMAKE_INSTALL_PREFIX})
 file(RELATIVE_PATH KLP_PC_LIBDIR ${CMAKE_INSTALL_PREFIX} ${CMAKE_INSTALL_FULL_LIBDIR})
 file(RELATIVE_PATH KLP_PC_INCLUDEDIR ${CMAKE_INSTALL_PREFIX} ${CMAKE_INSTALL_FULL_INCLUDEDIR})
+string(REGEX REPLACE "/$" "" KLP_PC_TO_PREFIX "${KLP_PC_TO_PREFIX}")
 configure_file(${CMAKE_SOURCE_DIR}/cmake/klp.pc.in ${CMAKE_BINARY_DIR}/klp.pc @ONLY)
 install(FILES ${CMAKE_BINARY_DIR}/klp.pc DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig)
 
@@ -55,3 +56,20 @@ set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
 set(CPACK_STRIP_FILES ON)
 set(CPACK_PACKAGING_INSTALL_PREFIX /usr)
 include(CPack)
+
+# The install tests (tests/install/) install this build, package it, and
+# build a program against the result.
+if(TARGET test_tests_install)
+  set(KLP_SANITIZE_FLAGS "")
+  if(KLP_SANITIZE)
+    set(KLP_SANITIZE_FLAGS "-fsanitize=${KLP_SANITIZE}")
+  endif()
+  find_program(KLP_UNSHARE unshare REQUIRED)
+  find_program(KLP_BASH bash REQUIRED)
+  target_compile_definitions(test_tests_install PRIVATE
+    KLP_UNSHARE="${KLP_UNSHARE}" KLP_BASH="${KLP_BASH}"
+    KLP_BUILD_DIR="${CMAKE_BINARY_DIR}" KLP_CMAKE="${CMAKE_COMMAND}"
+    KLP_CPACK="${CMAKE_CPACK_COMMAND}" KLP_CC="${CMAKE_C_COMPILER}"
+    KLP_SANITIZE_FLAGS="${KLP_SANITIZE_FLAGS}" KLP_LIBDIR="${CMAKE_INSTALL_LIBDIR}")
+  add_dependencies(test_tests_install klp_docs klp ${KLP_PROGRAMS})
+endif()
