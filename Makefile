@@ -4,9 +4,10 @@
 #   make tsan   build under ThreadSanitizer, run the multithreaded tests
 #   make bench  build optimised and run the benchmarks
 #   make fuzz   build the fuzz targets with clang's libFuzzer
+#   make package  build optimised for /usr and make the Debian package
 JOBS ?= $(shell nproc)
 
-.PHONY: all build demo test tsan bench fuzz clean
+.PHONY: all build demo test tsan bench fuzz package clean
 
 all: build
 
@@ -40,5 +41,13 @@ fuzz:
 	cmake --build build-fuzz -j $(JOBS)
 	@echo "fuzz targets are in build-fuzz/bin (run one with -max_total_time=60)"
 
+# Its own build tree: the package's programs look for their catalogue under
+# the prefix they were configured for, /usr.
+package:
+	cmake -S . -B build-pkg -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKLP_TESTS=OFF -DCMAKE_INSTALL_PREFIX=/usr >/dev/null
+	cmake --build build-pkg -j $(JOBS)
+	cd build-pkg && cpack
+	@ls build-pkg/*.deb
+
 clean:
-	rm -rf build build-asan build-tsan build-bench build-fuzz
+	rm -rf build build-asan build-tsan build-bench build-fuzz build-pkg

@@ -22,6 +22,11 @@
 #ifndef KLP_DATA_DIR
 #define KLP_DATA_DIR "/usr/local/share/klp"
 #endif
+// The data directory as seen from the programs' directory, so that an
+// installed tree moved to another prefix still finds its catalogue.
+#ifndef KLP_DATA_DIR_FROM_BIN
+#define KLP_DATA_DIR_FROM_BIN "../share/klp"
+#endif
 
 // The texts a lookup can find, by message number. Only decimal ids of
 // message numbers are kept, so the index stays small whatever the file holds.
@@ -171,13 +176,17 @@ std::string joinDir(const std::string& dir, const char* name) {
   return dir.back() == '/' ? dir + name : dir + "/" + name;
 }
 
-// Where the catalogue lives: KLP_CATALOG_DIR, the program's directory, then
-// the installed data directory. A name with a '/' is taken as it is.
+// Where the catalogue lives: KLP_CATALOG_DIR, the program's directory, the
+// data directory beside it, then the configured data directory. A name with
+// a '/' is taken as it is.
 std::string locate(const char* name) {
   if (strchr(name, '/') != nullptr) return name;
   const char* env = getenv("KLP_CATALOG_DIR");
-  std::string candidates[3] = {env != nullptr && *env != '\0' ? joinDir(env, name) : "",
-                               joinDir(exeDir(), name), joinDir(KLP_DATA_DIR, name)};
+  std::string dir = exeDir();
+  std::string candidates[4] = {env != nullptr && *env != '\0' ? joinDir(env, name) : "",
+                               joinDir(dir, name),
+                               joinDir(joinDir(dir, KLP_DATA_DIR_FROM_BIN), name),
+                               joinDir(KLP_DATA_DIR, name)};
   for (const std::string& c : candidates)
     if (!c.empty() && fileExists(c)) return c;
   return "";

@@ -150,6 +150,13 @@ uint32_t trcParseSize(const char* text) {
   return value;
 }
 
+const char* trcKeyword(int i, int* values) {
+  if (i < 0 || static_cast<size_t>(i) >= sizeof kKeywords / sizeof kKeywords[0]) return nullptr;
+  const Keyword& k = kKeywords[i];
+  *values = k.action == A_FLAG || k.action == A_KIND ? 0 : k.action == A_FILTER ? 2 : 1;
+  return k.word;
+}
+
 void trcParseArgs(int argc, char** argv, trcOptions* o) {
   memset(o, 0, sizeof *o);
   o->logLevel = o->outLevel = 0x7FFF;

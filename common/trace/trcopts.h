@@ -36,6 +36,11 @@ struct trcOptions {
 // on the trace output stream; o->error tells whether the command may run.
 // Free the filter list with trcFreeOptions.
 void trcParseArgs(int argc, char** argv, trcOptions* o);
+
+// The parser's keywords in table order, for the manual and the shell
+// completion: the word as matched (null past the end) and how many values
+// follow it (0, 1, or 2 for -df).
+const char* trcKeyword(int i, int* values);
 void trcFreeOptions(trcOptions* o);
 
 // A level list: "1" to "6" add the bits 1, 2, 4, 8, 16, 32, commas are
