@@ -1,12 +1,18 @@
 // The fault-injecting layer in one process: which uses its texts make fail,
-// the texts it refuses, and its allocator.
+// the texts it refuses, its allocator, and the library loaders' failure
+// points, which no scenario of the walk reaches.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <functional>
 #include <new>
 #include <string>
+#include <vector>
 
+#include "common/db/klpdll.h"
+#include "common/db/oradl.h"
+#include "common/msg/msglogger.h"
 #include "common/platform/hsv_fault.h"
 #include "tests/testing/klptest.h"
 
@@ -84,4 +90,43 @@ TEST(FaultLayer, PlatformObjectsComeFromAnAllocatorThatCanFail) {
   EXPECT_EQ(w->create(HSV_CREATE_OPTION), ECF_OK);  // its state is the fourth
   delete w;
   EXPECT_EQ(hsvFaultUses(HSV_FAULT_ALLOC), 4u);
+}
+
+// The loaders under a failing load, lookup or allocation, each in a child
+// of its own: their state is process-wide.
+TEST(FaultLayer, LibraryLoadersReportTheirFailures) {
+  if (!hsvFaultCompiledIn()) GTEST_SKIP() << "built without KLP_FAULTS";
+  const struct {
+    const char* spec;
+    bool oci;  // the OCI loader; else a descriptor of two functions
+    int rc;
+    std::vector<const char*> texts;
+  } cases[] = {
+      {"lib.load:1", false, KLPDLL_RC_NOT_LOADED, {"KLP0616E", "0x90000002", "libm.so.6"}},
+      {"lib.getFuncAddress:2", false, 0, {"KLP0606I", "KLP0617E", "\"sin\" was not found"}},
+      {"lib.load:1", true, 0, {"KLP0657E", "\"0x90000002\""}},
+      {"lib.getFuncAddress:1", true, 0, {"KLP0658I", "KLP0659E", "\"OCIHandleAlloc\""}},
+      // The OCI library object needs no allocation that could end the caller.
+      {"alloc:1+", true, 0, {"KLP0658I", "KLP0659E"}},
+  };
+  for (const auto& c : cases) {
+    klptest::TmpDir dir;
+    klptest::Child child = klptest::inChild(dir.path(), [&] {
+      klptest::ProcessLogger logger(MSG_APP_KLPKCCMD, dir.path(), "lib.log");
+      if (!hsvFaultArm(c.spec)) return 99;
+      if (c.oci) {
+        ORADL::setLibraryName("libm.so.6");
+        return ORADL::OCIInit();
+      }
+      const klpDLLCandidate libm[] = {{"libm.so.6", ""}};
+      klpDLLFunc funcs[] = {{"cos", nullptr}, {"sin", nullptr}};
+      klpDLL dll("ODB_DLL", libm, 1, funcs, 2);
+      return klpdll::loadLib(&dll);
+    });
+    EXPECT_TRUE(child.exited) << c.spec << " signal " << child.signal << "\n" << child.err;
+    EXPECT_EQ(child.exitCode, c.rc % 256) << c.spec;
+    std::string log = klptest::readFile(dir.path() + "lib.log");
+    for (const char* t : c.texts)
+      EXPECT_NE(log.find(t), std::string::npos) << c.spec << ": " << t << "\n" << log;
+  }
 }
