@@ -1,6 +1,7 @@
 # Convenience wrapper around CMake and CTest.
 #   make demo   build, start the sample K Capture server, command it
-#   make test   build under AddressSanitizer + UndefinedBehaviorSanitizer, run every test
+#   make test   build under AddressSanitizer + UndefinedBehaviorSanitizer, with fault
+#               injection (KLP_FAULTS), run every test
 #   make tsan   build under ThreadSanitizer, run the multithreaded tests
 #   make bench  build optimised and run the benchmarks
 #   make fuzz   build the fuzz targets with clang's libFuzzer
@@ -19,7 +20,8 @@ demo: build
 	./scripts/demo.sh build
 
 test:
-	cmake -S . -B build-asan -DCMAKE_BUILD_TYPE=Debug -DKLP_SANITIZE=address,undefined >/dev/null
+	cmake -S . -B build-asan -DCMAKE_BUILD_TYPE=Debug -DKLP_SANITIZE=address,undefined \
+	  -DKLP_FAULTS=ON >/dev/null
 	cmake --build build-asan -j $(JOBS)
 	ulimit -q unlimited 2>/dev/null || true; \
 	ASAN_OPTIONS=detect_leaks=1:abort_on_error=0 UBSAN_OPTIONS=print_stacktrace=1 \

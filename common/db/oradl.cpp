@@ -37,8 +37,12 @@ std::atomic<void*> gSlots[ORADL::FUNCTION_COUNT];
 char gLibName[1024] = "libclntsh.so";      // under gInitLock
 
 // Never unloaded: resolved addresses stay valid for the life of the process.
+// Built in static storage and never destroyed, so that no allocation can
+// fail (a throwing one would end the caller's process) and no exit handler
+// unloads it.
 HSVSharedLib& ociLibrary() {
-  static HSVSharedLib* lib = new HSVSharedLib;
+  alignas(HSVSharedLib) static unsigned char storage[sizeof(HSVSharedLib)];
+  static HSVSharedLib* lib = ::new (storage) HSVSharedLib;
   return *lib;
 }
 

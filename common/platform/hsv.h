@@ -8,6 +8,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <ctime>
+#include <new>
 
 // ---------------------------------------------------------------------------
 // Platform codes
@@ -67,9 +68,21 @@ hsvRC hsvIPCGetResID(const char* path, int option, HSVResID* out);
 void hsvResIDPrintable(const HSVResID& id, char* buf, size_t bufLen);
 
 // ---------------------------------------------------------------------------
+// Platform objects made on the heap are allocated by the platform layer, so
+// that a test can make the allocation fail (hsv_fault.h): a nothrow new
+// answers null, a plain one throws std::bad_alloc, as when memory runs out.
+// ---------------------------------------------------------------------------
+struct HSVHeapObject {
+  static void* operator new(size_t size);
+  static void* operator new(size_t size, const std::nothrow_t&) noexcept;
+  static void operator delete(void* p) noexcept;
+  static void operator delete(void* p, const std::nothrow_t&) noexcept;
+};
+
+// ---------------------------------------------------------------------------
 // Inter-process message queue (POSIX message queue, mode 0600).
 // ---------------------------------------------------------------------------
-class HSVHIPCQueue {
+class HSVHIPCQueue : public HSVHeapObject {
  public:
   HSVHIPCQueue();
   ~HSVHIPCQueue();  // closes the descriptor; never destroys the queue
@@ -115,7 +128,7 @@ class HSVHIPCQueue {
 // ---------------------------------------------------------------------------
 // Inter-process shared memory (POSIX shared memory, mode 0600).
 // ---------------------------------------------------------------------------
-class HSVHIPCMemory {
+class HSVHIPCMemory : public HSVHeapObject {
  public:
   HSVHIPCMemory();
   ~HSVHIPCMemory();  // unmaps; never destroys the block
@@ -144,7 +157,7 @@ class HSVHIPCMemory {
 // Wait/post object (process-local event that counts its posts).
 // A post while nobody waits is remembered until a wait consumes it.
 // ---------------------------------------------------------------------------
-class HSVHIPCWaitpost {
+class HSVHIPCWaitpost : public HSVHeapObject {
  public:
   HSVHIPCWaitpost();
   ~HSVHIPCWaitpost();
@@ -214,7 +227,7 @@ hsvRC hsvWaitProcess(int32_t pid, int* exitCode);
 // ---------------------------------------------------------------------------
 // Shared libraries (dlopen)
 // ---------------------------------------------------------------------------
-class HSVSharedLib {
+class HSVSharedLib : public HSVHeapObject {
  public:
   HSVSharedLib();
   ~HSVSharedLib();  // unloads when loaded
@@ -256,7 +269,7 @@ void hsvTrapFilePrepare();
 // the process.
 void hsvTrapLine(int signalNumber, const char* threadName);
 
-class HSVTrapFile {
+class HSVTrapFile : public HSVHeapObject {
  public:
   HSVTrapFile();
   ~HSVTrapFile();  // closes

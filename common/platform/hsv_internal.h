@@ -7,6 +7,7 @@
 struct stat;
 
 #include "common/platform/hsv.h"
+#include "common/platform/hsv_fault.h"
 
 namespace hsvint {
 
@@ -24,5 +25,18 @@ bool posixName(const HSVResID& id, char (&name)[sizeof(HSVResID::part2)]);
 // nothing to group or others; ECF_NOT_OWNED otherwise. Its status goes to
 // out when given.
 hsvRC checkPrivate(int fd, struct stat* out = nullptr);
+
+// Fault injection (hsv_fault.h): ECF_OK, or the code of an injected failure
+// of this use of op; and a sleep or a queue wait as the armed process is to
+// take it. Without KLP_FAULTS they are constants the compiler folds away.
+#ifdef KLP_FAULTS
+hsvRC faultCheck(hsvFaultOp op);
+uint32_t faultSleepMs(uint32_t ms);
+int32_t faultWaitMs(int32_t ms);
+#else
+inline hsvRC faultCheck(hsvFaultOp) { return ECF_OK; }
+inline uint32_t faultSleepMs(uint32_t ms) { return ms; }
+inline int32_t faultWaitMs(int32_t ms) { return ms; }
+#endif
 
 }  // namespace hsvint

@@ -35,6 +35,7 @@ hsvRC HSVHIPCMemory::create(const HSVResID& id, size_t size, int /*option*/) {
   if (size == 0 || size > static_cast<size_t>(PTRDIFF_MAX)) return ECF_INVALID_ARGUMENT;
   char name[sizeof(HSVResID::part2)];
   if (!posixName(id, name)) return ECF_INVALID_ARGUMENT;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_MEMORY_CREATE)) return f;
   int fd = shm_open(name, O_RDWR | O_CREAT | O_EXCL, 0600);
   if (fd < 0) return errno == EEXIST ? takenBy(name) : hsvErrnoToECF(errno);
   // A new object is zero-filled by the kernel; ftruncate only sizes it.
@@ -64,6 +65,7 @@ hsvRC HSVHIPCMemory::attach(const HSVResID& id) {
   if (addr_) return ECF_INVALID_ARGUMENT;
   char name[sizeof(HSVResID::part2)];
   if (!posixName(id, name)) return ECF_INVALID_ARGUMENT;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_MEMORY_ATTACH)) return f;
   int fd = shm_open(name, O_RDWR, 0);
   if (fd < 0) return hsvErrnoToECF(errno);
   struct stat st{};

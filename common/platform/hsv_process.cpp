@@ -10,6 +10,7 @@
 #include <cstring>
 
 #include "common/platform/hsv.h"
+#include "common/platform/hsv_internal.h"
 
 extern char** environ;
 
@@ -33,6 +34,7 @@ bool besideExecutable(const char* program, char* path, size_t size) {
 hsvRC hsvStartProcess(const char* program, const char* const* argv, int32_t* pid) {
   if (program == nullptr || program[0] == '\0' || argv == nullptr || pid == nullptr)
     return ECF_INVALID_ARGUMENT;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_PROCESS_START)) return f;
   char path[PATH_MAX];
   bool found = strchr(program, '/') == nullptr && besideExecutable(program, path, sizeof path);
 
@@ -66,6 +68,7 @@ hsvRC hsvStartProcess(const char* program, const char* const* argv, int32_t* pid
 }
 
 hsvRC hsvWaitProcess(int32_t pid, int* exitCode) {
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_PROCESS_WAIT)) return f;
   int status = 0;
   pid_t got;
   do {

@@ -36,6 +36,7 @@ hsvRC HSVHIPCQueue::create(const HSVResID& id, size_t maxMsgSize, int /*option*/
   if (maxMsgSize == 0 || maxMsgSize > static_cast<size_t>(LONG_MAX)) return ECF_INVALID_ARGUMENT;
   char name[sizeof(HSVResID::part2)];
   if (!posixName(id, name)) return ECF_INVALID_ARGUMENT;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_QUEUE_CREATE)) return f;
   mq_attr attr{};
   attr.mq_maxmsg = HSV_QUEUE_DEPTH;
   attr.mq_msgsize = static_cast<long>(maxMsgSize);
@@ -51,6 +52,7 @@ hsvRC HSVHIPCQueue::attach(const HSVResID& id) {
   if (fd_ >= 0) return ECF_INVALID_ARGUMENT;
   char name[sizeof(HSVResID::part2)];
   if (!posixName(id, name)) return ECF_INVALID_ARGUMENT;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_QUEUE_ATTACH)) return f;
   mqd_t q = mq_open(name, O_RDWR);
   if (q == static_cast<mqd_t>(-1)) return hsvErrnoToECF(errno);
   hsvRC owned = hsvint::checkPrivate(q);
@@ -94,6 +96,8 @@ hsvRC HSVHIPCQueue::putWait(const void* buf, size_t len, int32_t waitMs) {
   if (fd_ < 0) return ECF_NOT_ATTACHED;
   if (!buf && len > 0) return ECF_INVALID_ARGUMENT;
   if (len > msgSize_) return ECF_MSG_TOO_BIG;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_QUEUE_PUT)) return f;
+  waitMs = hsvint::faultWaitMs(waitMs);
   static const char kEmpty = 0;
   const char* data = buf ? static_cast<const char*>(buf) : &kEmpty;
   // The deadline is absolute, so a retry after a signal waits only for what
@@ -115,6 +119,8 @@ hsvRC HSVHIPCQueue::get(void* buf, size_t capacity, size_t* outLen, int32_t time
   // The kernel refuses a receive into less than the message size; say so
   // plainly instead of passing on an obscure EMSGSIZE.
   if (capacity < msgSize_) return ECF_BUFFER_TOO_SMALL;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_QUEUE_GET)) return f;
+  timeoutMs = hsvint::faultWaitMs(timeoutMs);
   timespec deadline = hsvint::deadlineAfter(CLOCK_REALTIME, timeoutMs);
   for (;;) {
     ssize_t n = timeoutMs < 0
@@ -133,6 +139,7 @@ hsvRC HSVHIPCQueue::get(void* buf, size_t capacity, size_t* outLen, int32_t time
 
 bool HSVHIPCQueue::hasMessage() {
   if (fd_ < 0) return false;
+  if (hsvint::faultCheck(HSV_FAULT_QUEUE_HAS_MESSAGE) != ECF_OK) return false;
   mq_attr attr{};
   if (mq_getattr(fd_, &attr) != 0) return false;
   return attr.mq_curmsgs > 0;
@@ -140,6 +147,8 @@ bool HSVHIPCQueue::hasMessage() {
 
 hsvRC HSVHIPCQueue::waitForMessage(int32_t timeoutMs) {
   if (fd_ < 0) return ECF_NOT_ATTACHED;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_QUEUE_WAIT)) return f;
+  timeoutMs = hsvint::faultWaitMs(timeoutMs);
   timespec deadline = hsvint::deadlineAfter(CLOCK_MONOTONIC, timeoutMs);
   for (;;) {
     pollfd p{};

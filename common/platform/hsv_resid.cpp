@@ -22,9 +22,11 @@ uint64_t fnv1a64(const char* s) {
   return h;
 }
 
-hsvRC makeID(const char* path, int option, const char* kind, const char* prefix, HSVResID* out) {
+hsvRC makeID(const char* path, int option, const char* kind, const char* prefix, hsvFaultOp op,
+             HSVResID* out) {
   if (!out) return ECF_INVALID_ARGUMENT;
   if (!path || !*path) return ECF_INVALID_ARGUMENT;
+  if (hsvRC f = hsvint::faultCheck(op)) return f;
   HSVResID id{};
   snprintf(id.part1, sizeof id.part1, "%s", kind);
   snprintf(id.part2, sizeof id.part2, "/%s.%016" PRIx64, prefix, fnv1a64(path));
@@ -39,11 +41,11 @@ int partLen(const char* part, size_t cap) { return static_cast<int>(strnlen(part
 }  // namespace
 
 hsvRC hsvIPCGetQueResID(const char* path, int option, HSVResID* out) {
-  return makeID(path, option, "mqueue", "klpq", out);
+  return makeID(path, option, "mqueue", "klpq", HSV_FAULT_RESID_QUEUE, out);
 }
 
 hsvRC hsvIPCGetResID(const char* path, int option, HSVResID* out) {
-  return makeID(path, option, "shm", "klpm", out);
+  return makeID(path, option, "shm", "klpm", HSV_FAULT_RESID_MEMORY, out);
 }
 
 void hsvResIDPrintable(const HSVResID& id, char* buf, size_t bufLen) {

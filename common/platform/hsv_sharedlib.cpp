@@ -7,6 +7,7 @@
 #include <cstring>
 
 #include "common/platform/hsv.h"
+#include "common/platform/hsv_internal.h"
 
 namespace {
 
@@ -26,6 +27,11 @@ hsvRC HSVSharedLib::load(const char* name, int option) {
   if (!name || !*name) return ECF_INVALID_ARGUMENT;
   // Loading over a loaded library would lose its handle and leak it.
   if (handle_) return ECF_ALREADY_EXISTS;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_LIB_LOAD)) {
+    errno_ = ENOENT;
+    snprintf(err_, sizeof err_, "%s: library not loaded", name);
+    return f;
+  }
   int flags = option == 4 ? (RTLD_LAZY | RTLD_LOCAL) : (RTLD_NOW | RTLD_LOCAL);
   dlerror();
   errno = 0;
@@ -54,6 +60,10 @@ hsvRC HSVSharedLib::getFuncAddress(const char* symbol, void** address) {
   *address = nullptr;
   if (!handle_) return ECF_NOT_ATTACHED;
   if (!symbol || !*symbol) return ECF_INVALID_ARGUMENT;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_LIB_SYMBOL)) {
+    snprintf(err_, sizeof err_, "%s: symbol not found", symbol);
+    return f;
+  }
   dlerror();
   *address = dlsym(handle_, symbol);
   if (*address) return ECF_OK;

@@ -63,6 +63,7 @@ bool hsvTimeGmTime(int64_t seconds, struct tm* out) {
 }
 
 void hsvSleep(uint32_t milliseconds) {
+  milliseconds = hsvint::faultSleepMs(milliseconds);
   timespec req{};
   req.tv_sec = static_cast<time_t>(milliseconds / 1000);
   req.tv_nsec = static_cast<long>(milliseconds % 1000) * 1000000L;

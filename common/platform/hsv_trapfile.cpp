@@ -13,6 +13,7 @@
 #include <ctime>
 
 #include "common/platform/hsv.h"
+#include "common/platform/hsv_internal.h"
 
 namespace {
 
@@ -186,6 +187,7 @@ void hsvTrapFilePrepare() { pthread_once(&gTrapOnce, prepareStackWalker); }
 hsvRC HSVTrapFile::open(const char* path, int /*option*/) {
   if (!path || !*path) return ECF_INVALID_ARGUMENT;
   close();
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_TRAPFILE_OPEN)) return f;
   hsvTrapFilePrepare();
   int fd;
   do {
@@ -205,12 +207,14 @@ hsvRC HSVTrapFile::seekToEnd() {
 hsvRC HSVTrapFile::write(const void* buf, size_t len) {
   if (fd_ < 0) return ECF_NOT_ATTACHED;
   if (!buf && len > 0) return ECF_INVALID_ARGUMENT;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_TRAPFILE_WRITE)) return f;
   return writeAll(fd_, buf, len);
 }
 
 hsvRC HSVTrapFile::dump(int /*option*/, int signalNumber, const void* siginfo,
                         const void* ucontext) {
   if (fd_ < 0) return ECF_NOT_ATTACHED;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_TRAPFILE_WRITE)) return f;
   int savedErrno = errno;  // a handler must leave errno as it found it
   Text t;
   t.str("*** Trap dump ***\nSignal: ");

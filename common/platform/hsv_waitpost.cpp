@@ -13,7 +13,7 @@
 // The state is allocated by the first create and kept until the object is
 // destructed: a wait or post that races with destroy then finds the object
 // closed instead of freed memory.
-struct HSVHIPCWaitpost::Impl {
+struct HSVHIPCWaitpost::Impl : HSVHeapObject {
   pthread_mutex_t mutex;
   pthread_cond_t cond;      // signalled by post
   pthread_cond_t drained;   // signalled when the last waiter leaves a closing object
@@ -59,6 +59,7 @@ int initImpl(pthread_mutex_t* mutex, pthread_cond_t* cond, pthread_cond_t* drain
 }  // namespace
 
 hsvRC HSVHIPCWaitpost::create(int /*option*/) {
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_WAITPOST_CREATE)) return f;
   Impl* im = __atomic_load_n(&impl_, __ATOMIC_ACQUIRE);
   if (!im) {
     im = new (std::nothrow) Impl;
@@ -101,6 +102,7 @@ struct WaiterGuard {
 hsvRC HSVHIPCWaitpost::wait(int32_t timeMs) {
   Impl* im = __atomic_load_n(&impl_, __ATOMIC_ACQUIRE);
   if (!im) return ECF_WAITPOST_NOT_INITIALIZED;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_WAITPOST_WAIT)) return f;
   timespec deadline = hsvint::deadlineAfter(CLOCK_MONOTONIC, timeMs);
   pthread_mutex_lock(&im->mutex);
   if (!im->live) {
@@ -131,6 +133,7 @@ hsvRC HSVHIPCWaitpost::wait(int32_t timeMs) {
 hsvRC HSVHIPCWaitpost::post() {
   Impl* im = __atomic_load_n(&impl_, __ATOMIC_ACQUIRE);
   if (!im) return ECF_WAITPOST_NOT_INITIALIZED;
+  if (hsvRC f = hsvint::faultCheck(HSV_FAULT_WAITPOST_POST)) return f;
   pthread_mutex_lock(&im->mutex);
   hsvRC result = ECF_WAITPOST_NOT_INITIALIZED;
   if (im->live) {

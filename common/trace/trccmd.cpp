@@ -86,7 +86,9 @@ void dropBlock(trcAnchor* a, bool destroy) {
 }
 
 // Attaches to the block of the keys when there is one. False when the
-// command is over (an incompatible block).
+// command is over: a block that is there but cannot be attached (nothing
+// the command would go on to say about it would be true), or one of an
+// incompatible version.
 bool attachBlock(Run* r) {
   trcAnchor* a = r->anchor;
   if (a->block != nullptr) return true;
@@ -99,7 +101,7 @@ bool attachBlock(Run* r) {
     fprintf(trcOut(), "Function 'HSVHIPCMemory::attach' with IPC key '%s' failed with HSVE reason "
             "'%s'.\n", key != nullptr ? key : "UNKNOWN", ecfErrorGetDescription(rc));
     free(key);
-    return true;
+    return false;
   }
   a->memory = memory;
   trcint::publishBlock(block, memory->getSize());

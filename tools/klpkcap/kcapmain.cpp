@@ -108,7 +108,10 @@ int main(int argc, char** argv) {
   cmdsSetDbStatusCheck(kcapDbStatus);
 
   rc = setEnvIpcQRcvHdl(env);
-  if (rc != 0) finish(rc);
+  if (rc != 0) {
+    logInternalError(kProgram, rc, "setEnvIpcQRcvHdl");
+    finish(rc);
+  }
 
   OrdList threads;
   threads.makeShared("KCAPThreads", 1);
