@@ -542,6 +542,9 @@ int cmdsEngine(OrdList* threads, int mode, int32_t* stopRequested) {
       hsvRC grc = q->get(buf, sizeof buf, &got, CMDS_GET_TIMEOUT_MS);
       if (grc != ECF_OK) {
         noteGetFailure(&st, ecfErrorGetDescription(grc));
+        // The message is still there: without a pause the loop would spin.
+        HSVTimeUTC now = hsvTimeGetUTC();
+        hsvSleep(static_cast<uint32_t>((1000000 - now.microseconds) / 1000 + 1));
       } else {
         int hrc = cmdsHandleMessage(&st, threads, buf, got);  // 4-8
         if (hrc != 0 && st.endRc == 0) st.endRc = hrc;

@@ -2,11 +2,13 @@
 // the texts it refuses, its allocator, and the library loaders' failure
 // points, which no scenario of the walk reaches.
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <functional>
 #include <new>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -129,4 +131,39 @@ TEST(FaultLayer, LibraryLoadersReportTheirFailures) {
     for (const char* t : c.texts)
       EXPECT_NE(log.find(t), std::string::npos) << c.spec << ": " << t << "\n" << log;
   }
+}
+
+// A server whose every get fails while a request waits on its queue keeps
+// looping, reporting once; it must pause between passes, not spin a core.
+TEST(FaultLayer, AServerWhoseGetsFailDoesNotSpin) {
+  if (!hsvFaultCompiledIn()) GTEST_SKIP() << "built without KLP_FAULTS";
+  klptest::TmpDir tmp;
+  const std::string queuePath = tmp.path() + "GF.KLP.KCAP.IPC";
+  klptest::Background server({klptest::binPath("klpkcap"), "CAPTURE_SERVER=GF"},
+                             {"KLP_TEST_FAULTS=klpkcap/queue.get:1+"});
+  for (int i = 0; i < 500 && !klptest::queueExists(queuePath); ++i) usleep(10000);
+  ASSERT_TRUE(klptest::queueExists(queuePath));
+  HSVResID id;
+  HSVHIPCQueue q;
+  ASSERT_EQ(hsvIPCGetQueResID(queuePath.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+  ASSERT_EQ(q.attach(id), ECF_OK);
+  const char request[44] = {'I', 'P', 'C', ':', 0, 0, 0, 0, 1, 0, 0, 0, 44, 0, 0, 0, 15};
+  ASSERT_EQ(q.put(request, sizeof request), ECF_OK);
+  q.detach();
+  auto cpuTicks = [&] {
+    std::string stat = klptest::readFile("/proc/" + std::to_string(server.pid()) + "/stat");
+    std::istringstream in(stat.substr(stat.rfind(')') + 2));
+    std::string field;
+    long ticks = 0;
+    for (int f = 3; f <= 15 && in >> field; ++f)
+      if (f >= 14) ticks += std::stol(field);  // utime, stime
+    return ticks;
+  };
+  long before = cpuTicks();
+  sleep(2);
+  long used = cpuTicks() - before;  // a spinning loop takes about 200 ticks here
+  server.kill(SIGKILL);
+  server.wait();
+  EXPECT_LT(used, 50) << "ticks of CPU in 2 s";
+  if (q.attach(id) == ECF_OK) q.destroy();
 }
