@@ -205,8 +205,7 @@ bool memoryExists(const std::string& path) {
   return exists<HSVHIPCMemory>(path, hsvIPCGetResID, HSV_MEMORY_RESID_OPTION);
 }
 
-// Notes each message when setRouting sees it (composed, routing not yet
-// resolved), under the number it had when composing began.
+// Notes each message as setRouting sees it, by its number before composing.
 thread_local int composing = 0;
 class RecordingLogger : public msgLoggerU {
  public:
@@ -220,9 +219,10 @@ class RecordingLogger : public msgLoggerU {
     int i = 0, last = r->valueCount;
     if (i < last && getApplicationName() == std::string(r->values[i])) ++i;
     if (i < last && qt == r->values[i]) ++i;
-    while (last > i && strlen(r->values[last - 1]) == 1 && pads.find(r->values[last - 1]) != std::string::npos)
+    while (last > i && strlen(r->values[last - 1]) == 1 && pads.find(r->values[last - 1][0]) < 2)
       --last;
-    std::string line = std::to_string(composing) + " <" + r->origin + "> " + std::to_string(r->routing) + ":";
+    std::string line = std::to_string(composing) + " <" + r->origin + "> ";
+    line += std::to_string(r->routing) + ":";
     for (char sep = ' '; i < last; ++i, sep = '|') line += sep + std::string(r->values[i]);
     if (r->extra[0] != -1 || r->extra[1] != -1)
       line += " (" + std::to_string(r->extra[0]) + "," + std::to_string(r->extra[1]) + ")";
