@@ -40,8 +40,7 @@ TEST(BuiltinTable, LoadsWellFormedRowsOnceAndTheFirstDefinitionWins) {
   msgLogger l(MSG_APP_KLPKCCMD, 0);
   EXPECT_EQ(116, l.loadBuiltinMsgs(builtinMsgTable));
   EXPECT_EQ(0, l.loadBuiltinMsgs(builtinMsgTable));
-  const char* none[] = {nullptr};
-  EXPECT_EQ(0, l.loadBuiltinMsgs(none) + l.loadBuiltinMsgs(nullptr) + l.addBuiltinMsg(nullptr));
+  EXPECT_EQ(0, l.loadBuiltinMsgs(builtinMsgTable + 116) + l.loadBuiltinMsgs(nullptr) + l.addBuiltinMsg(nullptr));
   const std::pair<const char*, int> rows[] = {
       {"KLP0000D zero", 0}, {"KLP9999D too big", 0}, {"XYZ8100D not ours", 0}, {"KLP81", 0},
       {"KLP8a00D", 0},      {"KLP8100D first", 1},   {"KLP8100D second", 0},   {"KLP8200D other", 1},
@@ -88,6 +87,10 @@ TEST_F(TextTest, TextsComposeFromTheirRowsValuesAndHeaderValues) {
   EXPECT_EQ("KLP8006D  \"KlpKCcmd\" : \"K\\nLP\" : \"T\" : Element \"X\" is out of range.", text(8006, "X"));
   logger.setProgramQualifier(std::string(200, 'Q').c_str());
   EXPECT_EQ(std::string(128, 'Q'), logger.getProgramQualifier());
+  std::string names;
+  for (int i = -1; i <= MSG_APPLICATION_COUNT; ++i) names += msgApplicationName(i) + std::string("|");
+  EXPECT_EQ("|@A|Capture|Apply|KlpCcmd|KlpAcmd|K Capture|K Apply|Klpmon|Klppwd|KlpMcmd|KlpKCcmd|"
+            "KlpKAcmd|KlpTDiff|KlpKMFmt|Analyzer|K Analyzer|KlpSList|KlpTRep||", names);
 }
 
 TEST_F(TextTest, HeaderValuesFollowTheNumberRangesAndPushOutTheLastCallerValues) {
