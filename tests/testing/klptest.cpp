@@ -1,22 +1,22 @@
 #include "tests/testing/klptest.h"
 
 #include <fcntl.h>
-#include <poll.h>
 #include <signal.h>
 #include <spawn.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
+#include <mutex>
 #include <stdexcept>
 #include <thread>
+#include <utility>
 
 #include "common/msg/msglogger.h"
 #include "common/platform/hsv.h"
@@ -29,35 +29,28 @@ TmpDir::TmpDir() {
   char tmpl[] = "/tmp/klptest.XXXXXX";
   if (!mkdtemp(tmpl)) throw std::runtime_error("mkdtemp failed");
   path_ = std::string(tmpl) + "/";
-  if (const char* old = getenv("TMPDIR")) {
-    hadTmpdir_ = true;
-    oldTmpdir_ = old;
-  }
+  if ((hadTmpdir_ = getenv("TMPDIR") != nullptr)) oldTmpdir_ = getenv("TMPDIR");
   setenv("TMPDIR", path_.c_str(), 1);
 }
 
 TmpDir::~TmpDir() {
   std::error_code ec;
   std::filesystem::remove_all(path_, ec);
-  if (hadTmpdir_)
-    setenv("TMPDIR", oldTmpdir_.c_str(), 1);
-  else
-    unsetenv("TMPDIR");
+  hadTmpdir_ ? setenv("TMPDIR", oldTmpdir_.c_str(), 1) : unsetenv("TMPDIR");
 }
 
 std::string binPath(const std::string& program) { return std::string(KLP_BIN_DIR) + "/" + program; }
 
 namespace {
 
+// The current environment with the extra "NAME=value" entries put over it.
 std::vector<std::string> mergedEnv(const std::vector<std::string>& extra) {
   std::vector<std::string> env;
+  auto name = [](const std::string& entry) { return entry.substr(0, entry.find('=')); };
   for (char** e = environ; *e; ++e) {
-    std::string entry(*e);
-    std::string name = entry.substr(0, entry.find('='));
     bool overridden = false;
-    for (auto& x : extra)
-      if (x.substr(0, x.find('=')) == name) overridden = true;
-    if (!overridden) env.push_back(entry);
+    for (auto& x : extra) overridden = overridden || name(x) == name(*e);
+    if (!overridden) env.push_back(*e);
   }
   for (auto& x : extra)
     if (x.find('=') != std::string::npos) env.push_back(x);
@@ -71,12 +64,10 @@ std::vector<char*> cstrs(std::vector<std::string>& v) {
   return p;
 }
 
-int spawn(const std::vector<std::string>& argvIn, const std::vector<std::string>& extraEnv,
+int spawn(std::vector<std::string> argv, const std::vector<std::string>& extraEnv,
           const std::string& outFile, const std::string& errFile) {
-  std::vector<std::string> argv = argvIn;
   std::vector<std::string> env = mergedEnv(extraEnv);
-  auto a = cstrs(argv);
-  auto e = cstrs(env);
+  auto a = cstrs(argv), e = cstrs(env);
   posix_spawn_file_actions_t fa;
   posix_spawn_file_actions_init(&fa);
   posix_spawn_file_actions_addopen(&fa, 0, "/dev/null", O_RDONLY, 0);
@@ -92,8 +83,7 @@ int spawn(const std::vector<std::string>& argvIn, const std::vector<std::string>
 std::string outputName(const char* kind) {
   static int seq = 0;
   const char* dir = getenv("TMPDIR");
-  std::string d = dir && *dir ? dir : "/tmp/";
-  if (d.back() != '/') d += '/';
+  std::string d = std::string(dir && *dir ? dir : "/tmp") + "/";
   return d + "proc." + std::to_string(getpid()) + "." + std::to_string(++seq) + "." + kind;
 }
 
@@ -104,6 +94,7 @@ bool reap(int pid, int timeoutMs, ProcessResult& r) {
     int status = 0;
     pid_t w = waitpid(pid, &status, WNOHANG);
     if (w == pid) {
+      r.exited = WIFEXITED(status);
       if (WIFEXITED(status)) r.exitCode = WEXITSTATUS(status);
       if (WIFSIGNALED(status)) r.signal = WTERMSIG(status);
       return true;
@@ -113,20 +104,25 @@ bool reap(int pid, int timeoutMs, ProcessResult& r) {
   }
 }
 
+// reap, killing pid when it has not ended within timeoutMs.
+void reapOrKill(int pid, int timeoutMs, ProcessResult& r) {
+  if (reap(pid, timeoutMs, r)) return;
+  ::kill(pid, SIGKILL);
+  reap(pid, 10000, r);
+  r.timedOut = true;
+}
+
 }  // namespace
 
 std::string readFile(const std::string& path) {
   std::ifstream f(path, std::ios::binary);
-  std::stringstream ss;
-  ss << f.rdbuf();
-  return ss.str();
+  return std::string(std::istreambuf_iterator<char>(f), {});
 }
 
 std::vector<std::string> lines(const std::string& text) {
   std::vector<std::string> out;
   for (size_t start = 0; start < text.size();) {
-    size_t nl = text.find('\n', start);
-    if (nl == std::string::npos) nl = text.size();
+    size_t nl = std::min(text.find('\n', start), text.size());
     out.push_back(text.substr(start, nl - start));
     start = nl + 1;
   }
@@ -139,7 +135,6 @@ Child inChild(const std::string& dir, const std::function<int()>& body, int time
   std::string outFile = base + ".out", errFile = base + ".err";
   fflush(stdout);
   fflush(stderr);
-  Child c;
   pid_t pid = fork();
   if (pid == 0) {
     int o = open(outFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
@@ -152,16 +147,9 @@ Child inChild(const std::string& dir, const std::function<int()>& body, int time
     fflush(stderr);
     _exit(rc);
   }
+  Child c;
   if (pid < 0) return c;
-  ProcessResult r;
-  if (reap(pid, timeoutMs, r)) {
-    c.exited = r.signal == 0;
-    c.exitCode = r.exitCode;
-    c.signal = r.signal;
-  } else {
-    ::kill(pid, SIGKILL);
-    reap(pid, 10000, r);
-  }
+  reapOrKill(pid, timeoutMs, c);
   c.out = readFile(outFile);
   c.err = readFile(errFile);
   return c;
@@ -179,26 +167,14 @@ Background::Background(const std::vector<std::string>& argv, const std::vector<s
 }
 
 Background::~Background() {
-  if (!reaped_ && pid_ > 0) {
-    ::kill(pid_, SIGKILL);
-    reap(pid_, 10000, result_);
-  }
+  if (!reaped_ && pid_ > 0) reapOrKill(pid_, 0, result_);
   unlink(outFile_.c_str());
   unlink(errFile_.c_str());
 }
 
 ProcessResult Background::wait(int timeoutMs) {
-  if (!reaped_) {
-    if (reap(pid_, timeoutMs, result_)) {
-      reaped_ = true;
-    } else {
-      ::kill(pid_, SIGKILL);
-      reap(pid_, 10000, result_);
-      reaped_ = true;
-      result_.timedOut = true;
-      result_.exitCode = -1;
-    }
-  }
+  if (!reaped_) reapOrKill(pid_, timeoutMs, result_);
+  reaped_ = true;
   result_.out = out();
   result_.err = err();
   return result_;
@@ -209,43 +185,64 @@ void Background::kill(int sig) {
 }
 
 bool Background::running() {
-  if (reaped_) return false;
-  int status = 0;
-  pid_t w = waitpid(pid_, &status, WNOHANG);
-  if (w == pid_) {
-    reaped_ = true;
-    if (WIFEXITED(status)) result_.exitCode = WEXITSTATUS(status);
-    if (WIFSIGNALED(status)) result_.signal = WTERMSIG(status);
-    return false;
-  }
-  return true;
+  if (!reaped_) reaped_ = reap(pid_, 0, result_);
+  return !reaped_;
 }
 
 std::string Background::out() const { return readFile(outFile_); }
 std::string Background::err() const { return readFile(errFile_); }
 
-bool queueExists(const std::string& path) {
+template <class Object>
+bool exists(const std::string& path, hsvRC (*idOf)(const char*, int, HSVResID*), int option) {
   HSVResID id;
-  if (hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id) != ECF_OK) return false;
-  HSVHIPCQueue q;
-  bool found = q.attach(id) == ECF_OK;
-  if (found) q.detach();
-  return found;
+  Object o;  // detaches when it goes
+  return idOf(path.c_str(), option, &id) == ECF_OK && o.attach(id) == ECF_OK;
+}
+bool queueExists(const std::string& path) {
+  return exists<HSVHIPCQueue>(path, hsvIPCGetQueResID, HSV_QUEUE_RESID_OPTION);
+}
+bool memoryExists(const std::string& path) {
+  return exists<HSVHIPCMemory>(path, hsvIPCGetResID, HSV_MEMORY_RESID_OPTION);
 }
 
-bool memoryExists(const std::string& path) {
-  HSVResID id;
-  if (hsvIPCGetResID(path.c_str(), HSV_MEMORY_RESID_OPTION, &id) != ECF_OK) return false;
-  HSVHIPCMemory m;
-  bool found = m.attach(id) == ECF_OK;
-  if (found) m.detach();
-  return found;
-}
+// Notes each message as setRouting sees it, by its number before composing.
+thread_local int composing = 0;
+class RecordingLogger : public msgLoggerU {
+ public:
+  explicit RecordingLogger(int applicationIndex) : msgLoggerU(applicationIndex, 0) {}
+  void composeKlpMsg(logMsg* r) override {
+    composing = r->msgNumber;
+    msgLoggerU::composeKlpMsg(r);
+  }
+  void setRouting(logMsg* r) override {
+    std::string qt = std::string(getProgramQualifier()) + "\" : \"" + r->threadName, pads = " *";
+    int i = 0, last = r->valueCount;
+    if (i < last && getApplicationName() == std::string(r->values[i])) ++i;
+    if (i < last && qt == r->values[i]) ++i;
+    while (last > i && strlen(r->values[last - 1]) == 1 && pads.find(r->values[last - 1][0]) < 2)
+      --last;
+    std::string line = std::to_string(composing) + " <" + r->origin + "> ";
+    line += std::to_string(r->routing) + ":";
+    for (char sep = ' '; i < last; ++i, sep = '|') line += sep + std::string(r->values[i]);
+    if (r->extra[0] != -1 || r->extra[1] != -1)
+      line += " (" + std::to_string(r->extra[0]) + "," + std::to_string(r->extra[1]) + ")";
+    std::lock_guard<std::mutex> hold(lock_);
+    issued_.push_back(line);
+    msgLoggerU::setRouting(r);
+  }
+  std::vector<std::string> take() {
+    std::lock_guard<std::mutex> hold(lock_);
+    return std::exchange(issued_, {});
+  }
+
+ private:
+  std::mutex lock_;
+  std::vector<std::string> issued_;
+};
 
 ProcessLogger::ProcessLogger(int applicationIndex, const std::string& logDir,
                              const std::string& logFile)
-    : logger_(createMsgLoggerU(applicationIndex, 0)), saved_(klpGetProcessLogger()) {
-  if (logger_ == nullptr) throw std::runtime_error("no memory for the logger");
+    : logger_(new RecordingLogger(applicationIndex)), saved_(klpGetProcessLogger()) {
   logger_->loadBuiltinMsgs(builtinMsgTable);
   if (!logDir.empty() && !logFile.empty()) logger_->setLogFileName(logDir.c_str(), logFile.c_str());
   klpSetProcessLogger(logger_);
@@ -255,5 +252,9 @@ ProcessLogger::~ProcessLogger() {
   klpSetProcessLogger(saved_);
   delete logger_;
 }
+
+msgLogger* ProcessLogger::operator->() const { return logger_; }
+msgLogger* ProcessLogger::get() const { return logger_; }
+std::vector<std::string> ProcessLogger::take() { return logger_->take(); }
 
 }  // namespace klptest

@@ -10,15 +10,14 @@ class msgLogger;
 
 namespace klptest {
 
-// A fresh directory under /tmp, set as TMPDIR for this process (and so for
-// every process it starts) while the object lives; removed with its files.
+// A fresh directory under /tmp ending in "/", TMPDIR of this process and
+// those it starts while the object lives; removed with its files.
 class TmpDir {
  public:
   TmpDir();
   ~TmpDir();
   TmpDir(const TmpDir&) = delete;
   TmpDir& operator=(const TmpDir&) = delete;
-  // The directory with a trailing "/".
   const std::string& path() const { return path_; }
 
  private:
@@ -27,13 +26,15 @@ class TmpDir {
   bool hadTmpdir_ = false;
 };
 
+// How a process or forked child ended, and its standard output and error.
 struct ProcessResult {
+  bool exited = false;  // ended by exit (not a signal, not timed out)
   int exitCode = -1;    // exit status, or -1 when killed / timed out
   int signal = 0;       // terminating signal, 0 when it exited
   bool timedOut = false;
-  std::string out;      // standard output
-  std::string err;      // standard error
+  std::string out, err;
 };
+using Child = ProcessResult;
 
 // Path of a built program in the build tree's bin/ directory.
 std::string binPath(const std::string& program);
@@ -49,8 +50,7 @@ class Background {
   Background(const std::vector<std::string>& argv, const std::vector<std::string>& extraEnv = {});
   ~Background();  // kills with SIGKILL if still running
   int pid() const { return pid_; }
-  // Waits up to timeoutMs for the process to end; the result is complete
-  // once it ended.
+  // Waits up to timeoutMs for the process to end, then kills it.
   ProcessResult wait(int timeoutMs = 60000);
   void kill(int sig);
   bool running();
@@ -65,8 +65,7 @@ class Background {
   std::string outFile_, errFile_;
 };
 
-// True while a POSIX message queue / shared-memory block derived from path
-// exists on the system.
+// True while the queue / shared-memory block of path exists.
 bool queueExists(const std::string& path);
 bool memoryExists(const std::string& path);
 
@@ -76,22 +75,17 @@ std::string readFile(const std::string& path);
 // Lines of a text, without their line feeds.
 std::vector<std::string> lines(const std::string& text);
 
-struct Child {
-  bool exited = false;  // ended by exit (not a signal, not timed out)
-  int exitCode = -1;
-  int signal = 0;       // terminating signal
-  std::string out;      // standard output
-  std::string err;      // standard error
-};
-
 // Runs body in a forked child whose standard output and error go to files
-// under dir (which ends in "/"); the child exits with body's answer. Waits
-// at most timeoutMs, then kills it.
+// under dir (ending in "/"); it exits with body's answer or is killed after
+// timeoutMs.
 Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs = 20000);
+
+class RecordingLogger;
 
 // The process logger a program makes first (application 10 unless given,
 // synchronous, built-in texts loaded), installed for the object's life and
 // writing to dir/file when both are given; the previous logger comes back.
+// It keeps every message it issues, for take().
 class ProcessLogger {
  public:
   explicit ProcessLogger(int applicationIndex = 10, const std::string& logDir = "",
@@ -99,11 +93,16 @@ class ProcessLogger {
   ~ProcessLogger();
   ProcessLogger(const ProcessLogger&) = delete;
   ProcessLogger& operator=(const ProcessLogger&) = delete;
-  msgLogger* operator->() const { return logger_; }
-  msgLogger* get() const { return logger_; }
+  msgLogger* operator->() const;
+  msgLogger* get() const;
+  // Messages issued since the last take(): number as issued, origin, routing
+  // asked for (12: destination kind 0, 35: kind 2, 1: others), values after
+  // the header ones less trailing pads (" ", "*"), extra pair unless (-1,-1):
+  // "589 <where> 1: where|801|what", "575 <mq> 1: 2059|a|b (-1,2059)".
+  std::vector<std::string> take();
 
  private:
-  msgLogger* logger_;
+  RecordingLogger* logger_;
   msgLogger* saved_;
 };
 
