@@ -166,3 +166,45 @@ TEST(Catalogue, LoggerUsesTheCatalogueAndFallsBack) {
 }
 
 }  // namespace
+
+// Every number the programs issue has a text in the built catalogue that
+// begins with its id and severity, and whose markers all get substituted
+// (they must stand in ascending order). The status labels 7112-7124 and
+// 7193 have no header values: the report cuts their first ten characters.
+TEST(Catalogue, BuiltFileHoldsEveryIssuedNumber) {
+  const int issued[] = {500, 501, 502, 503, 504, 506, 507, 508, 509, 510, 511, 513, 514, 517,
+                        518, 519, 520, 521, 522, 523, 524, 525, 526, 527, 529, 534, 541, 543,
+                        545, 552, 554, 568, 569, 574, 575, 589, 590, 591, 592, 593, 594, 595,
+                        596, 597, 598, 599, 600, 601, 602, 606, 615, 616, 617, 619, 624, 626,
+                        7112, 7113, 7114, 7115, 7116, 7117, 7118, 7119, 7120, 7121, 7122, 7123,
+                        7124, 7193};
+  char v[9][3] = {"v1", "v2", "v3", "v4", "v5", "v6", "v7", "v8", "v9"};
+  char* values[9] = {v[0], v[1], v[2], v[3], v[4], v[5], v[6], v[7], v[8]};
+  for (int number : issued) {
+    char text[1100], id[8];
+    snprintf(id, sizeof id, "KLP%04d", number);
+    ASSERT_GT(retrieveCatalogMsg(kCatalog.c_str(), number, nullptr, values, 9, text, sizeof text),
+              0) << number;
+    EXPECT_EQ(0, strncmp(text, id, 7)) << text;
+    EXPECT_NE(nullptr, strchr("EIW", text[7])) << text;
+    bool label = number >= 7112;
+    EXPECT_EQ(0, strncmp(text + 8, label ? "  " : "  \"v1\" : \"v2\" : ", label ? 2 : 16)) << text;
+    for (const char* p = text; (p = strchr(p, '$')) != nullptr; ++p)
+      EXPECT_FALSE(p[1] >= '1' && p[1] <= '9') << "unsubstituted marker in " << text;
+  }
+}
+
+// A program finds the catalogue beside itself or through KLP_CATALOG_DIR,
+// never in the build tree it was built in: a copy elsewhere has none.
+TEST(Catalogue, ProgramsLookBesideThemselvesNotInTheBuildTree) {
+  klptest::TmpDir tmp;
+  std::string built = klptest::binPath("klpkccmd"), copy = tmp.path() + "klpkccmd";
+  ASSERT_EQ(0, klptest::run({"/bin/cp", built, copy}).exitCode);
+  const struct { std::string program; std::vector<std::string> env; bool found; } rows[] = {
+      {built, {}, true}, {copy, {}, false}, {copy, {"KLP_CATALOG_DIR=" KLP_BIN_DIR}, true}};
+  for (const auto& r : rows) {
+    auto p = klptest::run({r.program}, r.env);
+    EXPECT_EQ(12, p.exitCode);
+    EXPECT_EQ(r.found, p.err.find("KLP0513E") == std::string::npos) << r.program << p.err;
+  }
+}
