@@ -4,16 +4,20 @@
 
 #include <atomic>
 #include <cstdlib>
+#include <thread>
+#include <vector>
 
-#include "common/thread/thread_testutil.h"
+#include "common/msg/klplog.h"
+#include "common/platform/hsv.h"
 #include "common/util/klprc.h"
+#include "tests/testing/klptest.h"
 
 namespace {
 
 // What the thread bodies of a test look at.
-std::atomic<bool> g_release{false};    // the bodies that wait end when set
+std::atomic<bool> g_release{false};  // the bodies that wait end when set
 std::atomic<int> g_runs{0};
-std::atomic<int> g_endWith{0};         // end code of the "end" body
+std::atomic<int> g_endWith{0};  // end code of the "end" body
 std::atomic<klpThread*> g_seenCurrent{nullptr};
 std::atomic<int> g_seenState{0};
 sigset_t g_seenMask;
@@ -66,16 +70,17 @@ void dbBody(klpThread* t) {
 // First run ends with 9 (to be restarted), the second with 0.
 void restartBody(klpThread* t) {
   klpThread::prologue(t);
-  int run = ++g_runs;
-  threadEnd(t, run == 1 ? 9 : 0);
+  threadEnd(t, ++g_runs == 1 ? 9 : 0);
 }
 
 // Returns without ending itself.
 void returningBody(klpThread* t) { klpThread::prologue(t); }
 
 bool waitState(klpThread* t, int32_t s) {
-  return thrtest::waitFor([&] { return t->getState() == s; });
+  return klptest::waitFor([&] { return t->getState() == s; });
 }
+
+bool onIdList(klpThread* t) { return t->tid.oleAnchor == klpThreadIdList(); }
 
 // A thread that could not be stopped stays on its list, withdrawn: take it
 // off and free it once it is really gone.
@@ -87,15 +92,40 @@ void reapWithdrawn(klpThread* t) {
   delete t;
 }
 
-bool onIdList(klpThread* t) { return t->tid.oleAnchor == klpThreadIdList(); }
+TEST(KlpThread, ANewThreadHasItsNameCutDefaultInterestsAndPrintsItself) {
+  klptest::TmpDir tmp;
+  auto c = klptest::inChild(tmp.path(), [] {
+    klpThread t;
+    t.setName("BehinderWorkerThread");
+    if (strcmp(t.name, "BehinderWorker") != 0 || strcmp(t.ole.eyeCatcher, "KlpThrd") != 0 ||
+        strcmp(t.tid.eyeCatcher, "KlpThID") != 0 || t.tid.object != &t || t.restart != 1)
+      return 1;
+    for (int code = -1; code <= KLP_CMD_CODES; ++code)
+      if (interestedInCmd(&t, code) != (code == 14 || code == 18 || code == 19)) return 2;
+    setCmdInterest(&t, 20, 7);
+    setCmdInterest(&t, 64, 1);
+    if (interestedInCmd(&t, 20) != 7) return 3;
+    t.endCode = 42;
+    klpThread::print(&t);
+    t.restart = 0;
+    klpThread::print(&t);
+    return 0;
+  });
+  EXPECT_EQ(0, c.exitCode);
+  EXPECT_EQ("klpThread::print  Thread with name BehinderWorker and state 1 and RC 42 and RESTART TRUE"
+            " and handle  0000000000000000\n"
+            "klpThread::print  Thread with name BehinderWorker and state 1 and RC 42 and RESTART FALSE"
+            " and handle  0000000000000000\n",
+            c.out);
+}
 
 // Real threads on a shared list, with the main thread registered first.
 struct MtThread : ::testing::Test {
-  klpThread* mainThr = thrtest::mainReady();
-  thrtest::LogCapture cap;
+  klptest::TmpDir tmp;
   OrdList list{"Threads"};
-  int highest = 0;
+  int highest = 3;
   void SetUp() override {
+    klptest::mainThreadReady();
     g_release = false;
     g_runs = 0;
     g_endWith = 0;
@@ -108,57 +138,19 @@ struct MtThread : ::testing::Test {
     EXPECT_EQ(0, code);
     return t;
   }
-  int supervise() { return ::supervise(&list, 0, &highest); }
 };
 
-TEST(KlpThread, NamesAreCutTo14AndNewThreadsWantStopResumeSuspend) {
-  thrtest::LogCapture cap;
-  klpThread t;
-  t.setName("BehinderWorkerThread");
-  EXPECT_STREQ("BehinderWorker", t.name);
-  EXPECT_STREQ("KlpThrd", t.ole.eyeCatcher);
-  EXPECT_STREQ("KlpThID", t.tid.eyeCatcher);
-  EXPECT_EQ(&t, t.tid.object);
-  EXPECT_EQ(KLP_THREAD_EXIST, t.state);
-  EXPECT_EQ(1, t.restart);
-  for (int code = 0; code < KLP_CMD_CODES; ++code)
-    EXPECT_EQ(code == 14 || code == 18 || code == 19 ? 1 : 0, interestedInCmd(&t, code)) << code;
-  EXPECT_EQ(0, interestedInCmd(&t, 64));
-  EXPECT_EQ(0, interestedInCmd(&t, -1));
-  setCmdInterest(&t, 64, 1);
-  setCmdInterest(&t, 20, 1);
-  EXPECT_EQ(1, interestedInCmd(&t, 20));
-  EXPECT_TRUE(cap.issuedWith(8006, {"64"})) << cap.log();
-  EXPECT_TRUE(cap.issuedWith(8006, {"-1"})) << cap.log();
-  EXPECT_EQ(3u, cap.issued(8006).size());
-}
-
-TEST(KlpThread, PrintShowsNameStateCodeAndRestart) {
-  thrtest::LogCapture cap;
-  auto c = thrtest::inChild(cap.dir(), [] {
-    klpThread t;
-    t.setName("Printer");
-    t.restart = 0;
-    t.endCode = 42;
-    klpThread::print(&t);
-    return 0;
-  });
-  ASSERT_TRUE(c.exited);
-  EXPECT_EQ("klpThread::print  Thread with name Printer and state 1 and RC 42 and RESTART FALSE"
-            " and handle  0000000000000000\n",
-            c.out);
-}
-
 TEST_F(MtThread, TheMainThreadIsInitialAndEndsTheProcessWith12Or0) {
-  EXPECT_STREQ("Initial", mainThr->name);
-  EXPECT_EQ(KLP_THREAD_RUN, mainThr->getState());
-  EXPECT_EQ(mainThr, currentThread());
+  klpThread* m = klpMainThread();
+  EXPECT_STREQ("Initial", m->name);
+  EXPECT_EQ(KLP_THREAD_RUN, m->getState());
+  EXPECT_EQ(m, currentThread());
   EXPECT_STREQ("KlpThreadIDList", klpThreadIdList()->qName);
   EXPECT_EQ(1, klpThreadIdList()->locked);
   EXPECT_EQ(0, klpThreadIdList()->ownerCheck());
-  EXPECT_EQ(klpSharedCmdList(), mainThr->sharedCmdList);
+  EXPECT_EQ(klpSharedCmdList(), m->sharedCmdList);
   for (int end : {5, 0}) {
-    auto c = thrtest::inChild(cap.dir(), [end] {
+    auto c = klptest::inChild(tmp.path(), [end] {
       threadEnd(klpMainThread(), end);
       return 99;
     });
@@ -168,6 +160,7 @@ TEST_F(MtThread, TheMainThreadIsInitialAndEndsTheProcessWith12Or0) {
 }
 
 TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
+  klptest::LogRecords records(tmp.path());
   void* data = malloc(64);  // freed by the thread's end
   klpThread* t = make(workBody, "Worker", 1, 0, data);
   ASSERT_NE(nullptr, t);
@@ -183,18 +176,17 @@ TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
   EXPECT_EQ(0, threadStateByName(&list, "Work"));
   EXPECT_STREQ("Worker", t->cmdList->qName);
   EXPECT_EQ(1, t->cmdList->locked);
+  EXPECT_EQ(1, t->cmdList->ownerCheck());
   EXPECT_TRUE(onIdList(t));
-  EXPECT_EQ(1, list.count);
   g_release = true;
   ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
   EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());  // 0 is stored as 2011
   EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));
   EXPECT_EQ(0, list.count);
   // The logger names the thread that issued the message.
-  std::string log = cap.log();
-  size_t at = log.find("fromWorker");
-  ASSERT_NE(std::string::npos, at) << log;
-  EXPECT_NE(std::string::npos, log.rfind("Worker\"", at)) << log;
+  std::vector<std::string> got = records.take(true);
+  ASSERT_FALSE(got.empty());
+  EXPECT_EQ("Worker>8006|workBody|1|fromWorker", got[0]);
 }
 
 TEST_F(MtThread, ABodyThatReturnsEndsAs2011AndItsStopLeavesTheSharedCommandsAlone) {
@@ -206,9 +198,7 @@ TEST_F(MtThread, ABodyThatReturnsEndsAs2011AndItsStopLeavesTheSharedCommandsAlon
   EXPECT_EQ(klpSharedCmdList(), t->cmdList);
   EXPECT_EQ(0, strncmp(t->dbCtx.dbAlias, "MYDB    ", 8));
   ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
   EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));
-  EXPECT_EQ(1, klpSharedCmdList()->locked);
   EXPECT_EQ(2, klpSharedCmdList()->count);
   for (OrdListElement* e : pending) {
     EXPECT_EQ(e, klpSharedCmdList()->getHead());
@@ -239,140 +229,128 @@ TEST(KlpThreadFirst, OnlyOneOfTwoThreadsAtOnceTakesTheFirstPrologue) {
   EXPECT_EXIT(firstPrologueRace(), ::testing::ExitedWithCode(0), "");
 }
 
-TEST_F(MtThread, StopOfAnEndedThreadReturnsItsEndCodeAndRemovesIt) {
-  g_endWith = 77;
-  klpThread* t = make(endBody, "Ender");
-  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  EXPECT_FALSE(onIdList(t));  // an ended thread's id may be reused
-  EXPECT_EQ(77, klpThread::stop(t));
-  EXPECT_EQ(0, list.count);
-  EXPECT_EQ(nullptr, list.olHead);
-  EXPECT_TRUE(cap.issuedWith(590, {"Initial", "77", "Ender"})) << cap.log();
-}
-
-TEST_F(MtThread, StopInterruptsTheDbWorkOfAWorkingThread) {
-  klpThread* t = make(dbBody, "DbWorker");
-  ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
-  ASSERT_TRUE(thrtest::waitFor([&] { return t->getCurDbConn() != nullptr; }));
-  EXPECT_EQ(5, klpThread::stop(t));  // it ended during the stop's wait
-  EXPECT_EQ(0, list.count);
-}
-
-TEST_F(MtThread, AThreadThatCannotBeBroughtToAnEndIsWithdrawn) {
-  klpThread* t = make(restBody, "Rester");
-  ASSERT_TRUE(waitState(t, KLP_THREAD_REST));
-  EXPECT_EQ(KLP_RC_RECOVERED, klpThread::stop(t));
-  EXPECT_EQ(1, t->ole.withdrawn);
-  EXPECT_EQ(1, list.count);
-  EXPECT_EQ(nullptr, list.browseHead());
-  EXPECT_EQ(0, threadStateByName(&list, "Rester"));
-  void* ret = nullptr;
-  ASSERT_EQ(0, pthread_join(t->handle, &ret));  // it was cancelled
-  t->hasHandle = 0;
-  EXPECT_EQ(PTHREAD_CANCELED, ret);
-  EXPECT_FALSE(onIdList(t));
-  reapWithdrawn(t);
+TEST_F(MtThread, StopRemovesAnEndedThreadEndsAWorkingOneAndWithdrawsOneItMustCutOff) {
+  struct {
+    klpThreadRoutine body;
+    const char* name;
+    int32_t ready;  // the state the thread is stopped in
+    int endWith;
+    int rc;
+  } rows[] = {
+      {endBody, "Ender", KLP_THREAD_STOP, 77, 77},    // nothing to end: its end code
+      {dbBody, "DbWorker", KLP_THREAD_RUN, 0, 5},     // its database work interrupted, it ends
+      {restBody, "Rester", KLP_THREAD_REST, 0, 2009},  // cut off: withdrawn
+  };
+  for (const auto& row : rows) {
+    g_endWith = row.endWith;
+    klpThread* t = make(row.body, row.name);
+    ASSERT_TRUE(waitState(t, row.ready)) << row.name;
+    EXPECT_EQ(row.rc, klpThread::stop(t)) << row.name;
+    if (row.rc != KLP_RC_RECOVERED) {
+      EXPECT_EQ(0, list.count) << row.name;
+      continue;
+    }
+    EXPECT_EQ(1, t->ole.withdrawn);
+    EXPECT_EQ(nullptr, list.browseHead());
+    EXPECT_EQ(0, threadStateByName(&list, "Rester"));
+    void* ret = nullptr;
+    ASSERT_EQ(0, pthread_join(t->handle, &ret));
+    t->hasHandle = 0;
+    EXPECT_EQ(PTHREAD_CANCELED, ret);
+    EXPECT_FALSE(onIdList(t));  // an ended thread's id may be reused
+    reapWithdrawn(t);
+  }
 }
 
 TEST_F(MtThread, StopAllToleratesOnlyAnUnstoppableHoldLThread) {
+  EXPECT_EQ(0, stopAll(nullptr));
   for (const char* name : {"HoldLThread", "HoldOn"}) {
-    SCOPED_TRACE(name);
     g_release = false;
     klpThread* hold = make(holdBody, name);
     klpThread* done = make(endBody, "Done");
     ASSERT_TRUE(waitState(hold, KLP_THREAD_REST));
     ASSERT_TRUE(waitState(done, KLP_THREAD_STOP));
-    EXPECT_EQ(std::string(name) == "HoldLThread" ? 0 : KLP_RC_RECOVERED, stopAll(&list));
+    EXPECT_EQ(std::string(name) == "HoldLThread" ? 0 : KLP_RC_RECOVERED, stopAll(&list)) << name;
     EXPECT_EQ(1, hold->ole.withdrawn);
     EXPECT_EQ(1, list.count);  // only the withdrawn one is left
-    EXPECT_EQ(&hold->ole, list.olHead);
     g_release = true;
     reapWithdrawn(hold);
   }
 }
 
-TEST_F(MtThread, SupervisionSeesCriticalAndNonCriticalLiveThreads) {
-  EXPECT_EQ(0, ::supervise(nullptr, 0, &highest));
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());
-  klpThread* plain = make(workBody, "Plain");
-  ASSERT_TRUE(waitState(plain, KLP_THREAD_RUN));
-  EXPECT_EQ(KLP_RC_NO_CRITICAL, supervise());
-  klpThread* crit = make(workBody, "Critical", 1, 1);
-  ASSERT_TRUE(waitState(crit, KLP_THREAD_RUN));
-  EXPECT_EQ(0, supervise());
-  g_release = true;
-  ASSERT_TRUE(waitState(plain, KLP_THREAD_STOP));
-  ASSERT_TRUE(waitState(crit, KLP_THREAD_STOP));
-  // Both ended with 0 (2011) and restart set: removed, nothing alive.
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());
-  EXPECT_EQ(0, list.count);
-}
-
-TEST_F(MtThread, SupervisionReportsAFinishedThreadWhileOthersLive) {
-  g_endWith = 9;
-  klpThread* crit = make(workBody, "Critical", 1, 1);
-  klpThread* gone = make(endBody, "Gone", 0);
-  ASSERT_TRUE(waitState(crit, KLP_THREAD_RUN));
-  ASSERT_TRUE(waitState(gone, KLP_THREAD_STOP));
-  highest = 3;
-  EXPECT_EQ(KLP_RC_THREAD_FINISHED, supervise());
-  EXPECT_EQ(9, highest);
-  EXPECT_EQ(1, list.count);
-  g_release = true;
-  ASSERT_TRUE(waitState(crit, KLP_THREAD_STOP));
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(crit));
-}
-
-TEST_F(MtThread, SupervisionKeepsA2001ThreadOnePassThenRemovesIt) {
-  g_endWith = KLP_RC_TERMINATED;
-  klpThread* t = make(endBody, "Terminated");
-  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());
-  EXPECT_EQ(1, list.count);
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());
-  EXPECT_EQ(0, list.count);
-  EXPECT_EQ(0, highest);
-  EXPECT_EQ(1, g_runs.load());  // never started again
-}
-
-TEST_F(MtThread, SupervisionRestartsAThreadThatEndedWithAnotherCode) {
-  klpThread* t = make(restartBody, "Restarted");
-  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  ASSERT_EQ(9, t->getEndCode());
-  EXPECT_EQ(KLP_RC_NO_CRITICAL, supervise());  // restarted: alive
-  ASSERT_TRUE(thrtest::waitFor([&] { return g_runs == 2 && t->getState() == KLP_THREAD_STOP; }));
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());
-  EXPECT_EQ(KLP_RC_NONE_ALIVE, supervise());  // 2011: removed
-  EXPECT_EQ(0, list.count);
-}
-
-TEST_F(MtThread, SupervisionPassesOnAShutdownCode) {
-  g_endWith = KLP_RC_SHUTDOWN;
-  klpThread* t = make(endBody, "Shutdown", 0);
-  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  EXPECT_EQ(KLP_RC_SHUTDOWN, supervise());
-  EXPECT_EQ(KLP_RC_SHUTDOWN, highest);
-  EXPECT_EQ(0, list.count);
+TEST_F(MtThread, SupervisionJudgesTheSetRestartsAndRemoves) {
+  enum Kind { kWork, kEnd, kTwice };
+  struct Spec {
+    Kind kind;
+    int critical, restart;
+  };
+  struct Pass {
+    int rc, left;
+  };
+  struct {
+    const char* what;
+    std::vector<Spec> threads;
+    int endWith, stopping;
+    std::vector<Pass> passes;
+    int highest;  // from 3
+  } rows[] = {
+      {"none", {}, 0, 0, {{2007, 0}}, 3},
+      {"live, none critical", {{kWork, 0, 1}}, 0, 0, {{415, 1}}, 3},
+      {"a critical one lives", {{kWork, 0, 1}, {kWork, 1, 1}}, 0, 0, {{0, 2}}, 3},
+      {"one finished", {{kWork, 1, 1}, {kEnd, 0, 0}}, 9, 0, {{2006, 1}}, 9},
+      {"2001: kept one pass", {{kEnd, 0, 1}}, 2001, 0, {{2007, 1}, {2007, 0}}, 3},
+      {"restarted after 9", {{kTwice, 0, 1}}, 0, 0, {{415, 1}, {2007, 0}}, 3},
+      {"shutdown", {{kWork, 0, 1}, {kEnd, 0, 0}}, 2012, 0, {{2012, 1}}, 2012},
+      {"shutdown, none alive", {{kEnd, 0, 0}}, 2012, 0, {{2012, 0}}, 2012},
+      {"stopping: not restarted", {{kEnd, 0, 1}}, 9, 1, {{2007, 0}}, 9},
+  };
+  EXPECT_EQ(0, supervise(nullptr, 0, &highest));
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.what);
+    g_release = false;
+    g_runs = 0;
+    g_endWith = row.endWith;
+    highest = 3;
+    std::vector<klpThread*> ts;
+    for (const Spec& s : row.threads)
+      ts.push_back(make(s.kind == kWork ? workBody : s.kind == kEnd ? endBody : restartBody, "T",
+                        s.restart, s.critical));
+    for (const Pass& pass : row.passes) {
+      for (size_t i = 0; i < ts.size(); ++i)
+        ASSERT_TRUE(!ts[i] || waitState(ts[i], row.threads[i].kind == kWork ? KLP_THREAD_RUN : KLP_THREAD_STOP));
+      EXPECT_EQ(pass.rc, supervise(&list, row.stopping, &highest));
+      EXPECT_EQ(pass.left, list.count);
+      for (klpThread*& t : ts) {  // forget the ones removed (and freed)
+        bool kept = false;
+        for (OrdListElement* e = list.olHead; e; e = e->olePrev) kept = kept || e == &t->ole;
+        if (!kept) t = nullptr;
+      }
+    }
+    EXPECT_EQ(row.highest, highest);
+    g_release = true;
+    for (OrdListElement* e; (e = list.browseHead()) != nullptr;) {
+      ASSERT_TRUE(waitState(klpThreadOf(e), KLP_THREAD_STOP));
+      klpThread::stop(klpThreadOf(e));
+    }
+  }
+  EXPECT_EQ(1, g_runs.load());  // the 2001 one never ran again
 }
 
 TEST_F(MtThread, SleepingShowsRestingUnlessWaitingForDb) {
-  std::atomic<int> seen{0};
-  std::atomic<bool> sleeping{false};
-  std::thread watcher([&] {
-    thrtest::waitFor([&] { return sleeping.load(); });
-    thrtest::waitFor([&] { return mainThr->getState() == KLP_THREAD_REST; }, 1000);
-    seen = mainThr->getState();
-  });
-  sleeping = true;
-  klpRestingSleep(300);
-  watcher.join();
-  EXPECT_EQ(KLP_THREAD_REST, seen.load());
-  EXPECT_EQ(KLP_THREAD_RUN, mainThr->getState());  // restored
-  mainThr->setState(KLP_THREAD_DBWAIT);
-  klpRestingSleep(10);
-  EXPECT_EQ(KLP_THREAD_DBWAIT, mainThr->getState());
-  mainThr->setState(KLP_THREAD_RUN);
+  klpThread* m = klpMainThread();
+  for (int32_t before : {KLP_THREAD_RUN, KLP_THREAD_DBWAIT}) {
+    m->setState(before);
+    std::atomic<int> seen{0};
+    std::thread watcher([&] {
+      klptest::waitFor([&] { return m->getState() != before; }, 1000);
+      seen = m->getState();
+    });
+    klpRestingSleep(300);
+    watcher.join();
+    EXPECT_EQ(before == KLP_THREAD_RUN ? KLP_THREAD_REST : KLP_THREAD_DBWAIT, seen.load());
+    EXPECT_EQ(before, m->getState());  // restored
+  }
+  m->setState(KLP_THREAD_RUN);
 }
 
 TEST(KlpThread, ConnectionLookupCreatesOnlyForKindO) {

@@ -4,15 +4,17 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
-#include <cinttypes>
+#include <atomic>
 #include <cstdio>
 #include <filesystem>
+#include <functional>
 #include <string>
+#include <thread>
 
 #include "common/platform/hsv.h"
 #include "common/thread/klpthread.h"
-#include "common/thread/thread_testutil.h"
 #include "common/util/klprc.h"
+#include "tests/testing/klptest.h"
 
 // The recovery handler issues its messages from within the signal handler,
 // as the design asks; the signals of these tests are raised synchronously by
@@ -21,8 +23,7 @@ extern "C" const char* __tsan_default_options() { return "report_signal_unsafe=0
 
 namespace {
 
-// Signal tests run in forked children: the handler jumps, threads end and
-// the process-wide record changes, none of which may touch the test process.
+using Logs = std::vector<std::string>;
 
 void say(const char* text) {
   fputs(text, stdout);
@@ -40,6 +41,145 @@ void raiseHere(int sig) {
   pthread_sigmask(SIG_UNBLOCK, &set, nullptr);
   raise(sig);
 }
+
+bool endsWithMarker(const std::string& content) {
+  static const std::string marker("***E**O**D**M***\0", 17);
+  return content.size() >= 17 && content.compare(content.size() - 17, 17, marker) == 0;
+}
+
+// Every routine of the folder that reports, with the records it logs
+// (number, origin, destination kind, values in order); the signal handler's
+// own are in the signal table below.
+TEST(ThreadRecords, EachRoutineLogsItsRecords) {
+  klptest::mainThreadReady();
+  klptest::TmpDir tmp;
+  klptest::LogRecords records(tmp.path());
+  char owner[32];
+  snprintf(owner, sizeof owner, "Initial:0x%08x",
+           static_cast<unsigned>(reinterpret_cast<uintptr_t>(klpMainThread()) & 0xFFFFFFFFu));
+  std::string dir = tmp.path() + "d", ids = std::to_string(hsvProcessID()) + "." +
+                                             std::to_string(hsvThreadID()) + ".DUMP";
+  std::filesystem::create_directory(dir);
+  auto report = [](int sig, int global) {
+    return [sig, global] {
+      recoveryMgr m;
+      m.signal = sig;
+      erClearGlobalSignal();
+      recoveryMgr::erWhatSignal(&m);
+      EXPECT_EQ(global, erGetGlobalSignal()) << sig;
+      erClearGlobalSignal();
+    };
+  };
+  struct Row {
+    const char* what;
+    std::function<void()> run;
+    Logs logs;
+  } rows[] = {
+      {"interest in code 64", [] { klpThread t; interestedInCmd(&t, 64); },
+       {"8006|klpThread::interestedInCmd|1|64"}},
+      {"interest in code -1 set", [] { klpThread t; setCmdInterest(&t, -1, 1); },
+       {"8006|klpThread::setCmdInterest|1|-1"}},
+      {"unlock by a thread that does not hold the lock", [] {
+         OrdList l("Guarded");
+         l.makeShared(nullptr, 1);
+         l.lockList();
+         std::thread([&] { l.unlockList(); }).join();
+         l.unlockList();
+       },
+       {std::string("624|OrdList::unlock|1|UNKNOWN|Guarded|0|Thread does not hold lock|") + owner + "|1"}},
+      {"dechain of a broken chain: unlinked all the same", [] {
+         OrdList l("Broken");
+         OrdListElement a, b, c;
+         for (OrdListElement* e : {&a, &b, &c}) l.putTail(e);
+         b.oleNext = nullptr;  // the head-side neighbour is lost
+         EXPECT_EQ(0, ordListDeChain(&b));
+         EXPECT_TRUE(l.count == 2 && !b.oleAnchor && !b.olePrev && !c.oleNext);
+       },
+       {"8000|ordListDeChain|1|KlpOLE:|Broken"}},
+      {"stop of an ended thread", [] {
+         OrdList list("Threads");
+         list.makeShared(nullptr, 1);
+         int code = 0;
+         klpThread* t = createThread(&code, &list, [](klpThread* self) {
+           klpThread::prologue(self);
+           threadEnd(self, 77);
+         }, "Ender", nullptr, 1, nullptr, 0, 0);
+         ASSERT_TRUE(klptest::waitFor([&] { return t->getState() == KLP_THREAD_STOP; }));
+         EXPECT_EQ(77, klpThread::stop(t));
+       },
+       {"590|klpThread::stop|1|Initial|77|Ender"}},
+      {"resource for a thread that is not registered",
+       [] { std::thread([] { EXPECT_EQ(nullptr, addRcvyRes(action, 0)); }).join(); },
+       {"589|findRcvyMgr|1|findRcvyMgr|602|findThread", "589|addRcvyRes|1|addRcvyRes|602|findRcvyMgr"}},
+      {"report of SIGINT", report(SIGINT, SIGINT), {"591|recoveryMgr::erWhatSignal|1|Initial|Handled|SIGINT"}},
+      {"report of SIGTERM", report(SIGTERM, SIGTERM),
+       {"591|recoveryMgr::erWhatSignal|1|Initial|Handled|SIGTERM"}},
+      {"report of SIGFPE", report(SIGFPE, 0), {"591|recoveryMgr::erWhatSignal|1|Initial|Handled|SIGFPE"}},
+      {"report of SIGILL", report(SIGILL, 0), {"591|recoveryMgr::erWhatSignal|1|Initial|Handled|SIGILL"}},
+      {"report of SIGSEGV", report(SIGSEGV, 0),
+       {"569|recoveryMgr::erWhatSignal|1|SIGSEGV", "591|recoveryMgr::erWhatSignal|1|Initial|Handled|SIGSEGV"}},
+      {"report of SIGBUS", report(SIGBUS, 0), {"591|recoveryMgr::erWhatSignal|1|Initial|Non-handled|7"}},
+      {"report of no signal", report(0, 0), {}},
+      {"queue destroyed", [] { erHSVIPCQdestroy(0); }, {"595|erHSVIPCQdestroy|1|0000000000000000"}},
+      {"queue detached", [] { erHSVIPCQdetach(0); }, {"593|erHSVIPCQdestroy|1|0000000000000000"}},
+      {"dump, then one more appended", [&] {
+         char path[1200];
+         ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "S1", SIGSEGV, nullptr, nullptr, path, sizeof path));
+         EXPECT_EQ(dir + "/S1." + ids, path);
+         std::string first = klptest::readFile(path);
+         EXPECT_TRUE(endsWithMarker(first));
+         ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "S1", SIGSEGV, nullptr, nullptr));
+         std::string both = klptest::readFile(path);
+         EXPECT_TRUE(both.size() > first.size() && both.compare(0, first.size(), first) == 0);
+         EXPECT_TRUE(endsWithMarker(both));
+       },
+       {"8053|erDumpStackTraceInfo|1|SIGSEGV|" + dir + "/S1." + ids,
+        "8053|erDumpStackTraceInfo|1|SIGSEGV|" + dir + "/S1." + ids}},
+      {"dump with a blank prefix", [&] { EXPECT_EQ(0, erDumpStackTraceTo(dir.c_str(), "  ", 8, nullptr, nullptr)); },
+       {"8053|erDumpStackTraceInfo|1|SIGFPE|" + dir + "/." + ids}},
+      {"dump file not opened", [&] {
+         EXPECT_EQ(KLP_RC_DUMP_FILE, erDumpStackTraceTo((dir + "/no").c_str(), "S1", 8, nullptr, nullptr));
+       },
+       {"589|erDumpStackTraceInfo|1|erDumpStackTraceInfo|803|HSVTrapFile::isValid",
+        "8999|erDumpStackTraceInfo|r8|" + dir + "/no/S1." + ids}},
+      {"dump file name too long", [&] {
+         EXPECT_EQ(KLP_RC_DUMP_FILE, erDumpStackTraceTo(std::string(2000, 'd').c_str(), "S1", 8, nullptr, nullptr));
+       },
+       {"589|erDumpStackTraceInfo|1|erDumpStackTraceInfo|803|HSVTrapFile::isValid",
+        "8999|erDumpStackTraceInfo|r8|dump file name too long"}},
+  };
+  for (const Row& row : rows) {
+    row.run();
+    EXPECT_EQ(row.logs, records.take()) << row.what;
+  }
+}
+
+TEST(Recovery, ResourcesBelongToTheCurrentThreadAndQueueActionsEndTheirQueue) {
+  klptest::mainThreadReady();
+  klptest::TmpDir tmp;
+  recoveryRes* r = addRcvyRes(action, 7);
+  ASSERT_NE(nullptr, r);
+  EXPECT_STREQ("KlpRcvyRes:", r->ole.eyeCatcher);
+  EXPECT_EQ(&klpMainThread()->rcvyMgr.resList, r->ole.oleAnchor);
+  EXPECT_GT(r->registered, 0);
+  endRcvyRes(r);
+  EXPECT_EQ(0, klpMainThread()->rcvyMgr.resList.count);
+  std::string path = tmp.path() + "RCVY.TEST.IPC";
+  HSVResID id;
+  ASSERT_EQ(0u, hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id));
+  for (void (*act)(uint64_t) : {erHSVIPCQdetach, erHSVIPCQdestroy}) {
+    HSVHIPCQueue* q = new HSVHIPCQueue;
+    ASSERT_EQ(0u, act == erHSVIPCQdetach ? q->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION) : q->attach(id));
+    act(reinterpret_cast<uint64_t>(&q));
+    EXPECT_EQ(nullptr, q);
+    EXPECT_EQ(act == erHSVIPCQdetach, klptest::queueExists(path));
+  }
+}
+
+// ---------------------------------------------------------------------------
+// Signals, in forked children: the handler jumps, threads end and the
+// process-wide record changes, none of which may touch the test process.
+// ---------------------------------------------------------------------------
 
 // Raises SIGINT again after every return to its recovery point; the fourth
 // return ends it. Resources 1, 2 before the first signal, 3 after it.
@@ -59,7 +199,6 @@ void signalledBody(klpThread* t) {
   }
   g_stage = g_stage + 1;
   raiseHere(SIGINT);
-  say("not reached\n");
 }
 
 // Takes the signal g_raise while it holds the thread-id list's lock, which
@@ -77,23 +216,6 @@ void pointlessBody(klpThread* t) {
   klpThread::prologue(t);
   addRcvyRes(action, 7);  // still runs: nothing else would clean up
   raiseHere(SIGINT);      // before any recovery point
-  say("not reached\n");
-}
-
-HSVHIPCQueue* g_queue = nullptr;
-bool g_destroyQueue = true;
-void queueBody(klpThread* t) {
-  klpThread::prologue(t);
-  // Registered on the thread that will be signalled, as its own resource.
-  addRcvyRes(g_destroyQueue ? erHSVIPCQdestroy : erHSVIPCQdetach,
-             reinterpret_cast<uint64_t>(&g_queue));
-  if (KLP_SET_RECOVERY_POINT(t->rcvyMgr) != 0) {
-    int rc = recoveryMgr::erRecover(&t->rcvyMgr, t);
-    printf("queue pointer %s\n", g_queue ? "kept" : "cleared");
-    threadEnd(t, rc);
-  }
-  raiseHere(SIGINT);
-  threadEnd(t, 0);
 }
 
 // First run: a signal, so it ends with 2009 and supervision starts it
@@ -104,110 +226,12 @@ void restartedBody(klpThread* t) {
   klpThread::prologue(t);
   int run = ++g_run;
   if (KLP_SET_RECOVERY_POINT(t->rcvyMgr) != 0) {
-    int rc = recoveryMgr::erRecover(&t->rcvyMgr, t);
-    printf("run %d rc=%d\n", run, rc);
+    printf("run %d rc=%d\n", run, recoveryMgr::erRecover(&t->rcvyMgr, t));
     fflush(stdout);
-    threadEnd(t, run == 1 ? rc : 0);
+    threadEnd(t, run == 1 ? KLP_RC_RECOVERED : 0);
   }
   if (run == 2) addRcvyRes(action, 5);
   raiseHere(SIGINT);
-}
-
-// Starts a thread with the given body in the child, waits for it and prints
-// how it ended.
-int runThread(klpThreadRoutine body, const char* name) {
-  recoveryMgr::erReinstall();
-  erClearGlobalSignal();
-  OrdList list("Threads");
-  list.makeShared(nullptr, 1);
-  int code = -1;
-  klpThread* t = createThread(&code, &list, body, name, nullptr, 1, nullptr, 0, 0);
-  if (code != 0) return 90;
-  void* ret = nullptr;
-  pthread_join(t->handle, &ret);
-  printf("end=%ld code=%d global=%d\n", static_cast<long>(reinterpret_cast<intptr_t>(ret)),
-         t->getEndCode(), erGetGlobalSignal());
-  return 0;
-}
-
-// A child with the main thread registered and a capturing logger; answers
-// the child's standard output without the logger's lines.
-struct SigRecovery : ::testing::Test {
-  klpThread* mainThr = thrtest::mainReady();
-  thrtest::LogCapture cap;
-  std::string child(const std::function<int()>& body) {
-    auto c = thrtest::inChild(cap.dir(), body);
-    EXPECT_TRUE(c.exited) << c.out;
-    EXPECT_EQ(0, c.exitCode);
-    return thrtest::withoutMessages(c.out);
-  }
-};
-
-TEST_F(SigRecovery, ResourcesRunLastFirstOnceAndTheFourthReturnEndsTheThread) {
-  EXPECT_EQ("action 2\n"
-            "action 1\n"
-            "return 1 rc=2009 signal=2\n"
-            "return 2 rc=2010 signal=2\n"  // no resource ran: 3 stays registered
-            "return 3 rc=2010 signal=2\n"
-            "end=2010 code=2010 global=2\n",
-            child([] { return runThread(signalledBody, "Signalled"); }));
-  // Reported at each of the three returns; the fourth ends the thread first.
-  EXPECT_EQ(3u, cap.issued(591).size());
-  EXPECT_TRUE(cap.issuedWith(591, {"Signalled", "Handled", "SIGINT"})) << cap.log();
-}
-
-TEST_F(SigRecovery, ASignalOnAnUnregisteredThreadEndsItWith2009AndLeavesNoLockHeld) {
-  // The thread is inside the thread-id list's lock, as it is while it looks
-  // itself up: the handler's messages look it up again.
-  EXPECT_EQ("end=2009 list free\n", child([] {
-              recoveryMgr::erReinstall();
-              pthread_t raw;
-              pthread_create(
-                  &raw, nullptr,
-                  [](void*) -> void* {
-                    klpThreadIdList()->lockList();
-                    raise(SIGINT);
-                    say("not reached\n");
-                    return nullptr;
-                  },
-                  nullptr);
-              void* ret = nullptr;
-              pthread_join(raw, &ret);
-              klpThreadIdList()->lockList();
-              klpThreadIdList()->unlockList();
-              printf("end=%ld list free\n", static_cast<long>(reinterpret_cast<intptr_t>(ret)));
-              return 0;
-            }));
-  EXPECT_TRUE(cap.issuedWith(591, {"Unknown", "Non-handled", "2"})) << cap.log();
-  EXPECT_TRUE(cap.issuedWith(589, {"findRcvyMgr", "602", "findThread"})) << cap.log();
-  EXPECT_TRUE(cap.issuedWith(589, {"signalHandler", "602", "findRcvyMgr"})) << cap.log();
-}
-
-TEST_F(SigRecovery, ARegisteredThreadWithoutRecoveryPointIsNamedAndEndsThroughThreadEnd) {
-  // The end code is stored (and the state is 6) as for any other end.
-  EXPECT_EQ("action 7\nend=2009 code=2009 global=2\n",
-            child([] { return runThread(pointlessBody, "NoPoint"); }));
-  EXPECT_TRUE(cap.issuedWith(591, {"NoPoint", "Non-handled", "SIGINT"})) << cap.log();
-  EXPECT_TRUE(cap.issuedWith(589, {"signalHandler", "2009", "setRecoveryPoint"})) << cap.log();
-  EXPECT_TRUE(cap.issued(591).size() == 1 && !cap.issuedWith(591, {"Unknown"})) << cap.log();
-}
-
-TEST_F(SigRecovery, ASignalInsideTheThreadIdListLockNeitherHangsTheEndNorKeepsTheLock) {
-  // The stop's own signal is reported as SIGTERM.
-  for (int sig : {SIGINT, erStopSignal()}) {
-    g_raise = sig;
-    std::string global = sig == SIGINT ? "2" : "15";
-    EXPECT_EQ("end=2009 code=2009 global=" + global + "\nlist free\n", child([] {
-                int rc = runThread(insideLockBody, "InLock");
-                // The thread is gone: the list must be free for the others.
-                klpThreadIdList()->lockList();
-                klpThreadIdList()->unlockList();
-                say("list free\n");
-                return rc;
-              }));
-  }
-  EXPECT_TRUE(cap.issuedWith(591, {"InLock", "Handled", "SIGINT"})) << cap.log();
-  EXPECT_TRUE(cap.issuedWith(591, {"InLock", "Handled", "SIGTERM"})) << cap.log();
 }
 
 // Waits (state 7) with a recovery point that ends the thread; with
@@ -229,82 +253,7 @@ void waitingBody(klpThread* t) {
   threadEnd(t, 0);
 }
 
-TEST_F(SigRecovery, StoppingAWaitingThreadSignalsItAndNeverEndsTheProcess) {
-  // The thread blocks SIGINT and SIGTERM, as every created thread does.
-  for (bool disarmed : {false, true}) {
-    g_disarmed = disarmed;
-    EXPECT_EQ(disarmed ? "stop=2009 end=2011 global=0\n" : "stop=2009 end=2009 global=15\n",
-              child([] {
-                recoveryMgr::erReinstall();
-                erClearGlobalSignal();
-                OrdList list("Threads");
-                list.makeShared(nullptr, 1);
-                int code = -1;
-                klpThread* t =
-                    createThread(&code, &list, waitingBody, "Waiter", nullptr, 1, nullptr, 0, 0);
-                if (!thrtest::waitFor([&] { return t->getState() == KLP_THREAD_WAIT; })) return 91;
-                pthread_mutex_lock(&g_order);
-                int rc = klpThread::stop(t);  // withdrawn: on its way out, or still waiting
-                pthread_mutex_unlock(&g_order);
-                g_release = true;
-                void* ret = nullptr;
-                pthread_join(t->handle, &ret);
-                printf("stop=%d end=%ld global=%d\n", rc,
-                       static_cast<long>(reinterpret_cast<intptr_t>(ret)), erGetGlobalSignal());
-                return 0;
-              }));
-  }
-  EXPECT_TRUE(cap.issuedWith(591, {"Waiter", "Handled", "SIGTERM"})) << cap.log();
-}
-
-TEST_F(SigRecovery, ARestartedThreadStartsWithAFreshRecoveryState) {
-  EXPECT_EQ("run 1 rc=2009\naction 5\nrun 2 rc=2009\nend code 2011\n", child([] {
-              recoveryMgr::erReinstall();
-              OrdList list("Threads");
-              list.makeShared(nullptr, 1);
-              int code = -1;
-              klpThread* t =
-                  createThread(&code, &list, restartedBody, "Again", nullptr, 1, nullptr, 0, 0);
-              auto ended = [&] { return t->getState() == KLP_THREAD_STOP; };
-              if (!thrtest::waitFor(ended)) return 91;
-              int highest = 0;
-              supervise(&list, 0, &highest);  // starts it again
-              if (!thrtest::waitFor([&] { return g_run == 2 && ended(); })) return 92;
-              printf("end code %d\n", t->getEndCode());
-              klpThread::stop(t);
-              return 0;
-            }));
-}
-
-TEST_F(SigRecovery, QueueResourcesDestroyOrDetachTheirQueue) {
-  std::string path = cap.dir() + "RCVY.TEST.IPC";
-  for (bool destroy : {true, false}) {
-    EXPECT_EQ("queue pointer cleared\nend=2009 code=2009 global=2\n", child([&] {
-                HSVResID id;
-                if (hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id) != 0) return 92;
-                g_queue = new HSVHIPCQueue;
-                if (g_queue->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION) != 0) return 93;
-                g_destroyQueue = destroy;
-                return runThread(queueBody, "QueueUser");
-              }));
-    EXPECT_EQ(!destroy, klptest::queueExists(path)) << (destroy ? "destroy" : "detach");
-  }
-  HSVResID id;  // leave nothing behind
-  hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id);
-  HSVHIPCQueue q;
-  ASSERT_EQ(0u, q.attach(id));
-  q.destroy();
-  EXPECT_FALSE(klptest::queueExists(path));
-  char ref[24];
-  snprintf(ref, sizeof ref, "%016" PRIx64, reinterpret_cast<uint64_t>(&g_queue));
-  EXPECT_TRUE(cap.issuedWith(595, {ref})) << cap.log();
-  EXPECT_TRUE(cap.issuedWith(593, {ref})) << cap.log();
-  EXPECT_TRUE(cap.has("<erHSVIPCQdestroy>")) << cap.log();
-}
-
-// A fault is never recovered: whether the thread has a recovery point or
-// not, the process ends by the fault (its core as usual) after one line on
-// standard error, with no message, no dump and no clean-up run.
+// A fault is never recovered, whether the thread has a recovery point or not.
 int g_fault = 0;
 void faultingBody(klpThread* t) {
   klpThread::prologue(t);
@@ -314,157 +263,221 @@ void faultingBody(klpThread* t) {
   say("carried on\n");
 }
 
-TEST_F(SigRecovery, AFaultEndsTheProcessWithATrapLineOnly) {
-  struct {
-    int sig;
-    bool registered;
-  } rows[] = {{SIGSEGV, true}, {SIGBUS, true}, {SIGILL, true}, {SIGSEGV, false}};
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.sig);
-    g_fault = row.sig;
-    auto c = thrtest::inChild(cap.dir(), [&] {
-      struct rlimit none = {0, 0};
-      setrlimit(RLIMIT_CORE, &none);
-      if (chdir(cap.dir().c_str()) != 0) return 94;  // where a dump would go
-      if (row.registered) return runThread(faultingBody, "Faulty");
-      recoveryMgr::erReinstall();
-      std::thread raw([] { raise(g_fault); });
-      raw.join();
-      return 0;
-    });
-    EXPECT_FALSE(c.exited) << c.out;
-    EXPECT_EQ(row.sig, c.signal);
-    EXPECT_EQ("", thrtest::withoutMessages(c.out));
-    std::string line = "KLP trap: signal " + std::to_string(row.sig) + " (";
-    EXPECT_NE(std::string::npos, c.err.find(line)) << c.err;
-    EXPECT_EQ(row.registered, c.err.find("(Faulty)") != std::string::npos) << c.err;
-  }
-  EXPECT_TRUE(cap.issued(591).empty()) << cap.log();
-  for (const auto& entry : std::filesystem::directory_iterator(cap.dir()))
-    EXPECT_EQ(std::string::npos, entry.path().string().find(".DUMP")) << entry.path();
+klpThread* startThread(OrdList& list, klpThreadRoutine body, const char* name) {
+  recoveryMgr::erReinstall();
+  erClearGlobalSignal();
+  list.makeShared(nullptr, 1);
+  int code = -1;
+  return createThread(&code, &list, body, name, nullptr, 1, nullptr, 0, 0);
 }
 
-TEST(RecoveryDump, NamedDirPrefixPidTidAppendedAndEndingWithTheMarker) {
-  thrtest::LogCapture cap;
-  auto endsWithMarker = [](const std::string& content) {
-    static const std::string marker("***E**O**D**M***\0", 17);
-    return content.size() >= marker.size() &&
-           content.compare(content.size() - marker.size(), marker.size(), marker) == 0;
-  };
-  std::string dir = cap.dir().substr(0, cap.dir().size() - 1);
-  std::string ids = "." + std::to_string(hsvProcessID()) + "." + std::to_string(hsvThreadID()) + ".DUMP";
-  char path[1200];
-  ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "S1", SIGSEGV, nullptr, nullptr, path, sizeof path));
-  EXPECT_EQ(dir + "/S1" + ids, path);
-  std::string first = klptest::readFile(path);
-  EXPECT_TRUE(endsWithMarker(first));
-  // A second dump of the same thread is appended.
-  ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "S1", SIGSEGV, nullptr, nullptr));
-  std::string both = klptest::readFile(path);
-  EXPECT_GT(both.size(), first.size());
-  EXPECT_EQ(0, both.compare(0, first.size(), first));
-  EXPECT_TRUE(endsWithMarker(both));
-  EXPECT_TRUE(cap.issuedWith(8053, {"SIGSEGV", path})) << cap.log();
-  // A blank prefix is left out; a file that cannot be opened is 803.
-  ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "   ", 8, nullptr, nullptr, path, sizeof path));
-  EXPECT_EQ(dir + "/" + ids, path);
-  EXPECT_EQ(KLP_RC_DUMP_FILE,
-            erDumpStackTraceTo((dir + "/missing/dir").c_str(), "S1", 8, nullptr, nullptr));
-  EXPECT_TRUE(cap.issuedWith(589, {"erDumpStackTraceInfo", "803", "HSVTrapFile::isValid"}))
-      << cap.log();
-  EXPECT_EQ(KLP_RC_DUMP_FILE,
-            erDumpStackTraceTo(std::string(2000, 'd').c_str(), "S1", 8, nullptr, nullptr));
+// Starts a thread, waits for it and prints how it ended.
+int runThread(klpThreadRoutine body, const char* name) {
+  OrdList list("Threads");
+  klpThread* t = startThread(list, body, name);
+  void* ret = nullptr;
+  pthread_join(t->handle, &ret);
+  printf("end=%ld code=%d global=%d\n", static_cast<long>(reinterpret_cast<intptr_t>(ret)),
+         t->getEndCode(), erGetGlobalSignal());
+  return 0;
 }
 
-TEST(Recovery, ResourcesNeedARegisteredThreadAndCanBeDropped) {
-  thrtest::mainReady();
-  thrtest::LogCapture cap;
-  int rc = 0;
-  std::thread other([&] { rc = addRcvyRes(action, 0) == nullptr ? 1 : 0; });
-  other.join();
-  EXPECT_EQ(1, rc);
-  EXPECT_TRUE(cap.issuedWith(589, {"addRcvyRes", "602", "findRcvyMgr"})) << cap.log();
-
-  recoveryRes* r = addRcvyRes(action, 7);
-  ASSERT_NE(nullptr, r);
-  EXPECT_STREQ("KlpRcvyRes:", r->ole.eyeCatcher);
-  EXPECT_EQ(&klpMainThread()->rcvyMgr.resList, r->ole.oleAnchor);
-  EXPECT_GT(r->registered, 0);
-  endRcvyRes(r);
-  EXPECT_EQ(0, klpMainThread()->rcvyMgr.resList.count);
+// The thread-id list must be free again for the others.
+int listFree() {
+  klpThreadIdList()->lockList();
+  klpThreadIdList()->unlockList();
+  say("list free\n");
+  return 0;
 }
 
-// ---------------------------------------------------------------------------
-// Control interface calls and ending signals
-// ---------------------------------------------------------------------------
+int stopWaiter() {
+  OrdList list("Threads");
+  klpThread* t = startThread(list, waitingBody, "Waiter");
+  if (!klptest::waitFor([&] { return t->getState() == KLP_THREAD_WAIT; })) return 91;
+  pthread_mutex_lock(&g_order);
+  int rc = klpThread::stop(t);  // withdrawn: on its way out, or still waiting
+  pthread_mutex_unlock(&g_order);
+  g_release = true;
+  void* ret = nullptr;
+  pthread_join(t->handle, &ret);
+  printf("stop=%d end=%ld global=%d\n", rc, static_cast<long>(reinterpret_cast<intptr_t>(ret)),
+         erGetGlobalSignal());
+  return 0;
+}
+
 std::atomic<int> g_callerSaw{0};
 void callerHandler(int sig) { g_callerSaw = sig; }
 std::atomic<bool> g_inCall{false};
 
-// One guarded call: a clean-up registered, then a SIGINT from `from`, the
-// call's own thread or another thread of the caller.
-int guardedCall(bool fromOtherThread, char* text, size_t len) {
-  erLibraryCall call;
-  if (KLP_SET_CALL_POINT(call) != 0) return call.recover(text, len);
-  recoveryRes* res = addRcvyRes(action, 4);
-  if (fromOtherThread) {
+// One guarded call of the control interface with a clean-up registered,
+// then a SIGINT on the call's own thread or on another thread of the caller;
+// the caller's handler must come back afterwards.
+int libraryCall(void (*handler)(int), bool fromOtherThread) {
+  signal(SIGINT, handler);
+  std::thread other;
+  if (fromOtherThread) other = std::thread([] {
+      klptest::waitFor([] { return g_inCall.load(); });
+      raise(SIGINT);  // this thread is the caller's, in no call
+    });
+  char text[1028] = "";
+  int rc = [&] {
+    erLibraryCall call;
+    if (KLP_SET_CALL_POINT(call) != 0) return call.recover(text, sizeof text);
+    recoveryRes* res = addRcvyRes(action, 4);
     g_inCall = true;
-    for (int i = 0; i < 2000; ++i) hsvSleep(5);
-  } else {
-    raise(SIGINT);
+    if (fromOtherThread)
+      for (int i = 0; i < 2000; ++i) hsvSleep(5);
+    else
+      raise(SIGINT);
+    endRcvyRes(res);
+    return 0;
+  }();
+  if (other.joinable()) other.join();
+  struct sigaction now;
+  sigaction(SIGINT, nullptr, &now);
+  printf("rc=%d %s %s\n", rc, now.sa_handler == handler ? "restored" : "not restored",
+         strstr(text, "SIGINT") ? "SIGINT" : text);
+  if (handler == callerHandler) {
+    raise(SIGINT);  // the caller's own handler takes it now
+    if (g_callerSaw != SIGINT) return 96;
   }
-  endRcvyRes(res);
   return 0;
 }
 
-TEST_F(SigRecovery, ASignalDuringALibraryCallEndsTheCallAndTheCallersHandlersComeBack) {
+struct SigRecovery : ::testing::Test {
+  void SetUp() override { klptest::mainThreadReady(); }
+  klptest::TmpDir tmp;
+  klptest::LogRecords records{tmp.path()};
+};
+
+TEST_F(SigRecovery, ASignalComesBackToTheThreadsRecoveryPointWithItsCleanUps) {
+  const Logs once = {"591|recoveryMgr::erWhatSignal|1|InLock|Handled|SIGINT"};
   struct {
-    void (*handler)(int);
-    bool fromOtherThread;
-  } rows[] = {{callerHandler, false}, {SIG_IGN, false}, {SIG_DFL, false}, {callerHandler, true}};
+    const char* what;
+    std::function<int()> body;
+    const char* out;
+    Logs logs;
+  } rows[] = {
+      {"resources last first, once; the fourth return ends the thread",
+       [] { return runThread(signalledBody, "Signalled"); },
+       "action 2\naction 1\nreturn 1 rc=2009 signal=2\nreturn 2 rc=2010 signal=2\n"
+       "return 3 rc=2010 signal=2\nend=2010 code=2010 global=2\n",
+       Logs(3, "591|recoveryMgr::erWhatSignal|1|Signalled|Handled|SIGINT")},
+      {"a thread that is not registered, inside the thread-id list's lock", [] {
+         recoveryMgr::erReinstall();
+         pthread_t raw;
+         pthread_create(&raw, nullptr, [](void*) -> void* {
+           klpThreadIdList()->lockList();
+           raise(SIGINT);
+           return nullptr;
+         }, nullptr);
+         void* ret = nullptr;
+         pthread_join(raw, &ret);
+         printf("end=%ld\n", static_cast<long>(reinterpret_cast<intptr_t>(ret)));
+         return listFree();
+       },
+       "end=2009\nlist free\n",
+       {"589|findRcvyMgr|1|findRcvyMgr|602|findThread", "589|signalHandler|1|signalHandler|602|findRcvyMgr",
+        "591|signalHandler|1|Unknown|Non-handled|2"}},
+      {"a registered thread without recovery point", [] { return runThread(pointlessBody, "NoPoint"); },
+       "action 7\nend=2009 code=2009 global=2\n",
+       {"589|signalHandler|1|signalHandler|2009|setRecoveryPoint",
+        "8999|signalHandler|r8|the thread has no recovery point", "591|signalHandler|1|NoPoint|Non-handled|SIGINT"}},
+      {"inside the thread-id list's lock", [] {
+         g_raise = SIGINT;
+         return runThread(insideLockBody, "InLock") + listFree();
+       },
+       "end=2009 code=2009 global=2\nlist free\n", once},
+      {"the stop's signal inside the lock: reported as SIGTERM", [] {
+         g_raise = erStopSignal();
+         return runThread(insideLockBody, "InLock") + listFree();
+       },
+       "end=2009 code=2009 global=15\nlist free\n",
+       {"591|recoveryMgr::erWhatSignal|1|InLock|Handled|SIGTERM"}},
+      {"stop of a waiting thread", [] { return stopWaiter(); }, "stop=2009 end=2009 global=15\n",
+       {"590|klpThread::stop|1|Initial|0|Waiter", "591|recoveryMgr::erWhatSignal|1|Waiter|Handled|SIGTERM"}},
+      {"stop of a waiting thread that gave its point up: never the process", [] {
+         g_disarmed = true;
+         return stopWaiter();
+       },
+       "stop=2009 end=2011 global=0\n", {"590|klpThread::stop|1|Initial|0|Waiter"}},
+      {"a restarted thread starts with a fresh recovery state", [] {
+         OrdList list("Threads");
+         klpThread* t = startThread(list, restartedBody, "Again");
+         auto ended = [&] { return t->getState() == KLP_THREAD_STOP; };
+         if (!klptest::waitFor(ended)) return 91;
+         int highest = 0;
+         supervise(&list, 0, &highest);  // starts it again
+         if (!klptest::waitFor([&] { return g_run == 2 && ended(); })) return 92;
+         printf("end code %d\n", t->getEndCode());
+         klpThread::stop(t);
+         return 0;
+       },
+       "run 1 rc=2009\naction 5\nrun 2 rc=2009\nend code 2011\n",
+       {"591|recoveryMgr::erWhatSignal|1|Again|Handled|SIGINT", "591|recoveryMgr::erWhatSignal|1|Again|Handled|SIGINT",
+        "590|klpThread::stop|1|Initial|2011|Again"}},
+      {"library call, caller's handler", [] { return libraryCall(callerHandler, false); },
+       "action 4\nrc=2010 restored SIGINT\n", {}},
+      {"library call, caller ignores", [] { return libraryCall(SIG_IGN, false); },
+       "action 4\nrc=2010 restored SIGINT\n", {}},
+      {"library call, caller's default", [] { return libraryCall(SIG_DFL, false); },
+       "action 4\nrc=2010 restored SIGINT\n", {}},
+      {"library call, signal on another thread of the caller",
+       [] { return libraryCall(callerHandler, true); }, "action 4\nrc=2010 restored SIGINT\n", {}},
+  };
   for (const auto& row : rows) {
-    EXPECT_EQ("action 4\nrc=2010 restored\n", child([&] {
-                signal(SIGINT, row.handler);
-                std::thread other;
-                if (row.fromOtherThread) other = std::thread([] {
-                    thrtest::waitFor([] { return g_inCall.load(); });
-                    raise(SIGINT);  // this thread is the caller's, in no call
-                  });
-                char text[1028];
-                int rc = guardedCall(row.fromOtherThread, text, sizeof text);
-                if (other.joinable()) other.join();
-                if (std::string(text).find("SIGINT") == std::string::npos) return 95;
-                struct sigaction now;
-                sigaction(SIGINT, nullptr, &now);
-                printf("rc=%d %s\n", rc, now.sa_handler == row.handler ? "restored" : "not restored");
-                if (row.handler == callerHandler) {
-                  raise(SIGINT);  // the caller's own handler takes it now
-                  if (g_callerSaw != SIGINT) return 96;
-                }
-                return 0;
-              }));
+    auto c = klptest::inChild(tmp.path(), row.body);
+    EXPECT_EQ(0, c.exitCode) << row.what << "\n" << c.out;
+    EXPECT_EQ(row.out, c.out) << row.what;
+    EXPECT_EQ(row.logs, records.take()) << row.what;
   }
 }
 
-TEST_F(SigRecovery, AnEndingSignalRunsTheCleanUpsThenEndsTheProcessByThatSignal) {
-  for (int sig : {SIGHUP, SIGQUIT, SIGPIPE, SIGUSR1}) {
-    auto c = thrtest::inChild(cap.dir(), [sig] {
+TEST_F(SigRecovery, FaultsEndTheProcessWithATrapLineAndEndingSignalsAfterTheCleanUps) {
+  // A fault ends the process by itself (its core as usual) after one line on
+  // standard error: no message, no dump, no clean-up. Any other signal whose
+  // default ends the process runs the clean-ups first (erCatchEndingSignals).
+  struct {
+    int sig;
+    int kind;  // 0 fault on a registered thread, 1 fault on a thread of no one, 2 ending signal
+    std::string out;
+    Logs logs;
+  } rows[] = {
+      {SIGSEGV, 0, "", {}}, {SIGBUS, 0, "", {}}, {SIGILL, 0, "", {}}, {SIGSEGV, 1, "", {}},
+      {SIGHUP, 2, "action 1\n", {"591|recoveryMgr::erWhatSignal|1|Initial|Non-handled|1"}},
+      {SIGQUIT, 2, "action 3\n", {"591|recoveryMgr::erWhatSignal|1|Initial|Non-handled|3"}},
+      {SIGPIPE, 2, "action 13\n", {"591|recoveryMgr::erWhatSignal|1|Initial|Non-handled|13"}},
+      {SIGUSR1, 2, "action 10\n", {"591|recoveryMgr::erWhatSignal|1|Initial|Non-handled|10"}},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.sig);
+    g_fault = row.sig;
+    auto c = klptest::inChild(tmp.path(), [&] {
       struct rlimit none = {0, 0};
       setrlimit(RLIMIT_CORE, &none);
+      if (chdir(tmp.path().c_str()) != 0) return 94;  // where a dump would go
+      if (row.kind == 0) return runThread(faultingBody, "Faulty");
       recoveryMgr::erReinstall();
+      if (row.kind == 1) std::thread([] { raise(g_fault); }).join();
       erCatchEndingSignals();
       klpThread* m = klpMainThread();
       if (KLP_SET_RECOVERY_POINT(m->rcvyMgr) != 0) {
         recoveryMgr::erRecover(&m->rcvyMgr, m);
         return 97;  // not reached: the signal ends the process
       }
-      addRcvyRes(action, sig);
-      kill(getpid(), sig);
+      addRcvyRes(action, row.sig);
+      kill(getpid(), row.sig);
       return 98;
     });
-    EXPECT_EQ(sig, c.signal) << c.out;
-    EXPECT_EQ("action " + std::to_string(sig) + "\n", thrtest::withoutMessages(c.out));
+    EXPECT_EQ(row.sig, c.signal);
+    EXPECT_EQ(row.out, c.out);
+    EXPECT_EQ(row.logs, records.take());
+    std::string trap = "KLP trap: signal " + std::to_string(row.sig) + " (";
+    EXPECT_EQ(row.kind < 2, c.err.find(trap) != std::string::npos) << c.err;
+    EXPECT_EQ(row.kind == 0, c.err.find("(Faulty)") != std::string::npos) << c.err;
   }
+  for (const auto& entry : std::filesystem::directory_iterator(tmp.path()))
+    EXPECT_EQ(std::string::npos, entry.path().string().find(".DUMP")) << entry.path();
 }
 
 }  // namespace

@@ -107,4 +107,37 @@ class ProcessLogger {
   msgLogger* saved_;
 };
 
+// ---------------------------------------------------------------------------
+// Threads, lists and recovery
+// ---------------------------------------------------------------------------
+// The process logger while the object lives, writing nowhere but a record
+// file under dir (kept in a file so that forked children's records count):
+// one line per message, "number|origin|kind|values...", kind being the
+// destination kind 0, 1 or 2 (or "r" and the routing word when a routing
+// was given directly), the values the caller's, in order (without the
+// trailing pads " " and "*").
+class LogRecords {
+ public:
+  explicit LogRecords(const std::string& dir);
+  ~LogRecords();
+  LogRecords(const LogRecords&) = delete;
+  LogRecords& operator=(const LogRecords&) = delete;
+  // The records so far, then forgotten; withThread puts the issuing
+  // thread's name and ">" in front of each.
+  std::vector<std::string> take(bool withThread = false);
+
+ private:
+  std::string file_;
+  msgLogger* logger_;
+  msgLogger* saved_;
+};
+
+// Polls cond every 5 ms for at most ms milliseconds.
+bool waitFor(const std::function<bool()>& cond, int ms = 5000);
+
+// The process's first prologue, run once on the calling (main) thread, with
+// the signal handlers it installs given back: a fault in a test must not be
+// recovered in the test process.
+void mainThreadReady();
+
 }  // namespace klptest
