@@ -264,30 +264,22 @@ namespace {
 
 class RecordingLogger : public msgLoggerU {
  public:
-  explicit RecordingLogger(const std::string& file)
-      : msgLoggerU(MSG_APP_KLPKCCMD, 0), file_(file) {
+  explicit RecordingLogger(const std::string& file) : msgLoggerU(10, 0), file_(file) {
     loadBuiltinMsgs(builtinMsgTable);
   }
   void writeConsole(logMsg*) override {}
   void writeStderr(logMsg*) override {}
-  // Sees every record issued, with the routing its caller asked for.
-  void setRouting(logMsg* r) override {
-    int first = 0, end = r->valueCount;
+  void setRouting(logMsg* r) override {  // every record, with the routing asked for
     char qt[MSG_QUALIFIER_MAX + MSG_THREAD_NAME_MAX + 8];
     qualifierAndThread(r->threadName, qt, sizeof qt);
     auto is = [r](int i, const char* v) { return i < r->valueCount && strcmp(r->values[i], v) == 0; };
-    if (is(0, getApplicationName()) && is(1, qt)) first = 2;  // header values
-    else if (is(0, qt)) first = 1;
-    while (end > first && (is(end - 1, " ") || is(end - 1, "*"))) --end;  // pads
-    std::string kind = r->routing == 12 ? "0" : r->routing == 1 ? "1" : r->routing == 35 ? "2"
-                     : "r" + std::to_string(r->routing);
+    int first = is(0, getApplicationName()) && is(1, qt) ? 2 : is(0, qt) ? 1 : 0, end = r->valueCount;
+    while (end > first && (is(end - 1, " ") || is(end - 1, "*"))) --end;
+    int k = r->routing == 12 ? 0 : r->routing == 1 ? 1 : r->routing == 35 ? 2 : -1;
     std::string line = std::string(r->threadName) + ">" + std::to_string(r->msgNumber) + "|" +
-                       r->origin + "|" + kind;
+                       r->origin + "|" + (k < 0 ? "r" + std::to_string(r->routing) : std::to_string(k));
     for (int i = first; i < end; ++i) line += std::string("|") + r->values[i];
-    line += "\n";
-    int fd = open(file_.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
-    if (fd >= 0 && write(fd, line.data(), line.size()) < 0) perror("record");
-    if (fd >= 0) close(fd);
+    std::ofstream(file_, std::ios::app) << line << "\n";
     msgLoggerU::setRouting(r);
   }
 
@@ -298,42 +290,35 @@ class RecordingLogger : public msgLoggerU {
 }  // namespace
 
 LogRecords::LogRecords(const std::string& dir)
-    : file_(dir + "records." + std::to_string(getpid())),
-      logger_(new RecordingLogger(file_)),
-      saved_(klpGetProcessLogger()) {
+    : file_(dir + "records"), logger_(new RecordingLogger(file_)), saved_(klpGetProcessLogger()) {
   klpSetProcessLogger(logger_);
 }
 
 LogRecords::~LogRecords() {
   klpSetProcessLogger(saved_);
   delete logger_;
-  unlink(file_.c_str());
 }
 
 std::vector<std::string> LogRecords::take(bool withThread) {
   std::vector<std::string> out = lines(readFile(file_));
-  if (truncate(file_.c_str(), 0) != 0) out.clear();  // none yet
+  std::ofstream(file_, std::ios::trunc).flush();
   for (std::string& line : out)
     if (!withThread) line.erase(0, line.find('>') + 1);
   return out;
 }
 
 bool waitFor(const std::function<bool()>& cond, int ms) {
-  for (int waited = 0; waited <= ms; waited += 5) {
-    if (cond()) return true;
-    hsvSleep(5);
-  }
+  for (int waited = 0; waited < ms && !cond(); waited += 5) hsvSleep(5);
   return cond();
 }
 
 void mainThreadReady() {
-  klpThread* m = klpMainThread();
-  if (m->tid.oleAnchor != nullptr) return;
+  if (klpMainThread()->tid.oleAnchor != nullptr) return;
   const int sigs[] = {SIGINT, SIGFPE, SIGABRT, SIGSEGV, SIGBUS, SIGILL, SIGTERM, erStopSignal()};
-  struct sigaction old[sizeof sigs / sizeof sigs[0]];
-  for (size_t i = 0; i < sizeof sigs / sizeof sigs[0]; ++i) sigaction(sigs[i], nullptr, &old[i]);
-  klpThread::prologue(m);
-  for (size_t i = 0; i < sizeof sigs / sizeof sigs[0]; ++i) sigaction(sigs[i], &old[i], nullptr);
+  struct sigaction old[8];
+  for (int i = 0; i < 8; ++i) sigaction(sigs[i], nullptr, &old[i]);
+  klpThread::prologue(klpMainThread());
+  for (int i = 0; i < 8; ++i) sigaction(sigs[i], &old[i], nullptr);
 }
 
 }  // namespace klptest

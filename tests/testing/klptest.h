@@ -111,19 +111,15 @@ class ProcessLogger {
 // Threads, lists and recovery
 // ---------------------------------------------------------------------------
 // The process logger while the object lives, writing nowhere but a record
-// file under dir (kept in a file so that forked children's records count):
-// one line per message, "number|origin|kind|values...", kind being the
-// destination kind 0, 1 or 2 (or "r" and the routing word when a routing
-// was given directly), the values the caller's, in order (without the
-// trailing pads " " and "*").
+// file in dir (so that forked children's records count): per message
+// "number|origin|kind|values..." with the destination kind 0, 1 or 2 (or
+// "r" and the routing word given directly) and the caller's values in order,
+// trailing pads (" ", "*") left out.
 class LogRecords {
  public:
   explicit LogRecords(const std::string& dir);
   ~LogRecords();
-  LogRecords(const LogRecords&) = delete;
-  LogRecords& operator=(const LogRecords&) = delete;
-  // The records so far, then forgotten; withThread puts the issuing
-  // thread's name and ">" in front of each.
+  // The records so far, then forgotten; withThread puts "thread name>" first.
   std::vector<std::string> take(bool withThread = false);
 
  private:
@@ -135,9 +131,8 @@ class LogRecords {
 // Polls cond every 5 ms for at most ms milliseconds.
 bool waitFor(const std::function<bool()>& cond, int ms = 5000);
 
-// The process's first prologue, run once on the calling (main) thread, with
-// the signal handlers it installs given back: a fault in a test must not be
-// recovered in the test process.
+// The process's first prologue, once, on the calling (main) thread, with the
+// signal handlers it installs given back: a test's fault is not recovered.
 void mainThreadReady();
 
 }  // namespace klptest
