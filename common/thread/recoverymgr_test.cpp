@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <cinttypes>
 #include <cstdio>
 #include <filesystem>
 #include <functional>
@@ -30,26 +31,39 @@ bool endsWithMarker(const std::string& s) {
   return s.size() > 17 && s.compare(s.size() - 17, 17, std::string("***E**O**D**M***\0", 17)) == 0;
 }
 
+HSVHIPCQueue* g_queue = nullptr;  // of the queue actions: outlives every frame
+
 // Every routine of the folder that reports, with the records it logs
-// (number, origin, destination kind, values in order); those of the signal
-// handler are in the signal table below.
+// (number, origin, destination kind, values in order); those of a stop and
+// of the signal handler are with their tables.
 TEST(ThreadRecords, EachRoutineLogsItsRecords) {
   klptest::mainThreadReady();
   klptest::TmpDir tmp;
   klptest::LogRecords records(tmp.path());
-  char owner[32];
+  char owner[32], ref[24];
   snprintf(owner, sizeof owner, "Initial:0x%08x",
            static_cast<unsigned>(reinterpret_cast<uintptr_t>(klpMainThread()) & 0xFFFFFFFFu));
+  snprintf(ref, sizeof ref, "%016" PRIxPTR, reinterpret_cast<uintptr_t>(&g_queue));
   std::string dir = tmp.path() + "d", dump = dir + "/S1." + std::to_string(hsvProcessID()) + "." +
                                              std::to_string(hsvThreadID()) + ".DUMP";
   std::filesystem::create_directory(dir);
-  auto report = [](int sig, int global) {
+  HSVResID id;
+  ASSERT_EQ(0u, hsvIPCGetQueResID((dir + "/Q.IPC").c_str(), HSV_QUEUE_RESID_OPTION, &id));
+  auto queue = [&](void (*act)(uint64_t), bool create) {
+    return [=] {  // the queue is gone only when destroyed
+      g_queue = new HSVHIPCQueue;
+      EXPECT_EQ(0u, create ? g_queue->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION) : g_queue->attach(id));
+      act(reinterpret_cast<uint64_t>(&g_queue));
+      EXPECT_TRUE(g_queue == nullptr && klptest::queueExists(dir + "/Q.IPC") == create);
+    };
+  };
+  auto report = [](int sig, int global) {  // the signal report alone
     return [sig, global] {
       recoveryMgr m;
       m.signal = sig;
+      erClearGlobalSignal();
       recoveryMgr::erWhatSignal(&m);
       EXPECT_EQ(global, erGetGlobalSignal()) << sig;
-      erClearGlobalSignal();
     };
   };
   const std::string what = "591|recoveryMgr::erWhatSignal|1|Initial|";
@@ -76,19 +90,14 @@ TEST(ThreadRecords, EachRoutineLogsItsRecords) {
          EXPECT_TRUE(l.count == 2 && !b.oleAnchor && !b.olePrev && !c.oleNext);
        },
        {"8000|ordListDeChain|1|KlpOLE:|Broken"}},
-      {[] {  // stop of an ended thread
-         OrdList list("Threads");
-         list.makeShared(nullptr, 1);
-         int code = 0;
-         klpThread* t = createThread(&code, &list, [](klpThread* self) {
-           klpThread::prologue(self);
-           threadEnd(self, 77);
-         }, "Ender", nullptr, 1, nullptr, 0, 0);
-         ASSERT_TRUE(klptest::waitFor([&] { return t->getState() == KLP_THREAD_STOP; }));
-         EXPECT_EQ(77, klpThread::stop(t));
+      {[] {  // a resource is the current thread's: none for a thread that is not registered
+         std::thread([] { EXPECT_EQ(nullptr, addRcvyRes(action, 0)); }).join();
+         recoveryRes* r = addRcvyRes(action, 7);
+         EXPECT_TRUE(r && !strcmp(r->ole.eyeCatcher, "KlpRcvyRes:") && r->registered > 0 &&
+                     r->ole.oleAnchor == &klpMainThread()->rcvyMgr.resList);
+         endRcvyRes(r);
+         EXPECT_EQ(0, klpMainThread()->rcvyMgr.resList.count);
        },
-       {"590|klpThread::stop|1|Initial|77|Ender"}},
-      {[] { std::thread([] { EXPECT_EQ(nullptr, addRcvyRes(action, 0)); }).join(); },  // no thread
        {"589|findRcvyMgr|1|findRcvyMgr|602|findThread", "589|addRcvyRes|1|addRcvyRes|602|findRcvyMgr"}},
       {report(SIGINT, SIGINT), {what + "Handled|SIGINT"}},
       {report(SIGTERM, SIGTERM), {what + "Handled|SIGTERM"}},
@@ -97,17 +106,16 @@ TEST(ThreadRecords, EachRoutineLogsItsRecords) {
       {report(SIGSEGV, 0), {"569|recoveryMgr::erWhatSignal|1|SIGSEGV", what + "Handled|SIGSEGV"}},
       {report(SIGBUS, 0), {what + "Non-handled|7"}},
       {report(0, 0), {}},
-      {[] { erHSVIPCQdestroy(0); }, {"595|erHSVIPCQdestroy|1|0000000000000000"}},
-      {[] { erHSVIPCQdetach(0); }, {"593|erHSVIPCQdestroy|1|0000000000000000"}},
+      {queue(erHSVIPCQdetach, true), {std::string("593|erHSVIPCQdestroy|1|") + ref}},
+      {queue(erHSVIPCQdestroy, false), {std::string("595|erHSVIPCQdestroy|1|") + ref}},
       {[&] {  // a dump, then one more appended
          char path[1200];
          ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "S1", SIGSEGV, nullptr, nullptr, path, 1200));
-         EXPECT_EQ(dump, path);
          std::string first = klptest::readFile(dump);
          ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "S1", SIGSEGV, nullptr, nullptr));
          std::string both = klptest::readFile(dump);
-         EXPECT_TRUE(endsWithMarker(first) && endsWithMarker(both) && both.size() > first.size() &&
-                     both.compare(0, first.size(), first) == 0);
+         EXPECT_TRUE(dump == path && endsWithMarker(first) && endsWithMarker(both) &&
+                     both.size() > first.size() && both.compare(0, first.size(), first) == 0);
        },
        {"8053|erDumpStackTraceInfo|1|SIGSEGV|" + dump, "8053|erDumpStackTraceInfo|1|SIGSEGV|" + dump}},
       {[&] { erDumpStackTraceTo(dir.c_str(), "  ", SIGFPE, nullptr, nullptr); },  // no prefix
@@ -125,36 +133,18 @@ TEST(ThreadRecords, EachRoutineLogsItsRecords) {
   }
 }
 
-TEST(Recovery, ResourcesBelongToTheCurrentThreadAndQueueActionsEndTheirQueue) {
-  klptest::mainThreadReady();
-  klptest::TmpDir tmp;
-  recoveryRes* r = addRcvyRes(action, 7);
-  ASSERT_NE(nullptr, r);
-  EXPECT_STREQ("KlpRcvyRes:", r->ole.eyeCatcher);
-  EXPECT_TRUE(r->ole.oleAnchor == &klpMainThread()->rcvyMgr.resList && r->registered > 0);
-  endRcvyRes(r);
-  EXPECT_EQ(0, klpMainThread()->rcvyMgr.resList.count);
-  std::string path = tmp.path() + "RCVY.TEST.IPC";
-  HSVResID id;
-  ASSERT_EQ(0u, hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id));
-  for (void (*act)(uint64_t) : {erHSVIPCQdetach, erHSVIPCQdestroy}) {
-    HSVHIPCQueue* q = new HSVHIPCQueue;
-    ASSERT_EQ(0u, act == erHSVIPCQdetach ? q->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION) : q->attach(id));
-    act(reinterpret_cast<uint64_t>(&q));
-    EXPECT_EQ(nullptr, q);
-    EXPECT_EQ(act == erHSVIPCQdetach, klptest::queueExists(path));
-  }
-}
-
 // ---------------------------------------------------------------------------
 // Signals, in forked children: the handler jumps, threads end and the
 // process-wide record changes, none of which may touch the test process.
 // ---------------------------------------------------------------------------
-// What the body of the thread "Sig" does: adds the resources of its pass
-// (passes split by '|'), then raises sig on itself (sig 0: waits for a stop
-// in state 7 instead). Flags: n no recovery point; c carries on after a
-// return there (else it ends with the code); l raises inside the thread-id
-// list's lock; d gives its point up before it waits.
+// What the thread "Sig" does: adds the resources of its pass (passes split
+// by '|'), then raises sig on itself (sig 0: waits in state 7 for a stop).
+// Flags: u no prologue (not registered); n no recovery point; c carries on
+// after a return there (else ends with the code); l raises inside the
+// thread-id list's lock; d gives its point up before it waits. Of the main
+// thread: s stops it; r restarts it once ended; e catches ending signals
+// first; C and O make a library call instead (signal on the call's thread,
+// or on another).
 struct Plan {
   const char* adds;
   int sig;
@@ -162,14 +152,14 @@ struct Plan {
 };
 Plan g_plan;
 int g_pass = 0;
-std::atomic<bool> g_release{false};  // a waiting body goes on when set
+std::atomic<bool> g_release{false};  // a waiting thread goes on when set
 // Only makes the stopper's message come before the stopped thread's (a
 // signal is no ordering the race detector sees).
 pthread_mutex_t g_order = PTHREAD_MUTEX_INITIALIZER;
 bool has(char flag) { return strchr(g_plan.flags, flag) != nullptr; }
 
 void body(klpThread* t) {
-  klpThread::prologue(t);
+  if (!has('u')) klpThread::prologue(t);
   if (!has('n') && KLP_SET_RECOVERY_POINT(t->rcvyMgr) != 0) {
     pthread_mutex_lock(&g_order);
     pthread_mutex_unlock(&g_order);
@@ -178,16 +168,16 @@ void body(klpThread* t) {
     fflush(stdout);
     if (!has('c')) threadEnd(t, rc);
   }
-  const char* p = g_plan.adds;
-  for (int i = 0; i < g_pass && p != nullptr; ++i) p = strchr(p, '|') ? strchr(p, '|') + 1 : nullptr;
-  for (++g_pass; p != nullptr && *p != '\0' && *p != '|'; ++p) addRcvyRes(action, *p - '0');
+  int at = 0;  // the resources of this pass
+  for (const char* p = g_plan.adds; *p != '\0'; ++p)
+    if (*p == '|') ++at; else if (at == g_pass) addRcvyRes(action, *p - '0');
+  ++g_pass;
   if (has('l')) klpThreadIdList()->lockList();
   if (has('d')) recoveryMgr::erUndoRecovery(&t->rcvyMgr);  // as a thread that is ending
   if (g_plan.sig == 0) t->setState(KLP_THREAD_WAIT);
   for (int i = 0; i < 2000 && g_plan.sig == 0 && !g_release; ++i) hsvSleep(5);
   sigset_t set;  // created threads block SIGINT and SIGTERM: unblocked on purpose
-  sigemptyset(&set);
-  sigaddset(&set, g_plan.sig);
+  erProcessSignals(&set);
   pthread_sigmask(SIG_UNBLOCK, &set, nullptr);
   raise(g_plan.sig);
   threadEnd(t, 0);
@@ -221,50 +211,31 @@ int libraryCall(bool otherThread) {
   return 0;
 }
 
-// How the child's main thread drives it.
-enum Drive { kRun, kStop, kRestart, kUnregistered, kCall, kCallOther, kEnding };
-
-int drive(Drive how, const Plan& plan) {
+int drive(const Plan& plan) {
   g_plan = plan;
   signal(SIGINT, callerHandler);
-  if (how == kCall || how == kCallOther) return libraryCall(how == kCallOther);
+  if (has('C') || has('O')) return libraryCall(has('O'));
   recoveryMgr::erReinstall();
   erClearGlobalSignal();
   struct rlimit none = {0, 0};
   setrlimit(RLIMIT_CORE, &none);
-  void* ret = nullptr;
-  if (how == kUnregistered) {  // inside the thread-id list's lock, as it looks itself up
-    pthread_t raw;
-    pthread_create(&raw, nullptr, [](void*) -> void* {
-      klpThreadIdList()->lockList();
-      raise(g_plan.sig);
-      return nullptr;
-    }, nullptr);
-    pthread_join(raw, &ret);
-    printf("end=%ld\n", static_cast<long>(reinterpret_cast<intptr_t>(ret)));
-  } else if (how == kEnding) {
-    erCatchEndingSignals();
-    klpThread* m = klpMainThread();
-    if (KLP_SET_RECOVERY_POINT(m->rcvyMgr) != 0) recoveryMgr::erRecover(&m->rcvyMgr, m);
-    addRcvyRes(action, plan.sig);
-    return kill(getpid(), plan.sig) + 98;  // not come back: the signal ends the process
-  } else {
-    OrdList list("Threads");
-    list.makeShared(nullptr, 1);
-    int code = -1, highest = 0;
-    klpThread* t = createThread(&code, &list, body, "Sig", nullptr, 1, nullptr, 0, 0);
-    auto is = [t](int32_t s) { return klptest::waitFor([&] { return t->getState() == s; }); };
-    if (how == kStop && is(KLP_THREAD_WAIT)) {
-      pthread_mutex_lock(&g_order);
-      printf("stop=%d\n", klpThread::stop(t));  // withdrawn: on its way out, or still waiting
-      pthread_mutex_unlock(&g_order);
-      g_release = true;
-    }
-    if (how == kRestart && is(KLP_THREAD_STOP)) printf("supervised=%d\n", supervise(&list, 0, &highest));
-    pthread_join(t->handle, &ret);
-    printf("end=%ld code=%d global=%d\n", static_cast<long>(reinterpret_cast<intptr_t>(ret)),
-           t->getEndCode(), erGetGlobalSignal());
+  if (has('e')) erCatchEndingSignals();
+  OrdList list("Threads");
+  list.makeShared(nullptr, 1);
+  int code = -1, highest = 0;
+  klpThread* t = createThread(&code, &list, body, "Sig", nullptr, 1, nullptr, 0, 0);
+  auto is = [t](int32_t s) { return klptest::waitFor([&] { return t->getState() == s; }); };
+  if (has('s') && is(KLP_THREAD_WAIT)) {
+    pthread_mutex_lock(&g_order);
+    printf("stop=%d\n", klpThread::stop(t));  // withdrawn: on its way out, or still waiting
+    pthread_mutex_unlock(&g_order);
+    g_release = true;
   }
+  if (has('r') && is(KLP_THREAD_STOP)) printf("supervised=%d\n", supervise(&list, 0, &highest));
+  void* ret = nullptr;
+  pthread_join(t->handle, &ret);
+  printf("end=%ld code=%d global=%d\n", static_cast<long>(reinterpret_cast<intptr_t>(ret)),
+         t->getEndCode(), erGetGlobalSignal());
   klpThreadIdList()->lockList();  // free again for the others
   klpThreadIdList()->unlockList();
   return 0;
@@ -274,10 +245,9 @@ TEST(SigRecovery, SignalsComeBackToTheThreadsRecoveryPointWithItsCleanUpsOrEndTh
   klptest::mainThreadReady();
   klptest::TmpDir tmp;
   klptest::LogRecords records(tmp.path());
-  const std::string sig = "591|recoveryMgr::erWhatSignal|1|Sig|Handled|", stop = "590|klpThread::stop|1|Initial|0|Sig";
+  const std::string sig = "591|recoveryMgr::erWhatSignal|1|Sig|", stop = "590|klpThread::stop|1|Initial|0|Sig";
   const std::string ret = "return 1 rc=2009 signal=", ended = "end=2009 code=2009 global=";
   struct {
-    Drive how;
     Plan plan;
     int endSig;        // the signal that ends the process; 0: none
     const char* trap;  // on standard error; null: no trap line
@@ -285,36 +255,36 @@ TEST(SigRecovery, SignalsComeBackToTheThreadsRecoveryPointWithItsCleanUpsOrEndTh
     Logs logs;
   } rows[] = {
       // Resources last first, on the first return only; the fourth return ends the thread.
-      {kRun, {"12|3", SIGINT, "c"}, 0, nullptr, "action 2\naction 1\n" + ret + "2\nreturn 2 rc=2010 signal=2\n"
-       "return 3 rc=2010 signal=2\nend=2010 code=2010 global=2\n", Logs(3, sig + "SIGINT")},
+      {{"12|3", SIGINT, "c"}, 0, nullptr, "action 2\naction 1\n" + ret + "2\nreturn 2 rc=2010 signal=2\n"
+       "return 3 rc=2010 signal=2\nend=2010 code=2010 global=2\n", Logs(3, sig + "Handled|SIGINT")},
       // Inside the thread-id list's lock, which the jump abandons; the stop's signal as SIGTERM.
-      {kRun, {"", SIGINT, "l"}, 0, nullptr, ret + "2\n" + ended + "2\n", {sig + "SIGINT"}},
-      {kRun, {"", erStopSignal(), "l"}, 0, nullptr, ret + "15\n" + ended + "15\n", {sig + "SIGTERM"}},
-      {kRun, {"7", SIGINT, "n"}, 0, nullptr, "action 7\n" + ended + "2\n",
+      {{"", SIGINT, "l"}, 0, nullptr, ret + "2\n" + ended + "2\n", {sig + "Handled|SIGINT"}},
+      {{"", erStopSignal(), "l"}, 0, nullptr, ret + "15\n" + ended + "15\n", {sig + "Handled|SIGTERM"}},
+      {{"7", SIGINT, "n"}, 0, nullptr, "action 7\n" + ended + "2\n",
        {"589|signalHandler|1|signalHandler|2009|setRecoveryPoint",
         "8999|signalHandler|r8|the thread has no recovery point", "591|signalHandler|1|Sig|Non-handled|SIGINT"}},
-      {kUnregistered, {"", SIGINT, ""}, 0, nullptr, "end=2009\n",
+      {{"", SIGINT, "unl"}, 0, nullptr, "end=2009 code=0 global=2\n",
        {"589|findRcvyMgr|1|findRcvyMgr|602|findThread", "589|signalHandler|1|signalHandler|602|findRcvyMgr",
         "591|signalHandler|1|Unknown|Non-handled|2"}},
       // A stop signals a waiting thread; never the process, also when the thread gave its point up.
-      {kStop, {"", 0, ""}, 0, nullptr, "stop=2009\n" + ret + "15\n" + ended + "15\n", {stop, sig + "SIGTERM"}},
-      {kStop, {"", 0, "d"}, 0, nullptr, "stop=2009\nend=2011 code=2011 global=0\n", {stop}},
+      {{"", 0, "s"}, 0, nullptr, "stop=2009\n" + ret + "15\n" + ended + "15\n", {stop, sig + "Handled|SIGTERM"}},
+      {{"", 0, "sd"}, 0, nullptr, "stop=2009\nend=2011 code=2011 global=0\n", {stop}},
       // Started again, a thread has a fresh recovery state: its resource runs at the first return.
-      {kRestart, {"|5", SIGINT, ""}, 0, nullptr, ret + "2\nsupervised=415\naction 5\n" + ret + "2\n" + ended + "2\n",
-       Logs(2, sig + "SIGINT")},
-      {kCall, {}, 0, nullptr, "action 4\nrc=2010 SIGINT 2\n", {}},
-      {kCallOther, {}, 0, nullptr, "action 4\nrc=2010 SIGINT 2\n", {}},
+      {{"|5", SIGINT, "r"}, 0, nullptr, ret + "2\nsupervised=415\naction 5\n" + ret + "2\n" + ended + "2\n",
+       Logs(2, sig + "Handled|SIGINT")},
+      {{"", 0, "C"}, 0, nullptr, "action 4\nrc=2010 SIGINT 2\n", {}},
+      {{"", 0, "O"}, 0, nullptr, "action 4\nrc=2010 SIGINT 2\n", {}},
       // A fault is never recovered: one trap line, the fault's own end; no message, no clean-up.
-      {kRun, {"9", SIGSEGV, ""}, SIGSEGV, "KLP trap: signal 11 (SIGSEGV) in process ", "", {}},
-      {kRun, {"9", SIGBUS, ""}, SIGBUS, ", thread ", "", {}},
-      {kRun, {"9", SIGILL, ""}, SIGILL, " (Sig)\n", "", {}},
-      {kUnregistered, {"", SIGSEGV, ""}, SIGSEGV, "KLP trap: signal 11 (", "", {}},
+      {{"9", SIGSEGV, ""}, SIGSEGV, "KLP trap: signal 11 (SIGSEGV) in process ", "", {}},
+      {{"9", SIGBUS, ""}, SIGBUS, ", thread ", "", {}},
+      {{"9", SIGILL, ""}, SIGILL, " (Sig)\n", "", {}},
+      {{"", SIGSEGV, "un"}, SIGSEGV, "KLP trap: signal 11 (", "", {}},
       // Any other signal whose default ends the process: the clean-ups first.
-      {kEnding, {"", SIGHUP, ""}, SIGHUP, nullptr, "action 1\n", {"591|recoveryMgr::erWhatSignal|1|Initial|Non-handled|1"}},
-      {kEnding, {"", SIGPIPE, ""}, SIGPIPE, nullptr, "action 13\n", {"591|recoveryMgr::erWhatSignal|1|Initial|Non-handled|13"}},
+      {{"1", SIGHUP, "e"}, SIGHUP, nullptr, "action 1\n", {sig + "Non-handled|1"}},
+      {{"3", SIGPIPE, "e"}, SIGPIPE, nullptr, "action 3\n", {sig + "Non-handled|13"}},
   };
   for (size_t i = 0; i < sizeof rows / sizeof rows[0]; ++i) {
-    auto c = klptest::inChild(tmp.path(), [&] { return drive(rows[i].how, rows[i].plan); });
+    auto c = klptest::inChild(tmp.path(), [&] { return drive(rows[i].plan); });
     EXPECT_TRUE(c.signal == rows[i].endSig && c.exitCode == (rows[i].endSig ? -1 : 0)) << "row " << i;
     EXPECT_EQ(rows[i].out, c.out) << "row " << i;
     EXPECT_EQ(rows[i].logs, records.take()) << "row " << i;
