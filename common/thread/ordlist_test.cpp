@@ -16,12 +16,6 @@
 
 namespace {
 
-struct Item {
-  OrdListElement ole;
-  int value;
-  explicit Item(int v) : value(v) {}
-};
-
 // Checks that the links agree both ways and with the count.
 void expectSound(OrdList& l) {
   int n = 0;
@@ -37,14 +31,13 @@ void expectSound(OrdList& l) {
 // Dn ordListDeChain, Wn withdraw, b browseHead, B browseTail, Pn browsePrev,
 // Nn browseNext, Xn put on another list (refused while on this one).
 std::string play(const char* script, bool locked) {
-  std::vector<Item> items;  // outlive the list, which unlinks them
-  for (int i = 0; i < 10; ++i) items.emplace_back(i);
+  OrdListElement items[10];  // outlive the list, which unlinks them
   OrdList l("Script");
   if (locked) l.makeShared(nullptr, 1);
   std::string out;
   for (const char* p = script; *p != '\0'; ++p) {
     char op = *p;
-    OrdListElement* e = isdigit(p[1]) ? &items[*++p - '0'].ole : nullptr;
+    OrdListElement* e = isdigit(p[1]) ? &items[*++p - '0'] : nullptr;
     OrdListElement* got = nullptr;
     switch (op) {
       case 'T': EXPECT_EQ(0, l.putTail(e)); break;
@@ -59,8 +52,7 @@ std::string play(const char* script, bool locked) {
       case 'P': got = OrdList::browsePrev(e); break;
       case 'N': got = OrdList::browseNext(e); break;
     }
-    if (strchr("htbBPN", op))
-      out += (got ? std::to_string(reinterpret_cast<Item*>(got)->value) : "-") + " ";
+    if (strchr("htbBPN", op)) out += (got ? std::to_string(got - items) : "-") + " ";
     EXPECT_TRUE(!got || !strchr("htD", op) || (!got->oleAnchor && !got->olePrev && !got->oleNext));
     expectSound(l);
   }
@@ -68,10 +60,7 @@ std::string play(const char* script, bool locked) {
 }
 
 TEST(OrdList, PutsTakesBrowsesAndDeChainsKeepOrderAndLinks) {
-  struct {
-    const char* script;
-    const char* gives;
-  } rows[] = {
+  struct { const char* script; const char* gives; } rows[] = {
       {"T1 T2 T3 h h h h t", "1 2 3 - - "},  // first in, first out; empty: null
       {"H1 H2 H3 h t h", "3 1 2 "},          // putHead reverses
       {"T1 T2 T3 X2 t t t", "3 2 1 "},
@@ -86,42 +75,49 @@ TEST(OrdList, PutsTakesBrowsesAndDeChainsKeepOrderAndLinks) {
 
 TEST(OrdList, DelListFreesEveryElementAndADestroyedListLeavesThemFree) {
   OrdList two;
-  for (int i = 0; i < 5; ++i) two.putTail(&(new Item(i))->ole);
+  for (int i = 0; i < 5; ++i) two.putTail(new OrdListElement);
   two.delList();  // the sanitizer build reports a leak if one is left
   EXPECT_TRUE(two.count == 0 && !two.olHead && !two.olTail);
-  Item a(1), b(2);
+  OrdListElement a, b;
   alignas(OrdList) unsigned char raw[sizeof(OrdList)];
   OrdList* l = new (raw) OrdList;
   l->makeShared(nullptr, 1);
-  l->putTail(&a.ole);
-  l->putTail(&b.ole);
+  l->putTail(&a);
+  l->putTail(&b);
   l->~OrdList();
   EXPECT_STREQ("DELList", l->qName);
-  EXPECT_TRUE(!l->self && !a.ole.oleAnchor && !a.ole.olePrev && !b.ole.oleNext);
+  EXPECT_TRUE(!l->self && !a.oleAnchor && !a.olePrev && !b.oleNext);
 }
 
+// The print routines of lists and threads; a damaged element or list.
 TEST(OrdList, PrintsAndADamagedElementOrListIsFatalWithDiagnosticsOnStandardOutput) {
   klptest::TmpDir tmp;
-  struct {
-    int damage;  // 0 none: print; 1 the element's eye-catcher; 2 a locked list's self pointer
-    int signal;
-    std::vector<const char*> shows;
-  } rows[] = {
+  // Damage: 0 none (prints); 1 the element's eye-catcher; 2 a locked list's self pointer.
+  struct { int damage, signal; std::vector<const char*> shows; } rows[] = {
       {0, 0, {"OrdList:print entered for list PrintMe\n list Addr=0000", " qName=PrintMe\n olTail=0000",
               "OrdList:print exit for list PrintMe\nOrdList:print entered for list entry \n list Entry Addr=0000",
-              " olePrev=0000000000000000\n oleNext=0000000000000000\n oleAnchor=0000", " oleName=PrintMe\n"}},
+              " olePrev=0000000000000000\n oleNext=0000000000000000\n oleAnchor=0000", " oleName=PrintMe\n",
+              "klpThread::print  Thread with name BehinderWorker and state 1 and RC 7 and RESTART TRUE and"
+              " handle  0000000000000000\nklpThread::print  Thread with name BehinderWorker and state 1 and"
+              " RC 7 and RESTART FALSE and handle  0000000000000000\n"}},
       {1, SIGABRT, {"KLP fatal error in OrdList::putTail: list element at 0x", " expected \"a readable"}},
       {2, SIGABRT, {"KLP fatal error in OrdList::putTail: OrdList at 0x", " expected \"self pointer\""}},
   };
   for (const auto& row : rows) {
     auto c = klptest::inChild(tmp.path(), [&] {
       OrdList l("PrintMe");
-      Item a(1);
-      if (row.damage == 1) memset(a.ole.eyeCatcher, 0x01, sizeof a.ole.eyeCatcher);
+      OrdListElement a;
+      if (row.damage == 1) memset(a.eyeCatcher, 0x01, sizeof a.eyeCatcher);
       if (row.damage == 2) l.makeShared(nullptr, 1), l.self = nullptr;
-      l.putTail(&a.ole);
+      l.putTail(&a);
       l.print();
-      OrdList::print(&a.ole);
+      OrdList::print(&a);
+      klpThread t;
+      t.setName("BehinderWorkerThread");  // cut to 14
+      t.endCode = 7;
+      klpThread::print(&t);
+      t.restart = 0;
+      klpThread::print(&t);
       return 0;
     });
     EXPECT_EQ(row.signal, c.signal);
@@ -130,23 +126,16 @@ TEST(OrdList, PrintsAndADamagedElementOrListIsFatalWithDiagnosticsOnStandardOutp
 }
 
 // The lock, with real threads.
-TEST(MtOrdList, TheOwnerReentersAndOnlyItsLastReleaseLetsOthersInAndNoOneElsesDoes) {
+TEST(MtOrdList, TheOwnerReentersAndOnlyItsLastReleaseLetsOthersIn) {
   klptest::mainThreadReady();
   OrdList l("Reentry");
   l.makeShared(nullptr, 1);
   for (int i = 0; i < 3; ++i) ASSERT_EQ(0, l.lockList());
-  Item a(1);
-  EXPECT_EQ(0, l.putTail(&a.ole));  // nested operation by the owner
-  EXPECT_TRUE(l.depth() == 3 && l.owner() == klpMainThread());
-  int refused = -1;
-  std::thread([&] { refused = l.unlockList(); }).join();
-  EXPECT_EQ(KLP_RC_NOT_LOCK_OWNER, refused);
+  OrdListElement a;
+  EXPECT_EQ(0, l.putTail(&a));  // nested operation by the owner
   EXPECT_TRUE(l.depth() == 3 && l.owner() == klpMainThread());
   std::atomic<bool> entered{false};
-  std::thread other([&] {
-    ordListDeChain(&a.ole);
-    entered = true;
-  });
+  std::thread other([&] { entered = ordListDeChain(&a) == 0; });
   for (int i = 0; i < 3; ++i) {
     hsvSleep(30);  // not needed for the verdict: gives the other a chance to come in early
     EXPECT_FALSE(entered) << "entered before the owner's last release";

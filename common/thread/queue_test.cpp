@@ -25,11 +25,9 @@ int32_t waitersOf(Queue& q) {
 }
 
 TEST(Queue, TakesFollowTheEndsAndThePrioritiesWithoutWaiting) {
-  struct {
-    const char* puts;  // elements 1, 2, 3: T putTail, H putHead, or a priority digit
-    const char* ends;  // taken from the head (h) or the tail (t); 0: none
-    const char* order;
-  } rows[] = {
+  // Elements 1, 2, 3 put (T putTail, H putHead, or a priority digit), taken from the head (h)
+  // or the tail (t) in this order (0: none).
+  struct { const char* puts, *ends, *order; } rows[] = {
       {"TTH", "thtt", "2310"},  // 3 1 2 from the head
       {"HHH", "hhh", "321"},
       {"535", "hhh", "231"},  // ascending from the head, the last of equal ones first
@@ -55,10 +53,7 @@ TEST(Queue, TakesFollowTheEndsAndThePrioritiesWithoutWaiting) {
 
 TEST(Queue, AWaitTakesAtOnceWhenItNeedNotWaitAndTimesOutOnAnEmptyQueue) {
   Queue q;
-  for (int32_t wait : {0, -5}) {
-    EXPECT_EQ(nullptr, q.getHeadWithWait(&wait));
-    EXPECT_EQ(0, wait);
-  }
+  for (int32_t wait : {0, -5}) EXPECT_TRUE(q.getHeadWithWait(&wait) == nullptr && wait == 0);
   Rec a{{}, 1};
   q.putTailAndNotify(&a.qe.ole);
   int32_t wait = 5000;
@@ -99,11 +94,8 @@ TEST(Queue, StatisticsPrintWholeNumberAveragesAndAFailingWaitPostIsNamed) {
 }
 
 TEST(MtQueue, WaitingConsumersAreWokenOncePerPutAndNoWakeUpIsLost) {
-  // Consumers waiting, and whether another takes the first element before
-  // the woken consumer comes (which must then wait on).
-  for (auto row : std::initializer_list<std::pair<int, bool>>{{1, false}, {2, false}, {1, true}}) {
-    const int consumers = row.first;
-    const bool stolen = row.second;
+  // Consumers waiting; whether another takes the first element before the woken one comes.
+  for (auto [consumers, stolen] : std::initializer_list<std::pair<int, bool>>{{1, false}, {2, false}, {1, true}}) {
     Queue q;
     std::vector<int> got(consumers);
     std::vector<std::thread> ts;
