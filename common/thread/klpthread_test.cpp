@@ -157,7 +157,9 @@ TEST_F(MtThread, StopAllToleratesOnlyAnUnstoppableHoldLThreadAndRestsAfterAFailu
     int32_t before = name[4] == 'L' ? KLP_THREAD_RUN : KLP_THREAD_DBWAIT;
     m->setState(before);
     std::atomic<bool> rested{false}, stopped{false};
-    std::thread watcher([&] { for (; !stopped; hsvSleep(1)) rested = rested || m->getState() == KLP_THREAD_REST; });
+    std::thread watcher([&] {
+      for (; !stopped; hsvSleep(1)) rested = rested || m->getState() == KLP_THREAD_REST;
+    });
     EXPECT_EQ(name[4] == 'L' ? 0 : KLP_RC_RECOVERED, stopAll(&list)) << name;
     stopped = true;
     watcher.join();
@@ -197,8 +199,8 @@ TEST_F(MtThread, SupervisionJudgesTheSetRestartsAndRemoves) {
     highest = 3;
     for (const char* n : row.threads) make(n, n[1] != '-', n[1] == '!');
     for (auto [rc, left] : row.passes) {
-      for (OrdListElement* e = list.browseHead(); e; e = OrdList::browsePrev(e))
-        ASSERT_TRUE(waitState(klpThreadOf(e), klpThreadOf(e)->name[0] == 'W' ? KLP_THREAD_RUN : KLP_THREAD_STOP));
+      for (OrdListElement* e = list.browseHead(); e; e = OrdList::browsePrev(e))  // W runs, others end
+        ASSERT_TRUE(waitState(klpThreadOf(e), klpThreadOf(e)->name[0] == 'W' ? KLP_THREAD_RUN : 6));
       EXPECT_TRUE(supervise(&list, row.stopping, &highest) == rc && list.count == left) << rc;
     }
     EXPECT_EQ(row.highest, highest);

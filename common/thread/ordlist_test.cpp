@@ -44,7 +44,7 @@ std::string play(const char* script, bool locked) {
       case 'H': EXPECT_EQ(0, l.putHead(e)); break;
       case 'D': EXPECT_EQ(0, ordListDeChain(got = e)); break;
       case 'W': e->withdrawn = 1; break;
-      case 'X': EXPECT_TRUE(OrdList().putTail(e) == KLP_RC_BAD_PARM && OrdList().putHead(e) == KLP_RC_BAD_PARM); break;
+      case 'X': EXPECT_TRUE(OrdList().putTail(e) == 2002 && OrdList().putHead(e) == 2002); break;
       case 'h': got = l.getHead(); break;
       case 't': got = l.getTail(); break;
       case 'b': got = l.browseHead(); break;
@@ -95,11 +95,11 @@ TEST(OrdList, PrintsAndADamagedElementOrListIsFatalWithDiagnosticsOnStandardOutp
   // Damage: 0 none (prints); 1 the element's eye-catcher; 2 a locked list's self pointer.
   struct { int damage, signal; std::vector<const char*> shows; } rows[] = {
       {0, 0, {"OrdList:print entered for list PrintMe\n list Addr=0000", " qName=PrintMe\n olTail=0000",
-              "OrdList:print exit for list PrintMe\nOrdList:print entered for list entry \n list Entry Addr=0000",
-              " olePrev=0000000000000000\n oleNext=0000000000000000\n oleAnchor=0000", " oleName=PrintMe\n",
-              "klpThread::print  Thread with name BehinderWorker and state 1 and RC 7 and RESTART TRUE and"
-              " handle  0000000000000000\nklpThread::print  Thread with name BehinderWorker and state 1 and"
-              " RC 7 and RESTART FALSE and handle  0000000000000000\n"}},
+              "OrdList:print exit for list PrintMe\nOrdList:print entered for list entry \n",
+              " list Entry Addr=0000", " olePrev=0000000000000000\n oleNext=0000000000000000\n oleAnchor=",
+              " oleName=PrintMe\nklpThread::print  Thread with name BehinderWorker and state 1 and RC 7 and"
+              " RESTART TRUE and handle  0000000000000000\nklpThread::print  Thread with name BehinderWorker"
+              " and state 1 and RC 7 and RESTART FALSE and handle  0000000000000000\n"}},
       {1, SIGABRT, {"KLP fatal error in OrdList::putTail: list element at 0x", " expected \"a readable"}},
       {2, SIGABRT, {"KLP fatal error in OrdList::putTail: OrdList at 0x", " expected \"self pointer\""}},
   };

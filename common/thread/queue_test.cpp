@@ -42,8 +42,10 @@ TEST(Queue, TakesFollowTheEndsAndThePrioritiesWithoutWaiting) {
       : row.puts[i] == 'H' ? q.putHeadAndNotify(&r[i].qe.ole)
                            : q.putHeadWithPriorityAndNotify(&r[i].qe);
     std::string got;
-    for (int32_t wait = 0; row.ends[got.size()]; wait = 0)
-      got += std::to_string(idOf(row.ends[got.size()] == 'h' ? q.getHeadWithWait(&wait) : q.getTailWithWait(&wait)));
+    for (int32_t wait = 0; row.ends[got.size()]; wait = 0) {
+      bool head = row.ends[got.size()] == 'h';
+      got += std::to_string(idOf(head ? q.getHeadWithWait(&wait) : q.getTailWithWait(&wait)));
+    }
     EXPECT_EQ(row.order, got) << row.puts;
     EXPECT_TRUE(q.count == 0 && !q.head && !q.tail && !r[0].qe.ole.olePrev && !r[0].qe.ole.oleNext);
     // Nobody waited: every put was an idle post, no post was made.
@@ -95,7 +97,8 @@ TEST(Queue, StatisticsPrintWholeNumberAveragesAndAFailingWaitPostIsNamed) {
 
 TEST(MtQueue, WaitingConsumersAreWokenOncePerPutAndNoWakeUpIsLost) {
   // Consumers waiting; whether another takes the first element before the woken one comes.
-  for (auto [consumers, stolen] : std::initializer_list<std::pair<int, bool>>{{1, false}, {2, false}, {1, true}}) {
+  using Row = std::pair<int, bool>;
+  for (auto [consumers, stolen] : {Row{1, false}, Row{2, false}, Row{1, true}}) {
     Queue q;
     std::vector<int> got(consumers);
     std::vector<std::thread> ts;

@@ -27,7 +27,9 @@ using Logs = std::vector<std::string>;
 
 void action(uint64_t arg) { printf("action %d\n", static_cast<int>(arg)), fflush(stdout); }
 
-bool endsWithMarker(const std::string& s) { return s.rfind(std::string("***E**O**D**M***\0", 17)) == s.size() - 17; }
+bool endsWithMarker(const std::string& s) {
+  return s.rfind(std::string("***E**O**D**M***\0", 17)) == s.size() - 17;
+}
 HSVHIPCQueue* g_queue = nullptr;  // of the queue actions: outlives every frame
 
 // Every routine of the folder that reports, with the records it logs
@@ -240,7 +242,8 @@ TEST(SigRecovery, SignalsComeBackToTheThreadsRecoveryPointWithItsCleanUpsOrEndTh
   klptest::mainThreadReady();
   klptest::TmpDir tmp;
   klptest::LogRecords records(tmp.path());
-  const std::string sig = "591|recoveryMgr::erWhatSignal|1|Sig|", stop = "590|klpThread::stop|1|Initial|0|Sig";
+  const std::string sig = "591|recoveryMgr::erWhatSignal|1|Sig|";
+  const std::string stop = "590|klpThread::stop|1|Initial|0|Sig";
   const std::string ret = "return 1 rc=2009 signal=", ended = "end=2009 code=2009 global=";
   // The signal that ends the process (0: none), the trap line's part (null: none), output, records.
   struct { Plan plan; int endSig; const char* trap; std::string out; Logs logs; } rows[] = {
@@ -252,12 +255,14 @@ TEST(SigRecovery, SignalsComeBackToTheThreadsRecoveryPointWithItsCleanUpsOrEndTh
       {{"", erStopSignal(), "l"}, 0, nullptr, ret + "15\n" + ended + "15\n", {sig + "Handled|SIGTERM"}},
       {{"7", SIGINT, "n"}, 0, nullptr, "action 7\n" + ended + "2\n",
        {"589|signalHandler|1|signalHandler|2009|setRecoveryPoint",
-        "8999|signalHandler|r8|the thread has no recovery point", "591|signalHandler|1|Sig|Non-handled|SIGINT"}},
+        "8999|signalHandler|r8|the thread has no recovery point",
+        "591|signalHandler|1|Sig|Non-handled|SIGINT"}},
       {{"", SIGINT, "unl"}, 0, nullptr, "end=2009 code=0 global=2\n",
        {"589|findRcvyMgr|1|findRcvyMgr|602|findThread", "589|signalHandler|1|signalHandler|602|findRcvyMgr",
         "591|signalHandler|1|Unknown|Non-handled|2"}},
       // A stop signals a waiting thread; never the process, also when the thread gave its point up.
-      {{"", 0, "s"}, 0, nullptr, "stop=2009\n" + ret + "15\n" + ended + "15\n", {stop, sig + "Handled|SIGTERM"}},
+      {{"", 0, "s"}, 0, nullptr, "stop=2009\n" + ret + "15\n" + ended + "15\n",
+       {stop, sig + "Handled|SIGTERM"}},
       {{"", 0, "sd"}, 0, nullptr, "stop=2009\nend=2011 code=2011 global=0\n", {stop}},
       // Started again, a thread has a fresh recovery state: its resource runs at the first return.
       {{"|5", SIGINT, "r"}, 0, nullptr, ret + "2\nsupervised=415\naction 5\n" + ret + "2\n" + ended + "2\n",
