@@ -258,7 +258,7 @@ ProcessLogger::~ProcessLogger() {
 }
 
 // ---------------------------------------------------------------------------
-// Threads, lists and recovery
+// Logged records; waiting for a condition; the process's first prologue
 // ---------------------------------------------------------------------------
 namespace {
 

@@ -108,7 +108,7 @@ class ProcessLogger {
 };
 
 // ---------------------------------------------------------------------------
-// Threads, lists and recovery
+// Logged records; waiting for a condition; the process's first prologue
 // ---------------------------------------------------------------------------
 // The process logger while the object lives, writing nowhere but a record
 // file in dir (so that forked children's records count): per message
