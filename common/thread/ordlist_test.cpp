@@ -55,6 +55,7 @@ std::string play(const char* script, bool locked) {
     if (strchr("htbBPN", op)) out += (got ? std::to_string(got - items) : "-") + " ";
     EXPECT_TRUE(!got || !strchr("htD", op) || (!got->oleAnchor && !got->olePrev && !got->oleNext));
     expectSound(l);
+    EXPECT_EQ(0, l.depth()) << script;  // every operation gives the lock back
   }
   return out;
 }
@@ -92,7 +93,7 @@ TEST(OrdList, DelListFreesEveryElementAndADestroyedListLeavesThemFree) {
 // The print routines of lists and threads; a damaged element or list.
 TEST(OrdList, PrintsAndADamagedElementOrListIsFatalWithDiagnosticsOnStandardOutput) {
   klptest::TmpDir tmp;
-  // Damage: 0 none (prints); 1 the element's eye-catcher; 2 a locked list's self pointer.
+  // Damage: 0 none (prints); 1, 3 the eye-catcher (put at the tail, the head); 2 the self pointer.
   struct { int damage, signal; std::vector<const char*> shows; } rows[] = {
       {0, 0, {"OrdList:print entered for list PrintMe\n list Addr=0000", " qName=PrintMe\n olTail=0000",
               "OrdList:print exit for list PrintMe\nOrdList:print entered for list entry \n",
@@ -102,14 +103,15 @@ TEST(OrdList, PrintsAndADamagedElementOrListIsFatalWithDiagnosticsOnStandardOutp
               " and state 1 and RC 7 and RESTART FALSE and handle  0000000000000000\n"}},
       {1, SIGABRT, {"KLP fatal error in OrdList::putTail: list element at 0x", " expected \"a readable"}},
       {2, SIGABRT, {"KLP fatal error in OrdList::putTail: OrdList at 0x", " expected \"self pointer\""}},
+      {3, SIGABRT, {"KLP fatal error in OrdList::putHead: list element at 0x"}},
   };
   for (const auto& row : rows) {
     auto c = klptest::inChild(tmp.path(), [&] {
       OrdList l("PrintMe");
       OrdListElement a;
-      if (row.damage == 1) memset(a.eyeCatcher, 0x01, sizeof a.eyeCatcher);
+      if (row.damage % 2) memset(a.eyeCatcher, 0x01, sizeof a.eyeCatcher);
       if (row.damage == 2) l.makeShared(nullptr, 1), l.self = nullptr;
-      l.putTail(&a);
+      row.damage == 3 ? l.putHead(&a) : l.putTail(&a);
       l.print();
       OrdList::print(&a);
       klpThread t;
