@@ -11,10 +11,7 @@
 
 namespace {
 
-struct Rec {
-  QueueElement qe;
-  int id;
-};
+struct Rec { QueueElement qe; int id; };
 int idOf(OrdListElement* e) { return e ? reinterpret_cast<Rec*>(e)->id : 0; }
 
 int32_t waitersOf(Queue& q) {
