@@ -129,7 +129,8 @@ TEST_F(MtThread, StopRemovesAnEndedThreadEndsAWorkingOneAndWithdrawsOneItMustCut
     EXPECT_EQ(row.rc == KLP_RC_RECOVERED, list.count) << row.name;
     EXPECT_EQ(std::vector<std::string>{row.log}, records.take());
   }
-  EXPECT_EQ(2, klpSharedCmdList()->count);  // a stop empties a thread's own list only
+  OrdList* s = klpSharedCmdList();  // locked, owner checked; a stop empties a thread's own list only
+  EXPECT_TRUE(s->count == 2 && s->locked && s->ownerCheck() && !strcmp(s->qName, "KlpList"));
   for (OrdListElement& e : pending) EXPECT_EQ(&e, klpSharedCmdList()->getHead());
   klpThread* t = klpThreadOf(list.olHead);
   EXPECT_TRUE(t->ole.withdrawn && !list.browseHead() && !threadStateByName(&list, "Rester"));

@@ -127,7 +127,6 @@ TEST(OrdList, PrintsAndADamagedElementOrListIsFatalWithDiagnosticsOnStandardOutp
   }
 }
 
-// The lock, with real threads.
 TEST(MtOrdList, TheOwnerReentersAndOnlyItsLastReleaseLetsOthersIn) {
   klptest::mainThreadReady();
   OrdList l("Reentry");
