@@ -45,8 +45,7 @@ TEST(Queue, TakesFollowTheEndsAndThePrioritiesWithoutWaiting) {
     }
     EXPECT_EQ(row.order, got) << row.puts;
     EXPECT_TRUE(q.count == 0 && !q.head && !q.tail && !r[0].qe.ole.olePrev && !r[0].qe.ole.oleNext);
-    // Nobody waited: every put was an idle post, no post was made.
-    EXPECT_TRUE(q.idlePosts == 3 && q.waitpost.wait(0) == ECF_TIMEOUT);
+    EXPECT_TRUE(q.idlePosts == 3 && q.waitpost.wait(0) == ECF_TIMEOUT);  // nobody waited: no post
   }
 }
 
