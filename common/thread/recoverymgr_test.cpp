@@ -230,9 +230,10 @@ int drive(const Plan& plan) {
     pthread_mutex_unlock(&g_order);
     g_release = true;
   }
-  if (has('r') && is(KLP_THREAD_STOP)) printf("supervised=%d\n", supervise(&list, 0, &highest));
+  int supervised = has('r') && is(KLP_THREAD_STOP) ? supervise(&list, 0, &highest) : 0;
   void* ret = nullptr;
   pthread_join(t->handle, &ret);
+  if (has('r')) printf("supervised=%d\n", supervised);  // printed once the new run is over
   printf("end=%ld code=%d global=%d\n", static_cast<long>(reinterpret_cast<intptr_t>(ret)),
          t->getEndCode(), erGetGlobalSignal());
   klpThreadIdList()->lockList();  // free again for the others
@@ -267,7 +268,7 @@ TEST(SigRecovery, SignalsComeBackToTheThreadsRecoveryPointWithItsCleanUpsOrEndTh
        {stop, sig + "Handled|SIGTERM"}},
       {{"", 0, "sd"}, 0, nullptr, "stop=2009\nend=2011 code=2011 global=0\n", {stop}},
       // Started again, a thread has a fresh recovery state: its resource runs at the first return.
-      {{"|5", SIGINT, "r"}, 0, nullptr, ret + "2\nsupervised=415\naction 5\n" + ret + "2\n" + ended + "2\n",
+      {{"|5", SIGINT, "r"}, 0, nullptr, ret + "2\naction 5\n" + ret + "2\nsupervised=415\n" + ended + "2\n",
        Logs(2, sig + "Handled|SIGINT")},
       {{"", 0, "C"}, 0, nullptr, "action 4\nrc=2010\naction 4\nrc=2010\nSIGINT fits 2\n", {}},
       {{"", 0, "O"}, 0, nullptr, "action 4\nrc=2010\nSIGINT fits 2\n", {}},
