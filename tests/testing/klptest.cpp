@@ -20,6 +20,7 @@
 
 #include "common/msg/msglogger.h"
 #include "common/platform/hsv.h"
+#include "common/thread/klpthread.h"
 
 extern char** environ;
 
@@ -256,5 +257,69 @@ ProcessLogger::~ProcessLogger() {
 msgLogger* ProcessLogger::operator->() const { return logger_; }
 msgLogger* ProcessLogger::get() const { return logger_; }
 std::vector<std::string> ProcessLogger::take() { return logger_->take(); }
+
+// ---------------------------------------------------------------------------
+// Logged records; waiting for a condition; the process's first prologue
+// ---------------------------------------------------------------------------
+namespace {
+
+class FileRecordingLogger : public msgLoggerU {
+ public:
+  explicit FileRecordingLogger(const std::string& file) : msgLoggerU(10, 0), file_(file) {
+    loadBuiltinMsgs(builtinMsgTable);
+  }
+  void writeConsole(logMsg*) override {}
+  void writeStderr(logMsg*) override {}
+  void setRouting(logMsg* r) override {  // every record, with the routing asked for
+    char qt[MSG_QUALIFIER_MAX + MSG_THREAD_NAME_MAX + 8];
+    qualifierAndThread(r->threadName, qt, sizeof qt);
+    auto is = [r](int i, const char* v) { return i < r->valueCount && strcmp(r->values[i], v) == 0; };
+    int first = is(0, getApplicationName()) && is(1, qt) ? 2 : is(0, qt) ? 1 : 0, end = r->valueCount;
+    while (end > first && (is(end - 1, " ") || is(end - 1, "*"))) --end;
+    int k = r->routing == 12 ? 0 : r->routing == 1 ? 1 : r->routing == 35 ? 2 : -1;
+    std::string line = std::string(r->threadName) + ">" + std::to_string(r->msgNumber) + "|" +
+                       r->origin + "|" + (k < 0 ? "r" + std::to_string(r->routing) : std::to_string(k));
+    for (int i = first; i < end; ++i) line += std::string("|") + r->values[i];
+    std::ofstream(file_, std::ios::app) << line << "\n";
+    msgLoggerU::setRouting(r);
+  }
+
+ private:
+  std::string file_;
+};
+
+}  // namespace
+
+LogRecords::LogRecords(const std::string& dir)
+    : file_(dir + "records"), logger_(new FileRecordingLogger(file_)), saved_(klpGetProcessLogger()) {
+  klpSetProcessLogger(logger_);
+}
+
+LogRecords::~LogRecords() {
+  klpSetProcessLogger(saved_);
+  delete logger_;
+}
+
+std::vector<std::string> LogRecords::take(bool withThread) {
+  std::vector<std::string> out = lines(readFile(file_));
+  std::ofstream(file_, std::ios::trunc).flush();
+  for (std::string& line : out)
+    if (!withThread) line.erase(0, line.find('>') + 1);
+  return out;
+}
+
+bool waitFor(const std::function<bool()>& cond, int ms) {
+  for (int waited = 0; waited < ms && !cond(); waited += 5) hsvSleep(5);
+  return cond();
+}
+
+void mainThreadReady() {
+  if (klpMainThread()->tid.oleAnchor != nullptr) return;
+  const int sigs[] = {SIGINT, SIGFPE, SIGABRT, SIGSEGV, SIGBUS, SIGILL, SIGTERM, erStopSignal()};
+  struct sigaction old[8];
+  for (int i = 0; i < 8; ++i) sigaction(sigs[i], nullptr, &old[i]);
+  klpThread::prologue(klpMainThread());
+  for (int i = 0; i < 8; ++i) sigaction(sigs[i], &old[i], nullptr);
+}
 
 }  // namespace klptest

@@ -106,4 +106,32 @@ class ProcessLogger {
   msgLogger* saved_;
 };
 
+// ---------------------------------------------------------------------------
+// Logged records; waiting for a condition; the process's first prologue
+// ---------------------------------------------------------------------------
+// The process logger while the object lives, writing nowhere but a record
+// file in dir (so that forked children's records count): per message
+// "number|origin|kind|values..." with the destination kind 0, 1 or 2 (or
+// "r" and the routing word given directly) and the caller's values in order,
+// trailing pads (" ", "*") left out.
+class LogRecords {
+ public:
+  explicit LogRecords(const std::string& dir);
+  ~LogRecords();
+  // The records so far, then forgotten; withThread puts "thread name>" first.
+  std::vector<std::string> take(bool withThread = false);
+
+ private:
+  std::string file_;
+  msgLogger* logger_;
+  msgLogger* saved_;
+};
+
+// Polls cond every 5 ms for at most ms milliseconds.
+bool waitFor(const std::function<bool()>& cond, int ms = 5000);
+
+// The process's first prologue, once, on the calling (main) thread, with the
+// signal handlers it installs given back: a test's fault is not recovered.
+void mainThreadReady();
+
 }  // namespace klptest
