@@ -111,6 +111,8 @@ TEST(CmdApiStatusData, Format1FromThreadRecords) {
   put32(negative, 8, -1);
   EXPECT_EQ(conv(claims3, claims3.size(), 88), KLP_API_BAD_REPLY);
   EXPECT_EQ(conv(claims3, 11, 88), KLP_API_BAD_REPLY);
+  EXPECT_EQ(conv(p, p.size(), 4), 1001);  // not even the header fits
+  EXPECT_EQ(out, std::vector<char>(88, 0x55));
   EXPECT_EQ(conv(negative, negative.size(), 88), KLP_API_BAD_REPLY);
   EXPECT_EQ(conv(statusPayload({{"A", 1}, {"B", 2}}), 12 + 40, 88), 0);  // no spare slot
   klpMsgCapture cap{};
@@ -150,7 +152,7 @@ TEST(CmdApiStatusData, Format3FromItsOffsetsOrNothing) {
     const char *logFile = "", *sectionText = "";
   } cases[] = {
       {{}, 400, 0, "/var/log/kcp", "hello"},
-      {{{16, 0}, {68, 0}}, 400, 0, "", ""},  // no log file, no section
+      {{{16, 0}, {68, 0}, {60, 60000}}, 400, 0, "", ""},  // no log file, no section
       {{{16, 500}, {500, 1500}, {68, 0}}, 2002, 0, nullptr, ""},  // a long name is cut to its field
       {{{16, 399}}, 400, 2017},   // log file length word past the end
       {{{100, 60000}}, 400, 2017},  // log file text past the end
@@ -425,23 +427,36 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
   EXPECT_EQ(KLPMonFunc(std::string(220, 'S').c_str(), "KLP.MON", nullptr), 2009);
   EXPECT_RECORDS(log_, "589 KLPMonFunc 1 KLPMonFunc|2009|server name\n8999 KLPMonFunc 1 the server "
                        "name and its suffix do not fit a server name*");
-  // A server queue not private to us is refused at the first attempt: it
-  // will not become ours by waiting (retrying would take four pauses).
-  std::string path = tmp_.path() + "S2.KLP.CAP.IPC";
-  ASSERT_EQ(hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
-  mq_attr attr{};
-  attr.mq_maxmsg = HSV_QUEUE_DEPTH;
-  attr.mq_msgsize = HSV_MAX_MSG_SIZE;
-  mqd_t raw = mq_open(id.posixName(), O_RDWR | O_CREAT | O_EXCL, 0600, &attr);
-  ASSERT_NE(raw, static_cast<mqd_t>(-1));
-  ASSERT_EQ(fchmod(raw, 0666), 0);
-  auto start = std::chrono::steady_clock::now();
-  EXPECT_EQ(cmdAPIFunc("S2.KLP.CAP", 14, nullptr, nullptr, nullptr), 815);
-  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(4));
-  EXPECT_RECORDS(log_, "506 cmdAPIFunc 1 Capture\n597 cmdAPIFunc 1 " + q + "|" + path +
-                           "|object belongs to another user or is open to group or others");
-  mq_close(raw);
-  mq_unlink(id.posixName());
+  // Server queues made by hand: one open to others is refused at the first
+  // attempt (it will not become ours by waiting; retrying would take four
+  // pauses); one that takes no request of ours refuses the put.
+  const struct {
+    const char* server;
+    mode_t mode;
+    long msgSize;
+    int rc;
+    std::string records;
+  } queues[] = {
+      {"S2.KLP.CAP", 0666, HSV_MAX_MSG_SIZE, 815, "506 cmdAPIFunc 1 Capture\n597 cmdAPIFunc 1 " + q +
+                                                      "|*S2.KLP.CAP.IPC|object belongs to another user or is "
+                                                      "open to group or others"},
+      {"S3.KLP.MON", 0600, 16, 805, held + "\n508 cmdAPIFunc 1 \\*\n601 cmdAPIFunc 1 " + q + "|*S3.KLP.MON.IPC|*"},
+  };
+  for (const auto& c : queues) {
+    ASSERT_EQ(hsvIPCGetQueResID((tmp_.path() + c.server + ".IPC").c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+    mq_attr attr{};
+    attr.mq_maxmsg = HSV_QUEUE_DEPTH;
+    attr.mq_msgsize = c.msgSize;
+    mqd_t raw = mq_open(id.posixName(), O_RDWR | O_CREAT | O_EXCL, 0600, &attr);
+    ASSERT_NE(raw, static_cast<mqd_t>(-1));
+    ASSERT_EQ(fchmod(raw, c.mode), 0);
+    auto start = std::chrono::steady_clock::now();
+    EXPECT_EQ(cmdAPIFunc(c.server, 14, nullptr, nullptr, nullptr), c.rc);
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(4));
+    EXPECT_RECORDS(log_, c.records);
+    mq_close(raw);
+    mq_unlink(id.posixName());
+  }
 }
 
 // Replies whose pieces disagree, cannot carry their total or have the wrong
@@ -496,8 +511,8 @@ TEST_F(CmdApiExchange, TwoThreadsCallingAtOnceTakeTurns) {
   FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
   bool first = true;
   srv.start(2, [&](const IpcMsgView& req) {
-    // The first answer waits (2 s at most) for the second request.
-    for (int i = 0; first && i < 200 && !srv.hasRequest(); ++i) usleep(10000);
+    // The first answer waits (0.5 s at most) for a second request.
+    for (int i = 0; first && i < 50 && !srv.hasRequest(); ++i) usleep(10000);
     first = false;
     return FakeServer::reply(req, req.header.func == 60 ? kcapPayload() : std::vector<char>{});
   });

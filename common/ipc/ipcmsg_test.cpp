@@ -16,56 +16,52 @@
 namespace {
 
 using Words = std::vector<int32_t>;
+using Bytes = std::vector<char>;
 int32_t wordAt(const void* base, size_t offset) {
   int32_t v;
   memcpy(&v, static_cast<const char*>(base) + offset, 4);
   return v;
 }
-void setWord(std::vector<char>& raw, size_t offset, int32_t v) { memcpy(raw.data() + offset, &v, 4); }
+void setWord(Bytes& raw, size_t offset, int32_t v) { memcpy(raw.data() + offset, &v, 4); }
 // The nine header words after the eye-catcher.
 Words headerWords(const void* msg) {
   Words w;
   for (size_t off = 8; off < IPC_HEADER_SIZE; off += 4) w.push_back(wordAt(msg, off));
   return w;
 }
-
 // Raw bytes of a message: the nine header words (version first), payload.
-std::vector<char> rawMsg(const Words& words, const std::string& payload) {
-  std::vector<char> b(IPC_HEADER_SIZE + payload.size(), 0);
+Bytes rawMsg(const Words& words, const std::string& payload) {
+  Bytes b(IPC_HEADER_SIZE, 0);
   memcpy(b.data(), "IPC:", 4);
   memcpy(b.data() + 8, words.data(), 36);
-  memcpy(b.data() + IPC_HEADER_SIZE, payload.data(), payload.size());
+  b.insert(b.end(), payload.begin(), payload.end());
   return b;
 }
 // A request of code `func` from process `pid` with the payload.
-std::vector<char> request(int32_t func, int32_t pid, const std::string& payload) {
+Bytes request(int32_t func, int32_t pid, const std::string& payload) {
   return rawMsg({1, static_cast<int32_t>(44 + payload.size()), func, 0, pid, 0, 0, 0, 0}, payload);
 }
-
 std::string pattern(size_t n) {
   std::string s(n, '\0');
   for (size_t i = 0; i < n; ++i) s[i] = static_cast<char>('a' + (i * 7 + i / 4052) % 26);
   return s;
 }
-
 // A reply of code 61 from process 4242 with the payload, cut into pieces.
-std::vector<std::vector<char>> split(const std::string& payload) {
+std::vector<Bytes> split(const std::string& payload) {
   IpcMsg* reply = nullptr;
   EXPECT_EQ(0, createReplyMsg(&reply, IPC_HEADER_SIZE + payload.size(), 61, 4242));
   memcpy(reply->payload(), payload.data(), payload.size());
-  std::vector<std::vector<char>> pieces;
+  std::vector<Bytes> pieces;
   for (int32_t k = 1; k <= ipcPieceCount(payload.size()); ++k) {
-    std::vector<char> piece(IPC_MAX_MSG_SIZE);
+    Bytes piece(IPC_MAX_MSG_SIZE);
     size_t len = 0;
     EXPECT_EQ(0, ipcBuildPiece(reply, k, piece.data(), piece.size(), &len));
-    piece.resize(len);
-    pieces.push_back(piece);
+    pieces.emplace_back(piece.begin(), piece.begin() + len);
   }
   freeIpcMsg(reply);
   return pieces;
 }
-
-int addRaw(IpcGather& g, const std::vector<char>& raw, int32_t* left) {
+int addRaw(IpcGather& g, const Bytes& raw, int32_t* left) {
   IpcMsgView v;
   int rc = ipcDecodeMsg(raw.data(), raw.size(), &v);
   return rc != 0 ? rc : g.add(v, left);
@@ -78,10 +74,9 @@ TEST(IpcMsg, HeaderBytesOfRequestsAndReplies) {
   ASSERT_EQ(0, createRequestMsg(&m, IPC_FUNC_CHGPARMS, 12, "ab"));
   m->reserved = 99;
   stampIpcMsg(m);
-  EXPECT_EQ(0, memcmp(m, "IPC:\0\0\0\0", 8));
   // Header, two characters and the NUL; requests carry no piece count.
+  EXPECT_EQ(std::string("IPC:\0\0\0\0", 8) + "ab", std::string(reinterpret_cast<char*>(m), 8) + m->payload());
   EXPECT_EQ((Words{1, 47, 20, 12, hsvProcessID(), 0, 0, 0, 0}), headerWords(m));
-  EXPECT_EQ(0, memcmp(m->payload(), "ab", 3));
   freeIpcMsg(m);
   ASSERT_EQ(0, createRequestMsg(&m, IPC_FUNC_STOP, 0, nullptr));
   EXPECT_EQ(44, m->msgLength);
@@ -91,28 +86,24 @@ TEST(IpcMsg, HeaderBytesOfRequestsAndReplies) {
   ASSERT_EQ(0, createRequestMsg(&m, 23, 0, std::string(4051, 'q').c_str()));
   EXPECT_EQ(4096, m->msgLength);
   freeIpcMsg(m);
-
   ASSERT_EQ(0, createReplyMsg(&m, 60, IPC_FUNC_STATUS_SIZE, 321));
-  EXPECT_EQ(0, memcmp(m, "IPC:\0\0\0\0", 8));
+  EXPECT_EQ(std::string("IPC:\0\0\0\0", 8) + std::string(16, '\0'),
+            std::string(reinterpret_cast<char*>(m), 8) + std::string(m->payload(), 16));
   EXPECT_EQ((Words{1, 60, 59, 0, 321, 0, 1, 0, 0}), headerWords(m));
-  EXPECT_EQ(std::string(16, '\0'), std::string(m->payload(), 16));
   freeIpcMsg(m);
   EXPECT_EQ(KLP_RC_BAD_PARM, createReplyMsg(&m, 43, 14, 1));
   EXPECT_EQ(nullptr, m);
   std::string words;  // by code, in the order of the code table
   for (int32_t f = 9; f <= 26; ++f) words += std::string(ipcFuncWord(f)) + ",";
-  EXPECT_EQ(",TRCSTART,,,,STOP,STATUS,,QRYPARMS,RESUME,SUSPEND,CHGPARMS,REINIT,PRUNE,REINITQ,"
-            "STARTQ,STOPQ,,", words);
-
+  EXPECT_EQ(",TRCSTART,,,,STOP,STATUS,,QRYPARMS,RESUME,SUSPEND,CHGPARMS,REINIT,PRUNE,REINITQ,STARTQ,STOPQ,,", words);
 }
 
 TEST(IpcMsg, DecodingRefusesWhatCannotBeTrusted) {
   IpcMsgView v;
   auto good = request(20, 4711, std::string("ab\0", 3));
   ASSERT_EQ(0, ipcDecodeMsg(good.data(), good.size(), &v));
-  EXPECT_EQ(3u, v.payloadLen);
   EXPECT_EQ(good.data() + 44, v.payload);
-  EXPECT_EQ(4711, v.header.senderPid);
+  EXPECT_EQ((Words{3, 4711}), (Words{static_cast<int32_t>(v.payloadLen), v.header.senderPid}));
   char text[3];
   EXPECT_EQ(2u, ipcPayloadText(v, text, sizeof text));
   EXPECT_EQ(KLP_RC_GET_FAILED, ipcDecodeMsg(good.data(), 43, &v));
@@ -139,22 +130,19 @@ TEST(IpcMsg, MsgQeIsBuiltFromARequestCutToItsFieldAndPrinted) {
   setWord(raw, 20, 9);
   IpcMsgView v;
   MsgQe* qe = nullptr;
-  ASSERT_EQ(0, ipcDecodeMsg(raw.data(), raw.size(), &v));
-  ASSERT_EQ(0, createMsgQe(&qe, v));
-  EXPECT_STREQ("ITC:", qe->ole.eyeCatcher);
-  EXPECT_EQ(64u, qe->ole.size);
-  EXPECT_EQ(qe, qe->ole.object);
-  EXPECT_EQ((Words{20, 9, 0, 4711}), (Words{qe->QeFunc, qe->QeSubFunc, qe->QeSubFuncInfo, qe->QeResponseId}));
-  EXPECT_EQ(0, memcmp(qe->QeString, "ab\0cd\0", 6));  // with a requester: the bytes as they came
-  setMsgQeReplyTag(qe, 0x1122334455667788ull);
-  EXPECT_EQ(0x1122334455667788ull, qe->replyTag);
-  deleteMsgQe(qe);
-  setWord(raw, 24, 0);  // without one: the text up to its NUL
-  ASSERT_EQ(0, ipcDecodeMsg(raw.data(), raw.size(), &v));
-  ASSERT_EQ(0, createMsgQe(&qe, v));
-  EXPECT_EQ(0, memcmp(qe->QeString, "ab\0\0\0", 5));
-  deleteMsgQe(qe);
   for (int32_t pid : {4711, 0}) {
+    setWord(raw, 24, pid);
+    ASSERT_EQ(0, ipcDecodeMsg(raw.data(), raw.size(), &v));
+    ASSERT_EQ(0, createMsgQe(&qe, v));
+    EXPECT_EQ(std::string("ITC:\0\0\0", 8), std::string(qe->ole.eyeCatcher, 8));
+    EXPECT_EQ((Words{64, 20, 9, 0, pid}), (Words{static_cast<int32_t>(qe->ole.size), qe->QeFunc, qe->QeSubFunc,
+                                                  qe->QeSubFuncInfo, qe->QeResponseId}));
+    EXPECT_EQ(qe, qe->ole.object);
+    // With a requester the payload's bytes come as they are, without one the text up to its NUL.
+    EXPECT_EQ(std::string(pid ? "ab\0cd\0" : "ab\0\0\0\0", 6), std::string(qe->QeString, 6));
+    setMsgQeReplyTag(qe, 0x1122334455667788ull);
+    EXPECT_EQ(0x1122334455667788ull, qe->replyTag);
+    deleteMsgQe(qe);
     auto big = request(IPC_FUNC_REINITQ, pid, std::string(4052, 'x'));
     ASSERT_EQ(0, ipcDecodeMsg(big.data(), big.size(), &v));
     ASSERT_EQ(0, createMsgQe(&qe, v));
@@ -162,7 +150,6 @@ TEST(IpcMsg, MsgQeIsBuiltFromARequestCutToItsFieldAndPrinted) {
     EXPECT_EQ(0u, qe->replyTag) << "the field after the text was overwritten";
     deleteMsgQe(qe);
   }
-
   MsgQe* stop = createMsgQeFunc(IPC_FUNC_STOP);
   ASSERT_NE(nullptr, stop);
   testing::internal::CaptureStdout();
@@ -171,9 +158,9 @@ TEST(IpcMsg, MsgQeIsBuiltFromARequestCutToItsFieldAndPrinted) {
   char addr[32];
   snprintf(addr, sizeof addr, "%016llX", static_cast<unsigned long long>(reinterpret_cast<uintptr_t>(stop)));
   EXPECT_EQ("MsgQe:print entered w/ QE " + std::string(addr) + "\n QE Addr=" + addr +
-                "\n EyeCatcher=ITC:\n Size=64\n prevElement=0000000000000000\n"
-                " nextElement=0000000000000000\n QeFunc=14\n QeSubFunc=0\n QeSubFuncInfo=0\n"
-                " QeResponseId=0\n QeString=\nMsgQe:print exit for QE " + addr + "\n", out);
+                "\n EyeCatcher=ITC:\n Size=64\n prevElement=0000000000000000\n nextElement=0000000000000000\n"
+                " QeFunc=14\n QeSubFunc=0\n QeSubFuncInfo=0\n QeResponseId=0\n QeString=\nMsgQe:print exit for QE " +
+                addr + "\n", out);
   deleteMsgQe(stop);
 }
 
@@ -188,33 +175,26 @@ TEST(IpcMsg, QueueNamesResIdTextAndProgramWords) {
   EXPECT_STREQ("", path);
   ASSERT_EQ(0, ipcReplyQueuePath(path, sizeof path, "/d/", nullptr, 5));
   EXPECT_STREQ("/d/.IPC.CMD5", path);
-
-  char* text = ipcNewResIDText(nullptr);
-  EXPECT_STREQ("UNKNOWN", text);
-  free(text);
   HSVResID id;
   ASSERT_EQ(ECF_OK, hsvIPCGetQueResID("/tmp/MYDB.KLP.KCAP.IPC", HSV_QUEUE_RESID_OPTION, &id));
-  text = ipcNewResIDText(&id);
-  EXPECT_STREQ("(mqueue, /klpq.0499de10088ac99c, 48)", text);  // the documented example
-  free(text);
-
+  char *known = ipcNewResIDText(&id), *unknown = ipcNewResIDText(nullptr);
+  EXPECT_STREQ("(mqueue, /klpq.0499de10088ac99c, 48)", known);  // the documented example
+  EXPECT_STREQ("UNKNOWN", unknown);
+  free(known);
+  free(unknown);
   const char* words[][3] = {
       {"S.A.CAP", "Capture", "Capture Commands"},       {"S.A.APP", "Apply", "Apply Commands"},
       {"S.A.KCAP", "K Capture", "K Capture Commands"},  {"S.A.KAPP", "K Apply", "K Apply Commands"},
       {"S.A.MON", "Monitor", "Monitor Commands"},       {"S1.A.XYZ", "*", "*"},
       {"KCAP", "*", "*"},                               {"S1.A.kcap", "*", "*"}};
-  for (const auto& w : words) {
-    EXPECT_STREQ(w[1], ipcProgramWord(w[0])) << w[0];
-    EXPECT_STREQ(w[2], ipcProgramCmdWord(w[0])) << w[0];
-  }
+  for (const auto& w : words)
+    EXPECT_EQ(std::string(w[1]) + "/" + w[2], std::string(ipcProgramWord(w[0])) + "/" + ipcProgramCmdWord(w[0]));
 }
 
 TEST(IpcPieces, SplitAtTheMessageBoundAndGatheredAgain) {
-  auto one = split(pattern(4052));
-  ASSERT_EQ(1u, one.size());
+  auto one = split(pattern(4052)), two = split(pattern(4053));
+  ASSERT_EQ((Words{1, 2}), (Words{static_cast<int32_t>(one.size()), static_cast<int32_t>(two.size())}));
   EXPECT_EQ((Words{1, 4096, 61, 0, 4242, 0, 1, 0, 0}), headerWords(one[0].data()));
-  auto two = split(pattern(4053));
-  ASSERT_EQ(2u, two.size());
   EXPECT_EQ((Words{1, 4096, 61, 0, 4242, 0, 2, 1, 4053}), headerWords(two[0].data()));
   EXPECT_EQ((Words{1, 45, 61, 0, 4242, 0, 2, 2, 4053}), headerWords(two[1].data()));
   IpcMsg* reply = nullptr;
@@ -225,7 +205,6 @@ TEST(IpcPieces, SplitAtTheMessageBoundAndGatheredAgain) {
   EXPECT_EQ(KLP_RC_BAD_PARM, ipcBuildPiece(reply, 1, small, sizeof small, &len));  // too small
   EXPECT_EQ(0u, len);
   freeIpcMsg(reply);
-
   for (size_t n : {size_t(0), size_t(4053), size_t(3 * 4052), size_t(20000)}) {
     std::string payload = pattern(n);
     auto pieces = split(payload);
@@ -238,8 +217,7 @@ TEST(IpcPieces, SplitAtTheMessageBoundAndGatheredAgain) {
     char* buf = g.release();
     ASSERT_NE(nullptr, buf);
     EXPECT_EQ((Words{4242, static_cast<int32_t>(n)}), (Words{wordAt(buf, 0), wordAt(buf, 4)}));
-    EXPECT_EQ(payload, std::string(buf + 8, n));
-    EXPECT_EQ('\0', buf[8 + n]);
+    EXPECT_EQ(payload + '\0', std::string(buf + 8, n + 1));
     free(buf);
   }
   // CHGPARMS with two changed parameters: two single replies, one buffer
@@ -252,7 +230,7 @@ TEST(IpcPieces, SplitAtTheMessageBoundAndGatheredAgain) {
   char* buf = g.release();
   ASSERT_NE(nullptr, buf);
   EXPECT_EQ((Words{100, 7}), (Words{wordAt(buf, 0), wordAt(buf, 4)}));
-  EXPECT_EQ(0, memcmp(buf + 8, "ab\0cde\0", 7));
+  EXPECT_EQ(std::string("ab\0cde\0", 7), std::string(buf + 8, 7));
   free(buf);
   EXPECT_EQ(nullptr, IpcGather().release());
 }
@@ -261,18 +239,17 @@ TEST(IpcPieces, DamagedPieceHeadersSpoilTheGather) {
   auto pieces = split(pattern(3 * 4052 + 10));
   ASSERT_EQ(4u, pieces.size());
   const struct {
-    const char* what;
     size_t piece, offset;  // which piece, which header word
     int32_t value;
-    size_t offset2 = 0;    // a second word, when not 0
+    size_t offset2 = 0;  // a second word, when not 0
     int32_t value2 = 0;
   } cases[] = {
-      {"first piece not number 1", 0, 36, 2},       {"piece number skipped", 1, 36, 3},
-      {"piece number repeated", 2, 36, 2},          {"count changes midway", 2, 32, 5},
-      {"code changes midway", 1, 16, 15},           {"total changes midway", 1, 40, 3 * 4052 + 11},
-      {"total beyond the count", 0, 40, 5 * 4052},  {"total below the count", 0, 40, 3 * 4052},
-      {"negative total", 0, 40, -5},                {"negative count", 0, 32, -2},
-      {"huge count and total", 0, 32, 529982, 40, INT32_MAX},
+      {0, 36, 2},                       // first piece not number 1
+      {1, 36, 3},         {2, 36, 2},   // piece number skipped, repeated
+      {2, 32, 5},         {1, 16, 15},  // count or code changes midway
+      {1, 40, 3 * 4052 + 11},           // total changes midway
+      {0, 40, 5 * 4052},  {0, 40, 3 * 4052}, {0, 40, -5},  // total beyond or below the count, negative
+      {0, 32, -2},  {0, 32, 529982, 40, INT32_MAX},        // negative count; huge count and total
   };
   for (const auto& d : cases) {
     IpcGather g;
@@ -284,13 +261,13 @@ TEST(IpcPieces, DamagedPieceHeadersSpoilTheGather) {
       if (k == d.piece && d.offset2) setWord(raw, d.offset2, d.value2);
       rc = addRaw(g, raw, &left);
     }
-    EXPECT_EQ(KLP_RC_GET_FAILED, rc) << d.what;
-    EXPECT_EQ(nullptr, g.release()) << d.what;
-    EXPECT_EQ(KLP_RC_GET_FAILED, addRaw(g, pieces[0], &left)) << d.what;
+    EXPECT_EQ(KLP_RC_GET_FAILED, rc) << d.piece << " " << d.offset << " " << d.value;
+    EXPECT_EQ(nullptr, g.release());
+    EXPECT_EQ(KLP_RC_GET_FAILED, addRaw(g, pieces[0], &left));  // a spoiled gather takes nothing more
   }
   // Pieces whose own length disagrees with the count and total.
   auto shortPiece = pieces[1];
-  shortPiece.resize(shortPiece.size() - 1);
+  shortPiece.pop_back();
   setWord(shortPiece, 12, static_cast<int32_t>(shortPiece.size()));
   auto longLast = rawMsg({1, 144, 61, 0, 4242, 0, 4, 4, 3 * 4052 + 10}, std::string(100, 'z'));
   for (auto [good, bad] : {std::pair{1, shortPiece}, {3, longLast}}) {
@@ -316,9 +293,8 @@ TEST(IpcPieces, ATotalBeyondWhatItsCodeCanNeedIsRefused) {
       {20, 4053, false},                            // the echo of one request
   };
   for (const auto& c : cases) {
-    int32_t count = (c.total + 4051) / 4052;
+    int32_t count = (c.total + 4051) / 4052, left = 0;
     IpcGather g;
-    int32_t left = 0;
     auto first = rawMsg({1, 4096, c.func, 0, 1, 0, count, 1, c.total}, pattern(4052));
     EXPECT_EQ(c.taken ? 0 : KLP_RC_GET_FAILED, addRaw(g, first, &left)) << c.func << " " << c.total;
     EXPECT_EQ(c.taken ? count - 1 : 0, left) << c.func << " " << c.total;

@@ -8,7 +8,6 @@
 #include <unistd.h>
 
 #include <chrono>
-#include <cstdint>
 #include <cstring>
 #include <map>
 #include <memory>
@@ -38,10 +37,8 @@ inline std::string logPath(const klptest::TmpDir& dir, const std::string& server
 template <typename F>
 bool waitFor(F cond, int timeoutMs) {
   auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
-  while (!cond()) {
+  for (; !cond(); std::this_thread::sleep_for(std::chrono::milliseconds(10)))
     if (std::chrono::steady_clock::now() >= deadline) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
   return true;
 }
 
@@ -50,11 +47,6 @@ inline bool openQueue(HSVHIPCQueue& q, const std::string& path, bool create) {
   HSVResID id;
   if (hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id) != ECF_OK) return false;
   return (create ? q.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION) : q.attach(id)) == ECF_OK;
-}
-// Removes a queue a killed process left behind.
-inline void destroyQueue(const std::string& path) {
-  HSVHIPCQueue q;
-  if (openQueue(q, path, false)) q.destroy();
 }
 
 // One klpkcap process serving `name` in the directory's TMPDIR, logging there.
@@ -70,18 +62,14 @@ class Server {
   // A server a failed test left running is asked to stop, so that it
   // removes its queue; only one that does not react is killed.
   ~Server() {
-    if (proc_->running()) {
-      proc_->kill(SIGCONT);
-      proc_->kill(SIGTERM);
-      proc_->wait(15000);
-    }
+    if (!proc_->running()) return;
+    proc_->kill(SIGCONT);
+    proc_->kill(SIGTERM);
+    proc_->wait(15000);
   }
-  Server(const Server&) = delete;
-  Server& operator=(const Server&) = delete;
   // True once the receiving queue exists.
-  bool ready(int timeoutMs = 20000) {
-    return waitFor([&] { return klptest::queueExists(queue()) || !proc_->running(); }, timeoutMs) &&
-           proc_->running();
+  bool ready() {
+    return waitFor([&] { return klptest::queueExists(queue()) || !proc_->running(); }, 20000) && proc_->running();
   }
   std::string queue() const { return serverQueuePath(dir_, name_); }
   std::string log() const { return klptest::readFile(logPath(dir_, name_)); }
@@ -96,39 +84,20 @@ class Server {
 
 struct Reply {
   IpcMsg header{};
-  std::vector<char> payload;
-  std::vector<char> raw;
+  std::vector<char> payload, raw;
 };
 
 // Takes one message from q, waiting at most timeoutMs.
 inline bool takeReply(HSVHIPCQueue& q, Reply* out, int timeoutMs) {
-  if (q.waitForMessage(timeoutMs) != ECF_OK) return false;
   char buf[HSV_MAX_MSG_SIZE];
   size_t got = 0;
-  if (q.get(buf, sizeof buf, &got, 1000) != ECF_OK || got < IPC_HEADER_SIZE) return false;
+  if (q.waitForMessage(timeoutMs) != ECF_OK || q.get(buf, sizeof buf, &got, 1000) != ECF_OK ||
+      got < IPC_HEADER_SIZE)
+    return false;
   memcpy(&out->header, buf, IPC_HEADER_SIZE);
   out->raw.assign(buf, buf + got);
   out->payload.assign(buf + IPC_HEADER_SIZE, buf + got);
   return true;
-}
-
-// Takes a reply's pieces as the client does until it is whole; the headers
-// of the pieces that came are kept. Empty when it does not come whole.
-inline std::vector<char> gatherReply(HSVHIPCQueue& q, std::vector<IpcMsg>* headers) {
-  IpcGather g;
-  int32_t left = 0;
-  do {
-    Reply r;
-    IpcMsgView v;
-    if (!takeReply(q, &r, 2000) || ipcDecodeMsg(r.raw.data(), r.raw.size(), &v) || g.add(v, &left)) return {};
-    headers->push_back(r.header);
-  } while (left > 0);
-  char* buf = g.release();
-  int32_t len = 0;
-  memcpy(&len, buf + 4, 4);
-  std::vector<char> payload(buf + 8, buf + 8 + len);
-  free(buf);
-  return payload;
 }
 
 // A client that speaks the channel byte by byte: its reply queue is
@@ -136,18 +105,18 @@ inline std::vector<char> gatherReply(HSVHIPCQueue& q, std::vector<IpcMsg>* heade
 // withReply is false) and destroyed on destruction.
 class RawClient {
  public:
-  explicit RawClient(const std::string& serverQueue, bool withReply = true)
-      : replyPath_(serverQueue + ".CMD" + std::to_string(getpid())) {
-    ok_ = openQueue(server_, serverQueue, false) && (!withReply || openQueue(reply_, replyPath_, true));
+  explicit RawClient(const std::string& serverQueue, bool withReply = true) {
+    ok_ = openQueue(server_, serverQueue, false) &&
+          (!withReply || openQueue(reply_, serverQueue + ".CMD" + std::to_string(getpid()), true));
   }
   ~RawClient() {
     if (reply_.isOpen()) reply_.destroy();
     if (server_.isOpen()) server_.detach();
   }
   bool ok() const { return ok_; }
-  bool sendBytes(const void* data, size_t len) { return server_.put(data, len) == ECF_OK; }
+  bool sendBytes(const std::vector<char>& m) { return server_.put(m.data(), m.size()) == ECF_OK; }
   // A well-formed request; payload (when given) goes with its NUL.
-  static std::vector<char> request(int32_t func, int32_t subFunc, const std::string* payload,
+  static std::vector<char> request(int32_t func, int32_t subFunc = 0, const std::string* payload = nullptr,
                                    int32_t senderPid = getpid()) {
     size_t len = IPC_HEADER_SIZE + (payload ? payload->size() + 1 : 0);
     std::vector<char> m(len, 0);
@@ -157,17 +126,10 @@ class RawClient {
     if (payload) memcpy(m.data() + IPC_HEADER_SIZE, payload->c_str(), payload->size() + 1);
     return m;
   }
-  bool send(int32_t func, int32_t subFunc = 0, const std::string* payload = nullptr) {
-    auto m = request(func, subFunc, payload);
-    return sendBytes(m.data(), m.size());
-  }
-  bool receive(Reply* out, int timeoutMs = 10000) { return takeReply(reply_, out, timeoutMs); }
-  bool ask(int32_t func, Reply* out, int32_t subFunc = 0, const std::string* payload = nullptr) {
-    return send(func, subFunc, payload) && receive(out);
-  }
+  bool receive(Reply* out) { return takeReply(reply_, out, 10000); }
+  bool ask(int32_t func, Reply* out) { return sendBytes(request(func)) && receive(out); }
 
  private:
-  std::string replyPath_;
   HSVHIPCQueue server_, reply_;
   bool ok_ = false;
 };

@@ -75,15 +75,11 @@ class Engine : public ::testing::Test {
     cmdsSetDbStatusCheck(testDbCheck);
     threads_.makeShared("EngThreads", 1);
     cmdsInitState(&st_, CMDS_MODE_NORMAL, &stopFlag_);
-    HSVResID id;
-    replyPath_ = e2e::replyQueuePath(dir_, "ENG", getpid());
-    ASSERT_EQ(hsvIPCGetQueResID(replyPath_.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
-    ASSERT_EQ(reply_.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK);
+    ASSERT_TRUE(e2e::openQueue(reply_, e2e::replyQueuePath(dir_, "ENG", getpid()), true));
   }
   void TearDown() override {
     clearThreads();
     reply_.destroy();
-    EXPECT_FALSE(klptest::queueExists(replyPath_));
     delEnvIpcQRcvHdl(klpGetEnv());
     klpEnvClear(klpGetEnv());
     cmdsSetDbStatusCheck(nullptr);
@@ -118,7 +114,8 @@ class Engine : public ::testing::Test {
   }
   int handle(const std::vector<char>& m) { return cmdsHandleMessage(&st_, &threads_, m.data(), m.size()); }
   bool receive(e2e::Reply* r, int timeoutMs = 2000) { return e2e::takeReply(reply_, r, timeoutMs); }
-  static int32_t takeFunc(klpThread* t) {  // the function of the first command waiting, or -1
+  // The function of the first command waiting for t, or -1.
+  static int32_t takeFunc(klpThread* t) {
     auto* qe = reinterpret_cast<MsgQe*>(t->cmdList->getHead());
     int32_t f = qe ? qe->QeFunc : -1;
     deleteMsgQe(qe);
@@ -126,9 +123,8 @@ class Engine : public ::testing::Test {
   }
   // The server's queue, with one request on it so that a pass does not idle.
   void serverQueueWith(const std::vector<char>& m) {
-    if (!getEnvIpcQRcvHdl(klpGetEnv())) ASSERT_EQ(setEnvIpcQRcvHdl(klpGetEnv()), 0);
-    RawClient c(e2e::serverQueuePath(dir_, "ENG"), false);
-    ASSERT_TRUE(c.sendBytes(m.data(), m.size()));
+    if (!getEnvIpcQRcvHdl(klpGetEnv())) { ASSERT_EQ(setEnvIpcQRcvHdl(klpGetEnv()), 0); }
+    ASSERT_TRUE(RawClient(e2e::serverQueuePath(dir_, "ENG"), false).sendBytes(m));
   }
 
   klptest::TmpDir dir_;
@@ -138,7 +134,6 @@ class Engine : public ::testing::Test {
   cmdsState st_;
   int32_t stopFlag_ = 0;
   HSVHIPCQueue reply_;
-  std::string replyPath_;
 };
 
 std::vector<char> req(int32_t func, int32_t subFunc = 0, int32_t pid = getpid(), int32_t version = 1) {
@@ -152,7 +147,7 @@ std::vector<char> req(int32_t func, int32_t subFunc = 0, int32_t pid = getpid(),
 // sub-function 1 (the trace-on notice) by nobody.
 TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
   klpThread* pruner = addThread("PruneThread", KLP_THREAD_REST, {kPrune, kStop});
-  addThread("B", KLP_THREAD_DBWAIT);
+  addThread("BehinderWorkerThread", KLP_THREAD_DBWAIT);  // cut to 14 characters
   addThread("C", KLP_THREAD_RUN);
   const std::string get = "525 cmdsEngine 1 \\[NOT SET\\]\n589 cmdsEngine 1 cmdsEngine|816|HSVHIPCQueue::get\n"
                           "8999 cmdsEngine 1 a message of ";
@@ -184,9 +179,16 @@ TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
     e2e::Reply got;
     bool answered = receive(&got, 0);  // replies are put before the step returns
     EXPECT_EQ(answered ? (r.length == -2 ? -2 : got.header.msgLength) : -1, r.length) << func;
-    if (answered) EXPECT_EQ((e2e::Ints{got.header.func, got.header.senderPid}), (e2e::Ints{func, getpid()}));
-    if (func == 17) EXPECT_EQ(std::string(got.payload.data() + 2, 8), "KLPQRYMG");
-    if (func == 59) EXPECT_EQ(std::string(got.payload.data(), 16), std::string("klpSISize: \0\3\0\0\0", 16));
+    if (answered) { EXPECT_EQ((e2e::Ints{got.header.func, got.header.senderPid}), (e2e::Ints{func, getpid()})); }
+    if (func == 17) { EXPECT_EQ(std::string(got.payload.data() + 2, 8), "KLPQRYMG"); }
+    if (func == 59) { EXPECT_EQ(std::string(got.payload.data(), 16), std::string("klpSISize: \0\3\0\0\0", 16)); }
+    if (func == kStatus) {  // one record per thread, in list order, and room for one more
+      EXPECT_EQ((e2e::Ints{e2e::rd32(got.payload, 0), e2e::rd32(got.payload, 4), e2e::rd32(got.payload, 8),
+                           e2e::rd32(got.payload, 28), e2e::rd32(got.payload, 48), e2e::rd32(got.payload, 68)}),
+                (e2e::Ints{0, 0, 3, KLP_THREAD_REST, KLP_THREAD_DBWAIT, KLP_THREAD_RUN}));
+      EXPECT_EQ(std::string(got.payload.data() + 12) + "," + std::string(got.payload.data() + 32, 16),
+                "PruneThread," + std::string("BehinderWorker\0\0", 16));
+    }
     EXPECT_RECORDS(r.records, func);
   }
   // The code went to the interested thread only, without a requester when
@@ -194,23 +196,6 @@ TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
   EXPECT_EQ((e2e::Ints{takeFunc(pruner), takeFunc(pruner), takeFunc(pruner), takeFunc(pruner)}),
             (e2e::Ints{kPrune, kPrune, kStop, -1}));
   EXPECT_EQ((e2e::Ints{stopFlag_, st_.stopping}), (e2e::Ints{1, 1}));
-}
-
-TEST_F(Engine, StatusHasOneRecordPerThreadInListOrderAndALongOneComesInPieces) {
-  addThread("BehinderWorkerThread", KLP_THREAD_RUN);
-  addThread("Second", KLP_THREAD_DBWAIT);
-  for (auto [threads, pieces, last] : {std::tuple{3, 1, 136}, {250, 2, 44 + 980}}) {
-    while (threads_.count < threads) addThread("More", KLP_THREAD_REST);
-    ASSERT_EQ(handle(req(kStatus)), 0);
-    std::vector<IpcMsg> headers;
-    std::vector<char> p = e2e::gatherReply(reply_, &headers);
-    ASSERT_EQ(headers.size(), size_t(pieces));
-    EXPECT_EQ(headers.back().msgLength, last);
-    EXPECT_EQ((e2e::Ints{e2e::rd32(p, 0), e2e::rd32(p, 4), e2e::rd32(p, 8), e2e::rd32(p, 28), e2e::rd32(p, 48)}),
-              (e2e::Ints{0, 0, threads, KLP_THREAD_RUN, KLP_THREAD_DBWAIT}));
-    EXPECT_STREQ(p.data() + 12, "BehinderWorker");
-    EXPECT_STREQ(p.data() + 32, "Second");
-  }
 }
 
 // A value changes its parameter by the parameter's type, only when the
