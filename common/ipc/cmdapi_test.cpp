@@ -257,6 +257,11 @@ class CmdApiExchange : public ::testing::Test {
   std::string replyPath(const std::string& server) {
     return tmp_.path() + server + ".IPC.CMD" + std::to_string(getpid());
   }
+  HSVResID serverId(const std::string& server) {
+    HSVResID id{};
+    EXPECT_EQ(hsvIPCGetQueResID((tmp_.path() + server + ".IPC").c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+    return id;
+  }
   klptest::TmpDir tmp_;
   klptest::LogCapture log_;
   HSVResID id_;
@@ -427,23 +432,31 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
   EXPECT_EQ(KLPMonFunc(std::string(220, 'S').c_str(), "KLP.MON", nullptr), 2009);
   EXPECT_RECORDS(log_, "589 KLPMonFunc 1 KLPMonFunc|2009|server name\n8999 KLPMonFunc 1 the server "
                        "name and its suffix do not fit a server name*");
-  // Server queues made by hand: one open to others is refused at the first
-  // attempt (it will not become ours by waiting; retrying would take four
-  // pauses); one that takes no request of ours refuses the put.
+  // Queues made by hand: a server queue open to others is refused at the
+  // first attempt (it will not become ours by waiting; retrying would take
+  // four pauses); one that takes no request of ours refuses the put; a
+  // foreign queue under the reply queue's name is not taken over.
+  const std::string pid = std::to_string(getpid());
   const struct {
-    const char* server;
+    const char *server, *suffix;
     mode_t mode;
     long msgSize;
     int rc;
     std::string records;
   } queues[] = {
-      {"S2.KLP.CAP", 0666, HSV_MAX_MSG_SIZE, 815, "506 cmdAPIFunc 1 Capture\n597 cmdAPIFunc 1 " + q +
-                                                      "|*S2.KLP.CAP.IPC|object belongs to another user or is "
-                                                      "open to group or others"},
-      {"S3.KLP.MON", 0600, 16, 805, held + "\n508 cmdAPIFunc 1 \\*\n601 cmdAPIFunc 1 " + q + "|*S3.KLP.MON.IPC|*"},
+      {"S2.KLP.CAP", ".IPC", 0666, HSV_MAX_MSG_SIZE, 815,
+       "506 cmdAPIFunc 1 Capture\n597 cmdAPIFunc 1 " + q + "|*S2.KLP.CAP.IPC|object belongs to another user or is "
+                                                          "open to group or others"},
+      {"S3.KLP.MON", ".IPC", 0600, 16, 805, held + "\n508 cmdAPIFunc 1 \\*\n601 cmdAPIFunc 1 " + q + "|*S3.KLP.MON.IPC|*"},
+      {"S4.KLP.APP", ".IPC.CMD", 0666, HSV_MAX_MSG_SIZE, 804,
+       "592 cmdAPIFunc 1 " + q + "\n596 cmdAPIFunc 1 " + q + "|*S4.KLP.APP.IPC.CMD" + pid +
+           "|object belongs to another user or is open to group or others\n507 cmdAPIFunc 1 \\*"},
   };
   for (const auto& c : queues) {
-    ASSERT_EQ(hsvIPCGetQueResID((tmp_.path() + c.server + ".IPC").c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+    std::string path = tmp_.path() + c.server + c.suffix + (c.rc == 804 ? pid : "");
+    HSVHIPCQueue server;
+    if (c.rc == 804) { ASSERT_EQ(server.create(serverId(c.server), HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK); }
+    ASSERT_EQ(hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
     mq_attr attr{};
     attr.mq_maxmsg = HSV_QUEUE_DEPTH;
     attr.mq_msgsize = c.msgSize;
@@ -456,6 +469,7 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
     EXPECT_RECORDS(log_, c.records);
     mq_close(raw);
     mq_unlink(id.posixName());
+    if (server.isOpen()) server.destroy();
   }
 }
 
