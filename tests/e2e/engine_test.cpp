@@ -53,16 +53,16 @@ class Engine : public ::testing::Test {
  protected:
   void SetUp() override {
     if (klpMainThread()->getState() == KLP_THREAD_EXIST) klpThread::prologue(klpMainThread());
+    // The roles above, a server name and schema for the prefix, and one
+    // parameter that may not change while the server runs.
     std::vector<ParmEntry> table;
-    for (int i = 0; i <= kApplyText; ++i)
-      table.push_back(makeParmEntry(i, ("P" + std::to_string(i)).c_str(), 0, PARM_BOOLEAN, -1, -1, -1, nullptr, 0, 1, 0));
-    table[0] = makeParmEntry(0, "CAPTURE_SERVER", 0, PARM_STRING, -1, 1040, -1, "ENG", 0, 1, 0);
-    table[2] = makeParmEntry(2, "CAPTURE_SCHEMA", 0, PARM_STRING, -1, 1040, -1, "KLP", 0, 1, 0);
-    table[kTerm] = makeParmEntry(kTerm, "TERM", 0, PARM_BOOLEAN, -1, -1, -1, nullptr, 0, 1, 1);
-    table[kApplyFlag] = makeParmEntry(kApplyFlag, "AUTOSTOP", 0, PARM_BOOLEAN, -1, -1, -1, nullptr, 0, 1, 1);
-    table[kApplyText] = makeParmEntry(kApplyText, "STOP_AT", 0, PARM_STRING, -1, 1040, -1, "", 0, 1, 1);
-    table[kInterval] = makeParmEntry(kInterval, "COMMIT_INTERVAL", 0, PARM_INTEGER, 100, 600000, 500, nullptr, 0, 1, 1);
-    table[kPath] = makeParmEntry(kPath, "CAPTURE_PATH", 0, PARM_STRING, -1, 1040, -1, "/p", 0, 1, 0);
+    for (int i = 0; i <= kApplyText; ++i) {
+      const char* text = i == 0 ? "ENG" : i == 2 ? "KLP" : i == kPath ? "/p" : i == kApplyText ? "" : nullptr;
+      int changeable = i == kTerm || i == kApplyFlag || i == kApplyText || i == kInterval;
+      table.push_back(i == kInterval ? makeParmEntry(i, "COMMIT_INTERVAL", 0, PARM_INTEGER, 100, 600000, 500, nullptr, 0, 1, 1)
+                                     : makeParmEntry(i, ("P" + std::to_string(i)).c_str(), 0, text ? PARM_STRING : PARM_BOOLEAN,
+                                                     -1, text ? 1040 : -1, -1, text, 0, 1, changeable));
+    }
     int rc = 0;
     parms_ = std::make_unique<klpParmClass>(table.data(), static_cast<int>(table.size()), &rc);
     ASSERT_EQ(rc, 0);
