@@ -169,6 +169,8 @@ TEST(IpcMsg, QueueNamesResIdTextAndProgramWords) {
   ASSERT_EQ(0, ipcServerQueuePath(path, sizeof path, "/tmp/", "S1.A.KCAP"));
   EXPECT_STREQ("/tmp/S1.A.KCAP.IPC", path);
   EXPECT_EQ(KLP_RC_TOO_LONG, ipcServerQueuePath(path, 18, "/tmp/", "S1.A.KCAP"));
+  EXPECT_EQ((Words{KLP_RC_BAD_PARM, KLP_RC_TOO_LONG}), (Words{ipcServerQueuePath(path, 0, "/", "S"),
+                                                              ipcServerQueuePath(path, 1, "/", "S")}));
   ASSERT_EQ(0, ipcReplyQueuePath(path, 27, "/tmp/", "S1.A.KCAP", 4711));
   EXPECT_STREQ("/tmp/S1.A.KCAP.IPC.CMD4711", path);
   EXPECT_EQ(KLP_RC_TOO_LONG, ipcReplyQueuePath(path, 26, "/tmp/", "S1.A.KCAP", 4711));
