@@ -1,5 +1,6 @@
 // Fuzz target: a reply payload as a server could send it, taken as status
-// data of each format and as a status size answer. The first two bytes are
+// data of each format, as a STATUS reply to print and as a status size
+// answer. The first two bytes are
 // the capacity of the caller's buffer, which is allocated to exactly that
 // size so that any write beyond it is caught.
 #include <cstdint>
@@ -32,6 +33,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   convert(klpStatusFromThreads, payload, len, outLen);
   convert(klpStatusFromKcap, payload, len, outLen * 4);
   convert(klpStatusFromKapp, payload, len, outLen * 16);
+  klpMsgCapture cap{};
+  int prc = printState(payload, len, &cap);
+  if ((prc != 0 && (prc != 817 || cap.length != 0)) || cap.length > KLP_CAPTURE_CHARS ||
+      cap.text[cap.length] != '\0')
+    abort();
 
   // The same bytes as a reply buffer: senderPid, payload length, payload.
   std::vector<char> reply(KLP_REPLY_HEADER + len);

@@ -1,93 +1,117 @@
 /*
  * The control interface as a C program sees it: the public header compiles
- * as C, the records keep their layout, and the four functions are reached
- * through the shared library with their documented answers.
+ * as C, the records keep their layout, the four functions check their
+ * arguments in order, and a failure brings its messages' texts although
+ * this program made no logger.
  */
+#include <fcntl.h>
+#include <mqueue.h>
 #include <stddef.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include "klpapi.h"
 
-_Static_assert(sizeof(klpResultBlock) == 1036, "result block is 1036 bytes");
-_Static_assert(offsetof(klpResultBlock, text) == 8, "result text at 8");
-_Static_assert(offsetof(klpStatusRequest, statusSize) == 260, "status size at 260");
-_Static_assert(offsetof(klpStatusRequest, buffer) == 264, "buffer at 264");
-_Static_assert(offsetof(klpStatusRequest, bufferSize) == 272, "buffer size at 272");
-_Static_assert(offsetof(klpStatusRequest, requiredSize) == 276, "required size at 276");
-_Static_assert(sizeof(klpStatusFmt3) == 2224, "format 3 is 2224 bytes");
-_Static_assert(sizeof(klpStatusFmt2Record) == 12272, "format 2 record is 12272 bytes");
+_Static_assert(sizeof(klpReleaseInfo) == 12 && offsetof(klpReleaseInfo, modification) == 8, "release");
+_Static_assert(offsetof(klpStatusRequest, schema) == 129 && offsetof(klpStatusRequest, statusSize) == 260 &&
+                   offsetof(klpStatusRequest, buffer) == 264 && offsetof(klpStatusRequest, bufferSize) == 272 &&
+                   offsetof(klpStatusRequest, requiredSize) == 276, "request");
+_Static_assert(sizeof(klpResultBlock) == 1036 && offsetof(klpResultBlock, text) == 8, "result block");
+_Static_assert(sizeof(klpStatusFmt1) == 8 && sizeof(klpStatusThread) == 24 &&
+                   offsetof(klpStatusThread, kind) == 16 && offsetof(klpStatusThread, state) == 20, "format 1");
+_Static_assert(sizeof(klpStatusFmt3) == 2224 && offsetof(klpStatusFmt3, logFile) == 8 &&
+                   offsetof(klpStatusFmt3, activeSubs) == 1036 && offsetof(klpStatusFmt3, currentLogTime) == 1040 &&
+                   offsetof(klpStatusFmt3, allPublishedLsn) == 1067 && offsetof(klpStatusFmt3, currentMemory) == 1132 &&
+                   offsetof(klpStatusFmt3, sectionText) == 1136 && offsetof(klpStatusFmt3, sectionA) == 2161 &&
+                   offsetof(klpStatusFmt3, sectionB) == 2191, "format 3");
+_Static_assert(sizeof(klpStatusFmt2) == 1048 && offsetof(klpStatusFmt2, value8) == 8 &&
+                   offsetof(klpStatusFmt2, text) == 12 && offsetof(klpStatusFmt2, value1044) == 1044, "format 2");
+_Static_assert(sizeof(klpStatusFmt2Record) == 12272 && offsetof(klpStatusFmt2Record, value52) == 52 &&
+                   offsetof(klpStatusFmt2Record, block83) == 83 && offsetof(klpStatusFmt2Record, block148) == 148 &&
+                   offsetof(klpStatusFmt2Record, time213) == 213 && offsetof(klpStatusFmt2Record, value240) == 240 &&
+                   offsetof(klpStatusFmt2Record, value248) == 248 && offsetof(klpStatusFmt2Record, value264) == 264 &&
+                   offsetof(klpStatusFmt2Record, text268) == 268 && offsetof(klpStatusFmt2Record, text3269) == 3269 &&
+                   offsetof(klpStatusFmt2Record, text9271) == 9271, "format 2 record");
 
 static int passed, failed;
 
 static void check(int ok, const char* what) {
-  if (ok) {
-    ++passed;
-  } else {
-    ++failed;
-    printf("FAILED: %s\n", what);
-  }
+  ok ? ++passed : ++failed;
+  if (!ok) printf("FAILED: %s\n", what);
+}
+
+/* The POSIX name of a queue path, as docs/ipc-names.md gives it. */
+static void queueName(const char* path, char* out, size_t len) {
+  unsigned long long h = 0xcbf29ce484222325ULL;
+  for (const unsigned char* p = (const unsigned char*)path; *p; ++p) h = (h ^ *p) * 0x100000001b3ULL;
+  snprintf(out, len, "/klpq.%016llx", h);
 }
 
 int main(void) {
   /* A private IPC directory, so nothing here meets another run's queues. */
   char dir[] = "/tmp/klpcapiXXXXXX";
-  if (!mkdtemp(dir)) {
-    perror("mkdtemp");
-    return 2;
-  }
+  if (!mkdtemp(dir)) return 2;
   setenv("TMPDIR", dir, 1);
-
   klpResultBlock res;
-  klpReleaseInfo rel;
-  klpStatusRequest req;
+  klpReleaseInfo rel = {KLP_KIND_CAP, 9, 1, 0}, kcap = {KLP_KIND_KCAP, 9, 1, 0}, bad = {6, 9, 1, 0};
+  klpReleaseInfo old[] = {{3, 8, 1, 0}, {3, 9, 0, 0}, {3, 9, 1, 1}};
+  klpStatusRequest req, none;
+  char buf[64];
   memset(&res, 0, sizeof(res));
-  memset(&rel, 0, sizeof(rel));
   memset(&req, 0, sizeof(req));
+  memset(&none, 0, sizeof(none));
+  strcpy(req.serverName, "S1");
+  strcpy(req.schema, "KLP");
 
   check(klpStartProgram() == 0, "klpStartProgram answers 0");
+  check(klpStopProgram(1, "S", "K", 0, NULL) == 2001, "stop without result block");
+  check(klpStopProgram(0, "S", "K", 0, &res) == 2006 && res.rc == 2006, "stop with kind 0 stores 2006");
+  check(klpStopProgram(6, "S", "K", 0, &res) == 2006, "stop with kind 6");
+  check(klpStopProgram(1, "", "K", -1, &res) == 2007, "stop without server");
+  check(klpStopProgram(5, "S", " ", -1, &res) == 2008, "stop without schema");
+  check(klpStopProgram(1, "S", "K", -1, &res) == 2005, "stop with a negative option");
 
-  check(klpStopProgram(KLP_KIND_KCAP, "S", "K", 0, NULL) == KLP_API_MISSING_ARG,
-        "stop without result block");
-  check(klpStopProgram(9, "S", "K", 0, &res) == KLP_API_BAD_KIND && res.rc == KLP_API_BAD_KIND,
-        "stop with a bad kind stores 2006");
-  check(klpStopProgram(KLP_KIND_KCAP, "S", "K", -1, &res) == KLP_API_NEGATIVE_OPTION,
-        "stop with a negative option");
+  check(klpGetStatusSize(&rel, &req, NULL) == 2001, "size without result block");
+  memset(&res, 0x7f, sizeof(res));
+  check(klpGetStatusSize(NULL, &req, &res) == 2001 && !strcmp(res.text, "klpReleaseInfo"), "size names the release");
+  check(klpGetStatusSize(&rel, NULL, &res) == 2001 && !strcmp(res.text, "klpGetStatusDataSize"), "size names the request");
+  for (int i = 0; i < 3; ++i) check(klpGetStatusSize(&old[i], &req, &res) == 2002, "size of another release");
+  check(klpGetStatusSize(&bad, &req, &res) == 2006, "size of kind 6");
+  check(klpGetStatusSize(&kcap, &none, &res) == 0 && none.statusSize == 2224 && res.rc == 0, "KCAP size, no server");
+  strcpy(none.serverName, "S1");
+  check(klpGetStatusSize(&rel, &none, &res) == 2008, "size without schema");
 
-  rel.kind = KLP_KIND_KCAP;
-  rel.version = 9;
-  rel.release = 1;
-  rel.modification = 0;
-  check(klpGetStatusSize(&rel, &req, &res) == 0 && req.statusSize == 2224 && res.rc == 0,
-        "KCAP status size without a server");
-  check(klpGetStatusSize(NULL, &req, &res) == KLP_API_MISSING_ARG &&
-            strcmp(res.text, "klpReleaseInfo") == 0,
-        "status size names the missing release information");
-
-  check(klpGetStatus(&rel, &req, &res) == KLP_API_NO_BUFFER, "status without a buffer");
-  {
-    char buf[2224];
-    req.buffer = buf;
-    req.bufferSize = 0;
-    check(klpGetStatus(&rel, &req, &res) == KLP_API_BUFFER_SIZE_ZERO, "status with size 0");
-    req.bufferSize = sizeof(buf);
-    rel.version = 8;
-    check(klpGetStatus(&rel, &req, &res) == KLP_API_BAD_RELEASE, "status of another release");
-    rel.version = 9;
-    check(klpGetStatus(&rel, &req, &res) == KLP_API_NO_SERVER, "status without server name");
+  check(klpGetStatus(&rel, &req, NULL) == 2001, "status without result block");
+  check(klpGetStatus(NULL, &req, &res) == 2001 && !strcmp(res.text, "klpReleaseInfo"), "status names the release");
+  check(klpGetStatus(&rel, NULL, &res) == 2001 && !strcmp(res.text, "klpGetStatusData"), "status names the request");
+  check(klpGetStatus(&rel, &req, &res) == 2003, "status without a buffer");
+  req.buffer = buf;
+  for (int size = 0; size >= -1; --size) {
+    req.bufferSize = size;
+    check(klpGetStatus(&rel, &req, &res) == 2004, "status with buffer size 0 or below");
   }
+  req.bufferSize = sizeof(buf);
+  for (int i = 0; i < 3; ++i) check(klpGetStatus(&old[i], &req, &res) == 2002, "status of another release");
+  check(klpGetStatus(&bad, &req, &res) == 2006, "status of kind 6");
+  strcpy(req.serverName, " ");
+  check(klpGetStatus(&rel, &req, &res) == 2007 && res.rc == 2007, "status without server name");
 
-  /* Nobody serves this name: the attach is tried five times, then 2013,
-   * with the messages' texts although this program made no logger. */
-  check(klpStopProgram(KLP_KIND_KCAP, "NOSERVER", "KLP", 0, &res) == KLP_API_NOT_ATTACHABLE &&
-            res.rc == KLP_API_NOT_ATTACHABLE,
-        "stop of a server that is not running");
-  check(strstr(res.text, "KLP0506E") != NULL && strstr(res.text, "K Capture") != NULL &&
-            strstr(res.text, "KLP0597E") != NULL,
+  /* A server queue open to others is refused at once, with the texts. */
+  char path[64], name[32];
+  snprintf(path, sizeof(path), "%s/OPEN.KLP.KCAP.IPC", dir);
+  queueName(path, name, sizeof(name));
+  struct mq_attr attr = {0, 10, 4096, 0};
+  mqd_t q = mq_open(name, O_RDWR | O_CREAT | O_EXCL, 0600, &attr);
+  check(q != (mqd_t)-1 && fchmod(q, 0666) == 0, "a queue under the documented name");
+  check(klpStopProgram(KLP_KIND_KCAP, "open", "KLP", 0, &res) == 2013 && res.rc == 2013, "stop of a foreign queue");
+  check(strstr(res.text, "KLP0506E") && strstr(res.text, "\"K Capture\"") && strstr(res.text, "KLP0597E") &&
+            strstr(res.text, path) && strstr(res.text, "open to group or others"),
         "the result text tells why");
-
+  mq_close(q);
+  mq_unlink(name);
   rmdir(dir);
   printf("%d passed, %d failed\n", passed, failed);
   return failed == 0 ? 0 : 1;

@@ -1,6 +1,9 @@
-// The command engine inside this process: requests handed to its per-message
-// step and to the loop itself, with thread objects that run no OS thread, so
-// that what each thread received can be looked at directly.
+// The command engine inside this process: requests handed to its
+// per-message step and to the loop itself, with thread objects that run no
+// OS thread, so that what each thread received can be looked at directly,
+// and every message it logs is recorded.
+#include <fnmatch.h>
+#include <signal.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -14,17 +17,20 @@
 #include "common/env/klpenv.h"
 #include "common/ipc/cmdsengine.h"
 #include "common/ipc/ipcmsg.h"
-#include "common/msg/klplog.h"
-#include "common/msg/msglogger.h"
 #include "common/parms/klpparm.h"
 #include "common/thread/klpthread.h"
 #include "common/thread/ordlist.h"
+#include "common/thread/recoverymgr.h"
 #include "tests/e2e/e2e_support.h"
-#include "xqpub/xqpubparms.h"
 
 namespace {
 
-constexpr int kStop = 14, kStatus = 15, kPrune = 22;
+using e2e::RawClient;
+constexpr int kStop = 14, kStatus = 15, kChgparms = 20, kPrune = 22;
+// The parameters whose roles the engine knows: 5 ends a one-pass server
+// without critical threads, and in an "xqapply" program 18 (a flag) and 34
+// (a text) decide both that and whether 18 may be set.
+constexpr int kTerm = 5, kApplyFlag = 18, kApplyText = 34, kInterval = 30, kPath = 7;
 
 int g_dbRc = 0;
 int testDbCheck(char* text, size_t len) {
@@ -32,319 +38,385 @@ int testDbCheck(char* text, size_t len) {
   return g_dbRc;
 }
 
+std::string records(klptest::LogCapture& log) {
+  std::string text;
+  for (const auto& r : log.take()) text += (text.empty() ? "" : "\n") + r;
+  return text;
+}
+#define EXPECT_RECORDS(pattern, what)                                                      \
+  do {                                                                                     \
+    std::string got_ = records(log_);                                                      \
+    EXPECT_EQ(fnmatch(std::string(pattern).c_str(), got_.c_str(), 0), 0) << what << "\n" << got_; \
+  } while (0)
+
 class Engine : public ::testing::Test {
  protected:
-  static void SetUpTestSuite() {
-    if (klpGetProcessLogger() == nullptr) {
-      msgLogger* logger = createMsgLoggerU(5, 0);
-      logger->loadBuiltinMsgs(builtinMsgTable);
-      klpSetProcessLogger(logger);
-    }
-    if (klpMainThread()->getState() == KLP_THREAD_EXIST) klpThread::prologue(klpMainThread());
-  }
-
   void SetUp() override {
-    dir_ = std::make_unique<klptest::TmpDir>();
-    ParmEntry table[XQPUB_PARM_COUNT];
-    buildXqpubParmTable(table);
+    if (klpMainThread()->getState() == KLP_THREAD_EXIST) klpThread::prologue(klpMainThread());
+    // The roles above, a server name and schema for the prefix, and one
+    // parameter that may not change while the server runs.
+    std::vector<ParmEntry> table;
+    for (int i = 0; i <= kApplyText; ++i) {
+      const char* text = i == 0 ? "ENG" : i == 2 ? "KLP" : i == kPath ? "/p" : i == kApplyText ? "" : nullptr;
+      int changeable = i == kTerm || i == kApplyFlag || i == kApplyText || i == kInterval;
+      table.push_back(i == kInterval ? makeParmEntry(i, "COMMIT_INTERVAL", 0, PARM_INTEGER, 100, 600000, 500, nullptr, 0, 1, 1)
+                                     : makeParmEntry(i, ("P" + std::to_string(i)).c_str(), 0, text ? PARM_STRING : PARM_BOOLEAN,
+                                                     -1, text ? 1040 : -1, -1, text, 0, 1, changeable));
+    }
     int rc = 0;
-    parms_ = std::make_unique<xqpubParms>(table, XQPUB_PARM_COUNT, &rc);
+    parms_ = std::make_unique<klpParmClass>(table.data(), static_cast<int>(table.size()), &rc);
     ASSERT_EQ(rc, 0);
-    parms_->setParm(0, "ENG", PARM_SRC_COMMANDLINE);
     klpSetCurrentParms(parms_.get());
     klpEnv* env = klpGetEnv();
     klpEnvClear(env);
     ASSERT_EQ(setEnvNamePrefix(env, "KCAP"), 0);
+    program("klpkcap");
     g_dbRc = 0;
     cmdsSetDbStatusCheck(testDbCheck);
     threads_.makeShared("EngThreads", 1);
     cmdsInitState(&st_, CMDS_MODE_NORMAL, &stopFlag_);
-
-    replyPath_ = e2e::replyQueuePath(*dir_, "ENG", getpid());
-    HSVResID id;
-    ASSERT_EQ(hsvIPCGetQueResID(replyPath_.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
-    ASSERT_EQ(reply_.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK);
+    ASSERT_TRUE(e2e::openQueue(reply_, e2e::replyQueuePath(dir_, "ENG", getpid()), true));
   }
-
   void TearDown() override {
-    while (OrdListElement* e = threads_.getHead()) {
-      klpThread* t = klpThreadOf(e);
-      if (t->cmdList != nullptr) {
-        t->cmdList->delList();
-        delete t->cmdList;
-      }
-      delete t;
-    }
+    clearThreads();
     reply_.destroy();
-    EXPECT_FALSE(klptest::queueExists(replyPath_));
     delEnvIpcQRcvHdl(klpGetEnv());
     klpEnvClear(klpGetEnv());
     cmdsSetDbStatusCheck(nullptr);
     klpSetCurrentParms(nullptr);
-    parms_.reset();
-    dir_.reset();
+    erClearGlobalSignal();
+  }
+  void clearThreads() {
+    while (OrdListElement* e = threads_.getHead()) {
+      klpThread* t = klpThreadOf(e);
+      if (t->cmdList) t->cmdList->delList();
+      delete t->cmdList;
+      delete t;
+    }
+  }
+  static void program(const char* name) {
+    snprintf(klpGetEnv()->programName, sizeof klpGetEnv()->programName, "%s", name);
   }
 
   // A thread object with its own command list, on the engine's list, that
   // runs nothing.
-  klpThread* addThread(const char* name, int32_t state, std::vector<int> interests = {}) {
+  klpThread* addThread(const char* name, int32_t state, std::vector<int> interests = {}, int critical = 1) {
     klpThread* t = new klpThread();
     t->setName(name);
     t->setState(state);
-    t->critical = 1;
-    for (int code : {14, 18, 19}) setCmdInterest(t, code, 1);
+    t->critical = critical;
+    t->restart = 0;
     for (int code : interests) setCmdInterest(t, code, 1);
     t->cmdList = new OrdList();
     t->cmdList->makeShared(name, 1);
     threads_.putTail(&t->ole);
     return t;
   }
-
-  int handle(const std::vector<char>& m) {
-    return cmdsHandleMessage(&st_, &threads_, m.data(), m.size());
+  int handle(const std::vector<char>& m) { return cmdsHandleMessage(&st_, &threads_, m.data(), m.size()); }
+  bool receive(e2e::Reply* r, int timeoutMs = 2000) { return e2e::takeReply(reply_, r, timeoutMs); }
+  // The function of the first command waiting for t, or -1.
+  static int32_t takeFunc(klpThread* t) {
+    auto* qe = reinterpret_cast<MsgQe*>(t->cmdList->getHead());
+    int32_t f = qe ? qe->QeFunc : -1;
+    deleteMsgQe(qe);
+    return f;
+  }
+  // The server's queue, with one request on it so that a pass does not idle.
+  void serverQueueWith(const std::vector<char>& m) {
+    if (!getEnvIpcQRcvHdl(klpGetEnv())) { ASSERT_EQ(setEnvIpcQRcvHdl(klpGetEnv()), 0); }
+    ASSERT_TRUE(RawClient(e2e::serverQueuePath(dir_, "ENG"), false).sendBytes(m));
   }
 
-  bool receive(e2e::Reply* r, int timeoutMs = 2000) {
-    if (reply_.waitForMessage(timeoutMs) != ECF_OK) return false;
-    char buf[HSV_MAX_MSG_SIZE];
-    size_t got = 0;
-    if (reply_.get(buf, sizeof buf, &got, 100) != ECF_OK) return false;
-    memcpy(&r->header, buf, IPC_HEADER_SIZE);
-    r->raw.assign(buf, buf + got);
-    r->payload.assign(buf + IPC_HEADER_SIZE, buf + got);
-    return true;
-  }
-
-  static MsgQe* takeQe(klpThread* t) { return reinterpret_cast<MsgQe*>(t->cmdList->getHead()); }
-
-  // Takes a reply's pieces as the client does until it is whole; the
-  // headers of the pieces that came are kept.
-  std::vector<char> gatherReply(std::vector<IpcMsg>* headers) {
-    IpcGather g;
-    int32_t left = 0;
-    do {
-      e2e::Reply r;
-      if (!receive(&r)) return {};
-      headers->push_back(r.header);
-      IpcMsgView v;
-      if (ipcDecodeMsg(r.raw.data(), r.raw.size(), &v) != 0 || g.add(v, &left) != 0) return {};
-    } while (left > 0);
-    char* buf = g.release();
-    int32_t len = 0;
-    memcpy(&len, buf + 4, 4);
-    std::vector<char> payload(buf + 8, buf + 8 + len);
-    free(buf);
-    return payload;
-  }
-
-  std::string logText() const { return klptest::readFile(dir_->path() + "eng.log"); }
-
-  std::unique_ptr<klptest::TmpDir> dir_;
-  std::unique_ptr<xqpubParms> parms_;
+  klptest::TmpDir dir_;
+  klptest::LogCapture log_;
+  std::unique_ptr<klpParmClass> parms_;
   OrdList threads_;
   cmdsState st_;
   int32_t stopFlag_ = 0;
   HSVHIPCQueue reply_;
-  std::string replyPath_;
 };
 
-TEST_F(Engine, StatusHasOneRecordPerThreadInListOrderAndALongOneComesInPieces) {
-  addThread("BehinderWorkerThread", KLP_THREAD_RUN);
-  addThread("Second", KLP_THREAD_DBWAIT);
-  addThread("Third", KLP_THREAD_REST);
+std::vector<char> req(int32_t func, int32_t subFunc = 0, int32_t pid = getpid(), int32_t version = 1) {
+  auto m = RawClient::request(func, subFunc, nullptr, pid);
+  memcpy(m.data() + 8, &version, 4);
+  return m;
+}
+
+// What each request is answered with and what the engine logs on the way.
+// Codes 60 to 62 are answered by the interested thread, TRCSTART with
+// sub-function 1 (the trace-on notice) by nobody.
+TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
+  klpThread* pruner = addThread("PruneThread", KLP_THREAD_REST, {kPrune, kStop});
+  addThread("BehinderWorkerThread", KLP_THREAD_DBWAIT);  // cut to 14 characters
+  addThread("C", KLP_THREAD_RUN);
+  const std::string get = "525 cmdsEngine 1 \\[NOT SET\\]\n589 cmdsEngine 1 cmdsEngine|816|HSVHIPCQueue::get\n"
+                          "8999 cmdsEngine 1 a message of ";
   const struct {
-    int threads;
-    size_t pieces;
-    int32_t lastLength;
-  } cases[] = {
-      {3, 1, 136},         // 76 + 20 x 3
-      {250, 2, 44 + 980},  // 5032 payload bytes: 4052, then 980
+    std::vector<char> msg;
+    int32_t length;  // of the reply, -1: none
+    std::string records;
+  } rows[] = {
+      {req(kStatus), 44 + 12 + 20 * 4, ""},   {req(10), 44, ""},          {req(10, 1), -1, ""},
+      {req(60), -1, ""},                      {req(61), -1, ""},          {req(62), -1, ""},
+      {req(16), 44, ""},  // codes no thread can declare interest in are reported per thread
+      {req(99), 44, "8006 klpThread::interestedInCmd 1 99\n8006 klpThread::interestedInCmd 1 99\n"
+                    "8006 klpThread::interestedInCmd 1 99"},
+      {req(-7), 44, "8006 klpThread::interestedInCmd 1 -7\n8006 klpThread::interestedInCmd 1 -7\n"
+                    "8006 klpThread::interestedInCmd 1 -7"},
+      {req(59), 60, ""},                      {req(kPrune, 0, 0), -1, ""},
+      {req(0, 0, 4711), -1, "511 cmdsEngine 1 4711"},
+      {req(kStatus, 0, 1, 2), -1, "509 cmdsEngine 1 2"},
+      {std::vector<char>(10, 'I'), -1, get + "10 bytes is not a command message*"},
+      {std::vector<char>(43, 'I'), -1, ""},  // reported once until a get succeeds again
+      {req(17), -2, "517 cmdsEngine 1 \\[NOT SET\\]"},  // -2: any length
+      {req(kPrune, 0, 4711), -1, "597 cmdsEngine 1 (mqueue, /klpq.*, 48)|" + dir_.path() +
+                                     "ENG.KLP.KCAP.IPC.CMD4711|*\n506 cmdsEngine 1 K Capture Commands"},
+      {req(kStop), 44, "522 cmdsEngine 0 STOP"},
   };
-  for (const auto& c : cases) {
-    while (threads_.count < c.threads) addThread("More", KLP_THREAD_REST);
-    std::vector<IpcMsg> pieces;
-    ASSERT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
-    std::vector<char> p = gatherReply(&pieces);
-    ASSERT_EQ(pieces.size(), c.pieces);
-    for (const IpcMsg& h : pieces) {
-      EXPECT_EQ(h.func, kStatus);
-      EXPECT_EQ(h.senderPid, getpid());
-      EXPECT_EQ(h.pieceCount, static_cast<int32_t>(c.pieces));
+  for (const auto& r : rows) {
+    int32_t func = r.msg.size() >= 20 ? e2e::rd32(r.msg, 16) : 0;
+    ASSERT_EQ(handle(r.msg), 0) << func;
+    e2e::Reply got;
+    bool answered = receive(&got, 0);  // replies are put before the step returns
+    EXPECT_EQ(answered ? (r.length == -2 ? -2 : got.header.msgLength) : -1, r.length) << func;
+    if (answered) { EXPECT_EQ((e2e::Ints{got.header.func, got.header.senderPid}), (e2e::Ints{func, getpid()})); }
+    if (func == 17) { EXPECT_EQ(std::string(got.payload.data() + 2, 8), "KLPQRYMG"); }
+    if (func == 59) { EXPECT_EQ(std::string(got.payload.data(), 16), std::string("klpSISize: \0\3\0\0\0", 16)); }
+    if (answered && func == kStatus) {  // one record per thread, in list order, and room for one more
+      EXPECT_EQ((e2e::Ints{e2e::rd32(got.payload, 0), e2e::rd32(got.payload, 4), e2e::rd32(got.payload, 8),
+                           e2e::rd32(got.payload, 28), e2e::rd32(got.payload, 48), e2e::rd32(got.payload, 68)}),
+                (e2e::Ints{0, 0, 3, KLP_THREAD_REST, KLP_THREAD_DBWAIT, KLP_THREAD_RUN}));
+      EXPECT_EQ(std::string(got.payload.data() + 12) + "," + std::string(got.payload.data() + 32, 16),
+                "PruneThread," + std::string("BehinderWorker\0\0", 16));
     }
-    EXPECT_EQ(pieces.back().msgLength, c.lastLength);
-    EXPECT_EQ(e2e::rd32(p, 0), 0);
-    EXPECT_EQ(e2e::rd32(p, 8), c.threads);
-    EXPECT_STREQ(p.data() + 12, "BehinderWorker");
-    EXPECT_EQ(e2e::rd32(p, 12 + 16), KLP_THREAD_RUN);
-    EXPECT_STREQ(p.data() + 32, "Second");
-    EXPECT_EQ(e2e::rd32(p, 32 + 16), KLP_THREAD_DBWAIT);
+    EXPECT_RECORDS(r.records, func);
+  }
+  // The code went to the interested thread only, without a requester when
+  // the request had none; STOP set the caller's flag once.
+  EXPECT_EQ((e2e::Ints{takeFunc(pruner), takeFunc(pruner), takeFunc(pruner), takeFunc(pruner)}),
+            (e2e::Ints{kPrune, kPrune, kStop, -1}));
+  EXPECT_EQ((e2e::Ints{stopFlag_, st_.stopping}), (e2e::Ints{1, 1}));
+}
+
+// A value changes its parameter by the parameter's type, only when the
+// parameter may change while the server runs; the request is echoed either
+// way. In an "xqapply" program the flag 18 may not be set while the text 34
+// is set.
+TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
+  const struct {
+    const char* program;
+    int index;
+    const char* value;
+    const char* after;  // the parameter's value text afterwards
+    int source;
+    const char* records = "";
+  } rows[] = {
+      {"klpkcap", kTerm, "yes", "Y", 3},        {"klpkcap", kTerm, "n", "N", 3},
+      {"klpkcap", kTerm, "Y", "Y", 3},          {"klpkcap", kTerm, "No", "N", 3},
+      {"klpkcap", kTerm, "MAYBE", "N", 3},      {"klpkcap", kTerm, "YESYESYES", "N", 3},
+      {"klpkcap", kInterval, "1000", "1000", 3}, {"klpkcap", kInterval, "12abc", "1000", 3},
+      {"klpkcap", kInterval, "50", "1000", 3, "503 klpParmClass:setParm 2 50|COMMIT_INTERVAL"},  {"klpkcap", kInterval, "99999999999", "1000", 3},
+      {"klpkcap", kInterval, "+2000", "2000", 3}, {"klpkcap", kPath, "/elsewhere", "/p", 0},
+      {"klpkcap", kApplyText, "P1", "P1", 3},   {"klpkcap", kApplyFlag, "Y", "Y", 3},
+      {"klpkcap", kApplyFlag, "N", "N", 3},     {"xqapply1", kApplyFlag, "N", "N", 3},
+      {"xqapply1", kApplyFlag, "y", "N", 3, "9011 cmdsEngine 1 "},
+      {"xqapply1", kApplyText, "", "", 3},      {"xqapply1", kApplyFlag, "y", "Y", 3},
+      {"xqapply1", 4000, "7", nullptr, 0},
+  };
+  for (const auto& r : rows) {
+    program(r.program);
+    std::string value = r.value;
+    auto m = RawClient::request(kChgparms, r.index, &value);
+    ASSERT_EQ(handle(m), 0);
+    e2e::Reply got;
+    ASSERT_TRUE(receive(&got, 0)) << r.value;
+    EXPECT_EQ(got.raw.size(), m.size());
+    EXPECT_EQ((e2e::Ints{got.header.subFunc, memcmp(got.raw.data() + 44, m.data() + 44, m.size() - 44)}),
+              (e2e::Ints{r.index, 0}));
+    if (r.after) {
+      const ParmEntry* p = parms_->peekSlot(r.index);
+      std::string now = p->type == PARM_BOOLEAN   ? (p->boolValue ? "Y" : "N")
+                        : p->type == PARM_INTEGER ? std::to_string(p->intValue)
+                                                  : (p->strValue ? p->strValue : "");
+      EXPECT_EQ(now, r.after) << r.program << " " << r.index << "=" << r.value;
+      EXPECT_EQ(parms_->peekSlot(r.index)->source, r.source) << r.index << "=" << r.value;
+    }
+    EXPECT_RECORDS(r.records, r.value);
   }
 }
 
-TEST_F(Engine, OnlyInterestedThreadsReceiveAndARequestWithoutRequesterIsNotAnswered) {
-  klpThread* pruner = addThread("PruneThread", KLP_THREAD_REST, {kPrune});
-  klpThread* other = addThread("Other", KLP_THREAD_REST);
-  ASSERT_EQ(handle(e2e::RawClient::request(kPrune, 0, nullptr, 0)), 0);
-  EXPECT_EQ(pruner->cmdList->count, 1);
-  EXPECT_EQ(other->cmdList->count, 0);
-  MsgQe* qe = takeQe(pruner);
-  ASSERT_NE(qe, nullptr);
-  EXPECT_STREQ(qe->ole.eyeCatcher, "ITC:");
-  EXPECT_EQ(qe->QeFunc, kPrune);
-  EXPECT_EQ(qe->QeResponseId, 0);
-  deleteMsgQe(qe);
-  e2e::Reply r;
-  EXPECT_FALSE(receive(&r, 300));
+// One pass of the loop (mode 2): supervision, the stop sequence, the signal
+// record and the result from the threads' end codes and the database. 415
+// (threads alive, none critical) stops a server unless, in one-pass mode,
+// its flag 5 is not set; an "xqapply" program stops only when its flag 18
+// or text 34 says so.
+TEST_F(Engine, OnePassOutcomes) {
+  const std::string rrs = "590 klpThread::stop 1 *|952|Ended\n534 cmdsEngine 1 ENG|RRS NOT AVAILABLE";
+  const struct {
+    const char* program;
+    int term, flag;
+    const char* text;
+    int state, critical, endCode;  // of the one thread
+    int dbRc, signal, rc;
+    bool stopped;  // the thread received STOP from the stop sequence
+    std::string records;
+  } rows[] = {
+      {"klpkcap", 0, 0, "", KLP_THREAD_REST, 1, 0, 0, 0, 0, false, ""},
+      {"klpkcap", 0, 0, "", KLP_THREAD_REST, 0, 0, 0, 0, 0, false, ""},
+      {"klpkcap", 1, 0, "", KLP_THREAD_REST, 0, 0, 0, 0, 0, true, ""},
+      {"xqapply1", 1, 0, "", KLP_THREAD_REST, 0, 0, 0, 0, 0, false, ""},
+      {"xqapply1", 1, 1, "", KLP_THREAD_REST, 0, 0, 0, 0, 0, true, ""},
+      {"xqapply1", 1, 0, "P", KLP_THREAD_REST, 0, 0, 0, 0, 0, true, ""},
+      {"xqapply1", 0, 0, "P", KLP_THREAD_REST, 0, 0, 0, 0, 0, false, ""},
+      {"klpkcap", 0, 0, "", KLP_THREAD_STOP, 1, 952, 0, 0, 952, false, rrs},
+      {"klpkcap", 0, 0, "", KLP_THREAD_REST, 1, 0, 929, 0, 929, false, ""},
+      {"klpkcap", 0, 0, "", KLP_THREAD_REST, 1, 0, 0, SIGINT, 0, true,
+       "8999 cmdsEngine 1 A global signal was received by \"KlpKCcmd\". Stop cmdsEngine(), stop all "
+       "threads and exit.*"},
+  };
+  for (const auto& r : rows) {
+    program(r.program);
+    parms_->setParmBool(kTerm, r.term, 3);
+    parms_->setParmBool(kApplyFlag, r.flag, 3);
+    parms_->setParm(kApplyText, r.text, 3);
+    klpThread* t = addThread("Ended", r.state, {}, r.critical);
+    t->setEndCode(r.endCode);
+    g_dbRc = r.dbRc;
+    if (r.signal) erSetGlobalSignal(r.signal);
+    serverQueueWith(req(kPrune, 0, 0));
+    log_.take();
+    int32_t flag = 0;
+    EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_ONE_PASS, &flag), r.rc) << r.program << " " << r.state;
+    EXPECT_EQ(r.state == KLP_THREAD_STOP ? -1 : takeFunc(t), r.stopped ? kStop : -1) << r.program;
+    EXPECT_RECORDS(r.records, r.program);
+    EXPECT_EQ(erGetGlobalSignal(), 0);
+    EXPECT_TRUE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));  // kept in one-pass mode
+    clearThreads();
+  }
+  delEnvIpcQRcvHdl(klpGetEnv());
+  log_.take();
+  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_NORMAL, nullptr), 804);
+  EXPECT_RECORDS("589 cmdsEngine 1 cmdsEngine|804|getEnvIpcQRcvHdl", "no queue");
 
-  // With a requester the request is answered after the thread got it.
-  ASSERT_EQ(handle(e2e::RawClient::request(kPrune, 0, nullptr)), 0);
-  EXPECT_EQ(pruner->cmdList->count, 1);
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(r.header.func, kPrune);
-  EXPECT_EQ(r.header.msgLength, 44);
+  // The stop sequence's grace, by program name.
+  for (auto [name, grace] : {std::pair{"xqapply", 180}, {"xqapplyZ", 180}, {"xqappl", 8}, {"apply", 8}}) {
+    program(name);
+    cmdsState st;
+    cmdsInitState(&st, CMDS_MODE_NORMAL, nullptr);
+    EXPECT_EQ(st.grace, grace) << name;
+  }
 }
 
-TEST_F(Engine, StopIsAnsweredOnceAndTheStopSequenceSkipsStoppedThreads) {
+// Runs the loop in mode 0 on its own thread; the test thread plays the
+// threads' part.
+struct LoopRun {
+  std::atomic<bool> done{false};
+  int rc = -1;
+  int32_t flag = 0;
+  std::thread runner;
+  explicit LoopRun(OrdList* threads)
+      : runner([this, threads] {
+          rc = cmdsEngine(threads, CMDS_MODE_NORMAL, &flag);
+          done = true;
+        }) {}
+  ~LoopRun() { runner.join(); }
+};
+
+// A database that goes down ends the loop's normal work: 2006 starts the
+// stop sequence, and once the threads have stopped the result is 929 with
+// message 534; the server's queue goes with the environment.
+TEST_F(Engine, ADatabaseThatGoesDownStopsTheServerWith929) {
   klpThread* a = addThread("A", KLP_THREAD_REST);
-  klpThread* b = addThread("B", KLP_THREAD_STOP);
-  ASSERT_EQ(handle(e2e::RawClient::request(kStop, 0, nullptr)), 0);
-  EXPECT_EQ(stopFlag_, 1);
-  EXPECT_EQ(st_.stopping, 1);
+  ASSERT_EQ(setEnvIpcQRcvHdl(klpGetEnv()), 0);
+  log_.take();
+  g_dbRc = 929;  // the first check comes after more than 4 seconds
+  {
+    LoopRun run(&threads_);
+    ASSERT_TRUE(e2e::waitFor([&] { return a->cmdList->count > 0; }, 15000));
+    EXPECT_EQ(takeFunc(a), kStop);
+    a->setState(KLP_THREAD_STOP);
+    EXPECT_TRUE(e2e::waitFor([&] { return run.done.load(); }, 15000));
+    EXPECT_EQ((e2e::Ints{run.rc, run.flag}), (e2e::Ints{929, 0}));
+  }
+  EXPECT_RECORDS("590 klpThread::stop 1 *|0|A\n534 cmdsEngine 1 ENG|DOWN\n595 Klpenv:delEnvIpcQRcvHdl 0 *",
+                 "database down");
+  EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
+}
+
+// After STOP the grace runs out only while an "apply" program's
+// WorkerThread rests: one still at work holds the loop past the 8 seconds,
+// and ends it as soon as it rests. Such a program checks no database.
+TEST_F(Engine, TheGraceOfAnApplyProgramWaitsForItsWorkerToRest) {
+  program("applyX");
+  g_dbRc = 929;
+  klpThread* worker = addThread("WorkerThread", KLP_THREAD_RUN, {kStop});
+  serverQueueWith(req(kStop));
+  auto start = std::chrono::steady_clock::now();
+  {
+    LoopRun run(&threads_);
+    // Past the grace, still running: without the rule it would have ended.
+    std::this_thread::sleep_for(std::chrono::milliseconds(10500));
+    EXPECT_FALSE(run.done.load());
+    worker->setState(KLP_THREAD_REST);
+    EXPECT_TRUE(e2e::waitFor([&] { return run.done.load(); }, 5000));
+    EXPECT_EQ((e2e::Ints{run.rc, run.flag}), (e2e::Ints{0, 1}));
+  }
+  EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(9));
   e2e::Reply r;
   ASSERT_TRUE(receive(&r));
   EXPECT_EQ(r.header.func, kStop);
-  EXPECT_EQ(a->cmdList->count, 1);  // the request itself, by interest
-  EXPECT_EQ(b->cmdList->count, 1);
-  // Already stopping: the sequence sends nothing more.
-  EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
-  EXPECT_EQ(a->cmdList->count, 1);
-
-  cmdsState fresh;
-  cmdsInitState(&fresh, CMDS_MODE_NORMAL, nullptr);
-  a->cmdList->delList();
-  b->cmdList->delList();
-  EXPECT_EQ(cmdsStartStop(&fresh, &threads_), 0);
-  EXPECT_EQ(a->cmdList->count, 1);
-  EXPECT_EQ(b->cmdList->count, 0);  // already stopped
-  MsgQe* qe = takeQe(a);
-  ASSERT_NE(qe, nullptr);
-  EXPECT_EQ(qe->QeFunc, kStop);
-  EXPECT_EQ(qe->QeResponseId, 0);
-  deleteMsgQe(qe);
+  EXPECT_EQ((e2e::Ints{takeFunc(worker), takeFunc(worker)}), (e2e::Ints{kStop, -1}));  // the request itself
+  EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
 }
 
+// A requester whose reply queue is full is dropped, not waited for: the
+// first message goes only when there is room at once, and what is left of
+// a long reply gets little time.
 TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
-  // Its reply queue is full. A taker makes room once the engine is done
-  // (after 5 s if the engine is still waiting for room): what reaches the
-  // queue then shows whether the engine waited.
   const struct {
-    const char* what;
-    int waiting;
-    int threads;
+    int waiting, threads;
     bool firstPiece;  // the STATUS reply's first piece found room
-  } cases[] = {
-      {"full: nothing goes", 10, 3, false},
-      {"room for the first of two pieces only", 9, 250, true},
-  };
+  } cases[] = {{10, 3, false}, {9, 250, true}};
   IpcMsg* other = nullptr;
   ASSERT_EQ(createReplyMsg(&other, 44, 99, 1), 0);
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.what);
-    klptest::ProcessLogger log(5, dir_->path(), "eng.log");
     while (threads_.count < c.threads) addThread("T", KLP_THREAD_REST);
     hsvRC prc;
     for (int i = 0; i < c.waiting; ++i) ASSERT_EQ(putIpcMsgWait(&reply_, other, 0, &prc), 0);
     std::atomic<bool> done{false};
-    std::thread taker([&] {
+    std::thread taker([&] {  // makes room once the engine is done, or after 5 s
       e2e::waitFor([&] { return done.load(); }, 5000);
-      char buf[HSV_MAX_MSG_SIZE];
-      size_t got = 0;
-      reply_.get(buf, sizeof buf, &got, 1000);
+      e2e::Reply r;
+      receive(&r, 1000);
     });
-    EXPECT_EQ(handle(e2e::RawClient::request(kStatus, 0, nullptr)), 0);
+    EXPECT_EQ(handle(req(kStatus)), 0);
     done = true;
     taker.join();
-    // Left: the others but the one taken, then the pieces that found room.
     std::vector<std::pair<int32_t, int32_t>> left, want(c.waiting - 1, {99, 0});
     for (e2e::Reply r; receive(&r, 0);) left.emplace_back(r.header.func, r.header.pieceNo);
     if (c.firstPiece) want.emplace_back(kStatus, 1);
-    EXPECT_EQ(left, want);
-    std::string text = logText();
-    EXPECT_EQ(e2e::countOf(text, "KLP0508E"), 1u) << text;
-    EXPECT_NE(text.find("\"805\""), std::string::npos) << text;
-    remove((dir_->path() + "eng.log").c_str());
+    EXPECT_EQ(left, want) << c.threads;
+    EXPECT_RECORDS("508 cmdsEngine 1 (mqueue, /klpq.*, 48)\n589 cmdsEngine 1 cmdsEngine|805|HSVHIPCQueue::put\n"
+                   "8999 cmdsEngine 1 *", c.threads);
   }
   freeIpcMsg(other);
 }
 
+// A thread that does not take its commands gets at most 100; the stop
+// sequence still reaches it.
 TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
-  klptest::ProcessLogger log(5, dir_->path(), "eng.log");
   klpThread* stuck = addThread("Stuck", KLP_THREAD_REST, {kPrune});
   klpThread* taking = addThread("Taking", KLP_THREAD_REST, {kPrune});
   for (int i = 0; i < 102; ++i) {
-    ASSERT_EQ(handle(e2e::RawClient::request(kPrune, 0, nullptr, 0)), 0);
-    deleteMsgQe(takeQe(taking));  // this one takes its commands
+    ASSERT_EQ(handle(req(kPrune, 0, 0)), 0);
+    EXPECT_EQ(takeFunc(taking), kPrune);
   }
   EXPECT_EQ(stuck->cmdList->count, 100);
-  EXPECT_EQ(taking->cmdList->count, 0);
-  std::string text = logText();
-  EXPECT_EQ(e2e::countOf(text, "KLP8054E"), 2u) << text;
-  EXPECT_NE(text.find("The thread \"Stuck\" has \"100\" commands waiting; the command with "
-                      "function code \"22\" is not passed to it."),
-            std::string::npos)
-      << text;
+  EXPECT_RECORDS("8054 cmdsEngine 1 Stuck|100|22\n8054 cmdsEngine 1 Stuck|100|22", "cap");
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
-  EXPECT_EQ(stuck->cmdList->count, 101);
-}
-
-TEST_F(Engine, WithoutAServerQueueTheEngineReports804) {
-  int32_t flag = 0;
-  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_NORMAL, &flag), 804);
-}
-
-TEST_F(Engine, OnePassKeepsTheQueueAndAnUnavailableDatabaseGives929) {
-  klpEnv* env = klpGetEnv();
-  ASSERT_EQ(setEnvIpcQRcvHdl(env), 0);
-  std::string queue = e2e::serverQueuePath(*dir_, "ENG");
-  ASSERT_TRUE(klptest::queueExists(queue));
-  addThread("A", KLP_THREAD_REST);
-  int32_t flag = 0;
-  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_ONE_PASS, &flag), 0);
-  EXPECT_TRUE(klptest::queueExists(queue));
-  g_dbRc = 929;
-  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_ONE_PASS, &flag), 929);
-  EXPECT_TRUE(klptest::queueExists(queue));
-  delEnvIpcQRcvHdl(env);
-  EXPECT_FALSE(klptest::queueExists(queue));
-}
-
-TEST_F(Engine, ThreadsThatDoNotStopEndTheLoopAfterTheGraceAndTheQueueGoes) {
-  klpEnv* env = klpGetEnv();
-  ASSERT_EQ(setEnvIpcQRcvHdl(env), 0);
-  std::string queue = e2e::serverQueuePath(*dir_, "ENG");
-  klpThread* stubborn = addThread("Stubborn", KLP_THREAD_REST);
-  {
-    HSVResID id;
-    HSVHIPCQueue server;
-    ASSERT_EQ(hsvIPCGetQueResID(queue.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
-    ASSERT_EQ(server.attach(id), ECF_OK);
-    auto m = e2e::RawClient::request(kStop, 0, nullptr);
-    ASSERT_EQ(server.put(m.data(), m.size()), ECF_OK);
-    server.detach();
-  }
-  auto start = std::chrono::steady_clock::now();
-  int32_t flag = 0;
-  EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_NORMAL, &flag), 0);
-  auto secs = std::chrono::duration_cast<std::chrono::seconds>(std::chrono::steady_clock::now() -
-                                                               start)
-                  .count();
-  EXPECT_EQ(flag, 1);
-  EXPECT_GE(secs, 8);
-  e2e::Reply r;
-  ASSERT_TRUE(receive(&r));
-  EXPECT_EQ(r.header.func, kStop);
-  EXPECT_EQ(stubborn->cmdList->count, 1);
-  EXPECT_FALSE(klptest::queueExists(queue));
+  EXPECT_EQ((e2e::Ints{stuck->cmdList->count, taking->cmdList->count}), (e2e::Ints{101, 1}));
+  EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);  // once stopping, nothing more is sent
+  EXPECT_EQ(taking->cmdList->count, 1);
 }
 
 }  // namespace

@@ -130,6 +130,45 @@ std::vector<std::string> lines(const std::string& text) {
   return out;
 }
 
+class LogCapture::Recorder : public msgLoggerU {
+ public:
+  Recorder() : msgLoggerU(MSG_APP_KLPKCCMD, 0) { loadBuiltinMsgs(builtinMsgTable); }
+  std::vector<std::string> records;
+
+  void setRouting(logMsg* r) override {
+    char qt[MSG_QUALIFIER_MAX + MSG_THREAD_NAME_MAX + 8];
+    qualifierAndThread(r->threadName, qt, sizeof qt);
+    int from = 0, to = r->valueCount;
+    auto is = [&](int i, const char* v) { return i < to && strcmp(r->values[i], v) == 0; };
+    if (is(0, getApplicationName()) && is(1, qt)) from = 2;
+    else if (is(0, qt)) from = 1;
+    while (to > from && is(to - 1, " ")) --to;
+    int kind = r->routing == 12 ? 0 : (r->routing & MSG_DEST_STDOUT) ? 2 : 1;
+    std::string line = std::to_string(r->internalNumber ? r->internalNumber : r->msgNumber) +
+                       " " + r->origin + " " + std::to_string(kind) + " ";
+    for (int i = from; i < to; ++i) line += (i > from ? "|" : "") + std::string(r->values[i]);
+    records.push_back(line);
+    r->routing = 0;
+  }
+};
+
+LogCapture::LogCapture() : logger_(new Recorder), saved_(klpGetProcessLogger()) {
+  klpSetProcessLogger(logger_);
+}
+
+LogCapture::~LogCapture() {
+  klpSetProcessLogger(saved_);
+  delete logger_;
+}
+
+msgLogger* LogCapture::get() const { return logger_; }
+
+std::vector<std::string> LogCapture::take() {
+  std::vector<std::string> r;
+  r.swap(logger_->records);
+  return r;
+}
+
 Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs) {
   static int serial = 0;
   std::string base = dir + "child" + std::to_string(++serial);

@@ -75,6 +75,27 @@ std::string readFile(const std::string& path);
 // Lines of a text, without their line feeds.
 std::vector<std::string> lines(const std::string& text);
 
+// Messages issued through the process logger, recorded as their callers gave
+// them, one text each: "number origin kind values", the values joined by "|"
+// (kind 0 log file, 1 by severity, 2 console; the header values the logger
+// puts in front and the blank pads are left out). Installed as the process
+// logger for the object's life; recorded messages are not written anywhere.
+class LogCapture {
+ public:
+  LogCapture();
+  ~LogCapture();
+  LogCapture(const LogCapture&) = delete;
+  LogCapture& operator=(const LogCapture&) = delete;
+  msgLogger* get() const;
+  // The records since the last call.
+  std::vector<std::string> take();
+
+ private:
+  class Recorder;
+  Recorder* logger_;
+  msgLogger* saved_;
+};
+
 // Runs body in a forked child whose standard output and error go to files
 // under dir (ending in "/"); it exits with body's answer or is killed after
 // timeoutMs.
