@@ -1,419 +1,440 @@
-// Registry rules that can really break: table checks, source priority,
-// quoted strings, type checks, LOGSTDOUT mirroring, the query message bytes
-// and the parsing of a query message received from another process.
+// The registry: table checks, every setter's rule and refusal with the
+// records it logs, the command-line steps, the query message bytes and the
+// parsing of a query message received from another process.
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <clocale>
-#include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <memory>
+#include <sstream>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "common/msg/msglogger.h"
 #include "common/parms/klpparm.h"
-#include "common/parms/parmutil.h"
 #include "common/util/klprc.h"
 #include "tests/testing/klptest.h"
 
 namespace {
 
+using Records = std::vector<std::string>;
+
 ParmEntry intEntry(int index, const char* name, int lo, int hi, int def) {
-  return makeParmEntry(index, name, 0, PARM_INTEGER, lo, hi, def, nullptr, 0, 1, 0);
+  return makeParmEntry(index, name, 0, PARM_INTEGER, lo, hi, def, nullptr, 0, 1, 1);
 }
 ParmEntry strEntry(int index, const char* name, int max, const char* def, int display = 1) {
   return makeParmEntry(index, name, 0, PARM_STRING, -1, max, -1, def, 0, display, 0);
 }
 
-// A small registry with one parameter of each kind; index 4 is LOGSTDOUT.
-std::vector<ParmEntry> smallTable() {
-  return {strEntry(0, "SERVER", 40, ""),
-          intEntry(1, "COUNT", 1, 100, 42),
-          strEntry(2, "SCHEMA", 8, "KLP"),
-          makeParmEntry(3, "GO", 0, PARM_COMMAND, -1, -1, -1, nullptr, 0, 0, 0),
-          makeParmEntry(4, "LOGSTDOUT", 0, PARM_BOOLEAN, -1, -1, -1, nullptr, 0, 1, 0),
-          strEntry(5, "HIDDEN", 10, "x", 0),
-          strEntry(6, "SOMETIMES", 10, "", -1)};
+// A slot as "value@source" (a COMMAND as "flag:text@source").
+std::string state(const klpParmClass& p, int i) {
+  const ParmEntry* s = p.peekSlot(i);
+  std::string v = s->type == PARM_INTEGER   ? std::to_string(s->intValue)
+                  : s->type == PARM_BOOLEAN ? std::to_string(s->boolValue)
+                  : s->type == PARM_COMMAND ? std::to_string(s->boolValue) + ":" + s->strValue
+                                            : s->strValue;
+  return v + "@" + std::to_string(s->source);
+}
+std::string states(const klpParmClass& p) {  // slots 0 to 4
+  return state(p, 0) + " " + state(p, 1) + " " + state(p, 2) + " " + state(p, 3) + " " + state(p, 4);
 }
 
-size_t countOf(const std::string& text, const char* what) {
-  size_t n = 0;
-  for (size_t p = text.find(what); p != std::string::npos; p = text.find(what, p + 1)) ++n;
-  return n;
-}
-
-// A process logger and the small registry, with stdout captured on demand.
+// A logger that keeps what is issued; a registry of one parameter of each kind, made
+// current, numbered as every program numbers them (8 matched by its first 5 characters);
+// a UTF-8 user locale; a private working directory (the password file's place).
 class ParmTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    logger_ = std::make_unique<klptest::ProcessLogger>();
-    auto t = smallTable();
+    setenv("LC_ALL", "C.UTF-8", 1);
+    ASSERT_EQ(chdir(dir_.path().c_str()), 0);
+    fresh();
+  }
+  void TearDown() override { EXPECT_EQ(chdir(cwd_.c_str()), 0); }
+  void fresh() {
+    const ParmEntry t[9] = {
+        strEntry(0, "SERVER", 40, ""), intEntry(1, "COUNT", 1, 100, 42),
+        strEntry(2, "SCHEMA", 8, "KLP"),
+        makeParmEntry(3, "GO", 0, PARM_COMMAND, -1, -1, -1, nullptr, 0, 0, 0),
+        makeParmEntry(4, "LOGSTDOUT", 0, PARM_BOOLEAN, -1, -1, -1, nullptr, 0, 1, 1),
+        strEntry(5, "SOMETIMES", 10, "", -1), strEntry(6, "PWDFILE", 1040, "", 0),
+        strEntry(7, "PATH", 1040, "", 0),
+        makeParmEntry(8, "LIMIT_COUNT", 5, PARM_INTEGER, 0, 9, 0, nullptr, 0, 0, 1)};
     int rc = -1;
-    p_ = std::make_unique<klpParmClass>(t.data(), static_cast<int>(t.size()), &rc);
-    ASSERT_EQ(rc, 0);
-  }
-  void TearDown() override {
-    klpSetCurrentParms(nullptr);
     p_.reset();
-    logger_.reset();
+    p_ = std::make_unique<klpParmClass>(t, 9, &rc);
+    ASSERT_EQ(rc, 0);
+    p_->setTableName("MYTABLE");
+    p_->setUsageText("usage\n");
+    klpSetCurrentParms(p_.get());
+    log_.get()->setConsoleFlag(0);
+    log_.take();
   }
-  static void begin() {
-    fflush(stdout);
-    ::testing::internal::CaptureStdout();
+  int parse(std::vector<std::string> args, const char* sid = nullptr) {
+    args.insert(args.begin(), "prog");
+    std::vector<char*> argv;
+    for (auto& a : args) argv.push_back(a.data());
+    sid ? setenv("ORACLE_SID", sid, 1) : unsetenv("ORACLE_SID");
+    return p_->processCommandLine(static_cast<int>(args.size()), argv.data());
   }
-  static std::string end() {
-    fflush(stdout);
-    return ::testing::internal::GetCapturedStdout();
-  }
-  std::unique_ptr<klptest::ProcessLogger> logger_;
+
+  std::string cwd_ = std::filesystem::current_path().string();
+  klptest::TmpDir dir_;
+  klptest::ProcessLogger log_;
   std::unique_ptr<klpParmClass> p_;
 };
 
-TEST_F(ParmTest, ConstructorRefusesBadTables) {
+TEST_F(ParmTest, ConstructorRefusesBadTablesAndGettersTheirMisuse) {
   // 65 entries: refused as a whole, nothing readable afterwards.
-  std::vector<ParmEntry> big;
-  for (int i = 0; i < 65; ++i) big.push_back(intEntry(i % 64, "P", 0, 9, 0));
+  std::vector<ParmEntry> big(65, intEntry(0, "P", 0, 9, 0));
   int rc = -5;
-  begin();
-  klpParmClass tooMany(big.data(), 65, &rc);
-  int32_t v = tooMany.getParmInt(0);
-  std::string out = end();
-  EXPECT_EQ(rc, 0);
-  EXPECT_EQ(tooMany.getCount(), 0);
-  EXPECT_EQ(v, -1);
-  EXPECT_EQ(out,
+  std::unique_ptr<klpParmClass> p;
+  EXPECT_EQ(klptest::stdoutOf([&] {
+              p = std::make_unique<klpParmClass>(big.data(), 65, &rc);
+              EXPECT_EQ(p->getParmInt(0), -1);
+            }),
             "klpParmClass: Error: parameter count (65) is out of range (0-64).\n"
             "Parameter index 0 is out of range.\n");
+  EXPECT_EQ(rc, 0);
 
-  // Bad entries are skipped, the good ones still taken.
+  // Bad entries are skipped, the good ones (at their bounds) still taken.
   ParmEntry longName = intEntry(1, "", 0, 9, 0);
   memset(longName.name, 'N', sizeof longName.name);  // 33 characters, no terminator
-  std::string tooLong(1041, 'v');
+  const std::string v1040(1040, 'e'), v1041(1041, 'v');
   std::vector<ParmEntry> t = {intEntry(0, "GOOD", 0, 9, 5), longName,
-                              intEntry(2, "LOWDEFAULT", 10, 20, 3), strEntry(6, "FAR", 10, ""),
-                              strEntry(3, "LONGDEFAULT", 2000, tooLong.c_str())};
-  begin();
-  klpParmClass bad(t.data(), static_cast<int>(t.size()), &rc);
-  out = end();
+                              intEntry(2, "LOW", 10, 20, 9), intEntry(3, "HIGH", 10, 20, 21),
+                              strEntry(10, "FAR", 10, ""), strEntry(4, "LONG", 2000, v1041.c_str()),
+                              strEntry(5, "EDGE", 1040, v1040.c_str()),
+                              intEntry(6, "BOTTOM", 10, 20, 10), intEntry(7, "TOP", 10, 20, 20)};
+  EXPECT_EQ(klptest::stdoutOf([&] { p = std::make_unique<klpParmClass>(t.data(), 9, &rc); }),
+            "klpParmClass: Error: length of parameter name " + std::string(33, 'N') +
+                " is greater than max (32).\n"
+                "klpParmClass: Error: default value (9) for parameter LOW is out of range (10-20)\n"
+                "klpParmClass: Error: default value (21) for parameter HIGH is out of range (10-20)\n"
+                "klpParmClass: Error: parameter index (10) for parameter FAR is out of range (0-9).\n"
+                "klpParmClass: Error: length of parameter value " + v1041 +
+                " for parameter LONG is greater than max (1040)\n");
   EXPECT_EQ(rc, KLP_RC_BAD_PARM);
-  for (const std::string& line :
-       {"klpParmClass: Error: length of parameter name " + std::string(33, 'N') +
-            " is greater than max (32).\n",
-        std::string("klpParmClass: Error: default value (3) for parameter LOWDEFAULT is out "
-                    "of range (10-20)\n"),
-        std::string("klpParmClass: Error: parameter index (6) for parameter FAR is out of "
-                    "range (0-5).\n"),
-        "klpParmClass: Error: length of parameter value " + tooLong +
-            " for parameter LONGDEFAULT is greater than max (1040)\n"})
-    EXPECT_NE(out.find(line), std::string::npos) << line;
-  EXPECT_EQ(bad.getParmInt(0), 5);
-  begin();
-  EXPECT_EQ(bad.getParmType(1), PARM_PLACEHOLDER);
-  EXPECT_STREQ(bad.getParmName(3), "KLPPLACEHOLDER");
-  end();
-
-  // An index equal to the count is stored but not readable.
+  EXPECT_EQ(state(*p, 0) + state(*p, 6) + state(*p, 7) + state(*p, 5), "5@010@020@0" + v1040 + "@0");
+  for (int refused : {1, 2, 3, 4}) EXPECT_STREQ(p->peekSlot(refused)->name, "KLPPLACEHOLDER");
+  // Getters of the wrong type or outside the count; an index equal to the
+  // count is stored but not readable.
   t = {intEntry(0, "A", 0, 9, 1), intEntry(2, "C", 0, 9, 7)};
-  klpParmClass p(t.data(), 2, &rc);
+  p = std::make_unique<klpParmClass>(t.data(), 2, &rc);
+  EXPECT_EQ(klptest::stdoutOf([&] {
+              EXPECT_EQ(p_->getParmInt(2), -1);
+              EXPECT_EQ(p_->getParmBool(1), 0);
+              EXPECT_EQ(p_->getParmString(4), nullptr);
+              EXPECT_EQ(p_->getParmString(3), nullptr);  // a COMMAND is no STRING
+              EXPECT_EQ(p_->getParmType(-1), -1);
+              EXPECT_EQ(p_->getParmName(9), nullptr);
+              EXPECT_EQ(p->getParmSource(2), -1);
+              EXPECT_EQ(p->setParm(2, 3, PARM_SRC_COMMANDLINE), 2002);
+            }),
+            "Parameter index 2 is not of type INTEGER.\nParameter index 1 is not of type BOOLEAN.\n"
+            "Parameter index 4 is not of type STRING.\nParameter index 3 is not of type STRING.\n"
+            "Parameter index -1 is out of range.\nParameter index 9 is out of range.\n"
+            "Parameter index 2 is out of range.\nParameter index 2 is out of range.\n");
   EXPECT_EQ(rc, 0);
-  begin();
-  EXPECT_EQ(p.getParmInt(2), -1);
-  EXPECT_EQ(p.setParm(2, 3, PARM_SRC_COMMANDLINE), KLP_RC_BAD_PARM);
-  EXPECT_EQ(end(), "Parameter index 2 is out of range.\nParameter index 2 is out of range.\n");
-  // With 64 entries an index of 64 has no slot to go to: refused.
-  big.resize(63);
-  big.push_back(intEntry(64, "EDGE", 0, 9, 0));
-  begin();
-  klpParmClass edge(big.data(), 64, &rc);
-  out = end();
-  EXPECT_EQ(rc, KLP_RC_BAD_PARM);
-  EXPECT_NE(out.find("parameter index (64) for parameter EDGE is out of range (0-64)"),
-            std::string::npos);
+  EXPECT_EQ(std::to_string(p_->getParmInt(1)) + p_->getParmString(2) + std::to_string(p_->getParmBool(4)) +
+                p_->getParmName(8) + std::to_string(p_->getParmType(3)) + std::to_string(p_->getParmSource(4)),
+            "42KLP0LIMIT_COUNT30");
+  big[64] = intEntry(64, "EDGE", 0, 9, 0);  // with 64 entries there is no slot 64 to go to
+  EXPECT_NE(klptest::stdoutOf([&] { klpParmClass edge(big.data() + 1, 64, &rc); })
+                .find("parameter index (64) for parameter EDGE is out of range (0-64)"), std::string::npos);
+  EXPECT_EQ(rc, 2002);
 }
 
-TEST_F(ParmTest, GettersOfTheWrongTypeAnswerTheirFailureValue) {
-  klpParmClass& p = *p_;
-  begin();
-  EXPECT_EQ(p.getParmInt(2), -1);
-  EXPECT_EQ(p.getParmBool(1), 0);
-  EXPECT_EQ(p.getParmString(4), nullptr);
-  EXPECT_EQ(p.getParmString(3), nullptr);  // a COMMAND is not a STRING
-  EXPECT_EQ(p.getParmType(-1), -1);
-  EXPECT_EQ(p.getParmSource(7), -1);
-  EXPECT_EQ(p.getParmName(64), nullptr);
-  EXPECT_EQ(end(),
-            "Parameter index 2 is not of type INTEGER.\n"
-            "Parameter index 1 is not of type BOOLEAN.\n"
-            "Parameter index 4 is not of type STRING.\n"
-            "Parameter index 3 is not of type STRING.\n"
-            "Parameter index -1 is out of range.\n"
-            "Parameter index 7 is out of range.\n"
-            "Parameter index 64 is out of range.\n");
-}
-
-// Priority, and LOGSTDOUT mirrored by every setter that stores it.
-TEST_F(ParmTest, HigherSourcesAreNeverReplacedByLowerOnes) {
-  klpParmClass& p = *p_;
-  EXPECT_EQ(p.setParm(1, 10, PARM_SRC_CHGPARMS), 0);
-  EXPECT_EQ(p.setParm(1, 20, PARM_SRC_COMMANDLINE), 0);  // dropped, still 0
-  EXPECT_EQ(p.getParmInt(1), 10);
-  EXPECT_EQ(p.getParmSource(1), PARM_SRC_CHGPARMS);
-  EXPECT_EQ(p.setParm(1, 30, PARM_SRC_KAPPLY), 0);
-  EXPECT_EQ(p.getParmInt(1), 30);
-  EXPECT_EQ(p.setParm(2, "ABC", PARM_SRC_SYSTEM), 0);
-  EXPECT_EQ(p.setParm(2, "XYZ", PARM_SRC_COMMANDLINE), 0);
-  EXPECT_STREQ(p.getParmString(2), "ABC");
-
-  ASSERT_EQ(logger_->get()->getConsoleFlag(), 0);
-  p.setParmBool(4, 1, PARM_SRC_COMMANDLINE);
-  EXPECT_EQ(logger_->get()->getConsoleFlag(), 1);
-  p.setBool(4, 'n', PARM_SRC_COMMANDLINE);
-  EXPECT_EQ(logger_->get()->getConsoleFlag(), 0);
-  p.setParmValue(4, "yes", PARM_SRC_CHGPARMS);
-  EXPECT_EQ(logger_->get()->getConsoleFlag(), 1);
-  // Dropped by priority: the flag follows the stored value, not the request.
-  EXPECT_EQ(p.setBool(4, 'N', PARM_SRC_COMMANDLINE), 0);
-  EXPECT_EQ(p.setParmBool(4, 0, PARM_SRC_TABLE), 0);
-  EXPECT_EQ(p.getParmBool(4), 1);
-  EXPECT_EQ(logger_->get()->getConsoleFlag(), 1);
-
-  // A command ignores priority.
-  EXPECT_EQ(p.setCommand(3, 1, "first", PARM_SRC_KAPPLY), 0);
-  EXPECT_EQ(p.setCommand(3, 1, "second", PARM_SRC_DEFAULT), 0);
-  EXPECT_STREQ(p.getCommandText(3), "second");
-  EXPECT_EQ(p.getParmSource(3), PARM_SRC_DEFAULT);
-  EXPECT_EQ(p.getNamedCommand(), 3);
-}
-
-TEST_F(ParmTest, QuotedStringsCountWithoutTheirQuotes) {
-  klpParmClass& p = *p_;
-  // Schema holds at most 8 characters.
-  EXPECT_EQ(p.setParm(2, "\"ABCDEFGH\"", PARM_SRC_COMMANDLINE), 0);
-  EXPECT_STREQ(p.getParmString(2), "\"ABCDEFGH\"");  // kept with its quotes
-  begin();
-  EXPECT_EQ(p.setParm(2, "\"ABCDEFGHI\"", PARM_SRC_COMMANDLINE), KLP_RC_BAD_PARM);
-  EXPECT_EQ(p.setParm(2, "ABCDEFGH\"", PARM_SRC_COMMANDLINE), KLP_RC_BAD_PARM);
-  std::string out = end();
-  EXPECT_NE(out.find("KLP0502E"), std::string::npos);
-  EXPECT_NE(out.find("\"9\""), std::string::npos);  // effective length of the first
-  EXPECT_STREQ(p.getParmString(2), "\"ABCDEFGH\"");
-
-  // Two quotes alone: the value becomes empty and the source stays.
-  EXPECT_EQ(p.setParm(2, "\"\"", PARM_SRC_SYSTEM), 0);
-  EXPECT_STREQ(p.getParmString(2), "");
-  EXPECT_EQ(p.getParmSource(2), PARM_SRC_COMMANDLINE);
-  // A lone quote is an ordinary one-character text; setting a slot from its
-  // own text must not read freed memory.
-  EXPECT_EQ(p.setParm(2, "\"", PARM_SRC_SYSTEM), 0);
-  EXPECT_EQ(p.setParm(2, p.getParmString(2), PARM_SRC_SYSTEM), 0);
-  EXPECT_STREQ(p.getParmString(2), "\"");
-}
-
-TEST_F(ParmTest, SetterRefusalsIssueTheirMessages) {
-  klpParmClass& p = *p_;
-  p.setTableName("MYTABLE");
-  std::string longText(1041, 'c');
-  begin();
-  EXPECT_EQ(p.setParm(1, 101, PARM_SRC_COMMANDLINE), KLP_RC_BAD_PARM);  // 503
-  EXPECT_EQ(p.setParm(1, 0, PARM_SRC_TABLE), KLP_RC_BAD_PARM);          // 541
-  EXPECT_EQ(p.setParm(2, 5, PARM_SRC_COMMANDLINE), KLP_RC_BAD_PARM);    // 501
-  EXPECT_EQ(p.setBool(4, 'x', PARM_SRC_COMMANDLINE), KLP_RC_BAD_PARM);  // 500
-  EXPECT_EQ(p.setBool(4, '1', PARM_SRC_TABLE), KLP_RC_BAD_PARM);        // 541
-  EXPECT_EQ(p.setCommand(1, 1, "x", PARM_SRC_COMMANDLINE), KLP_RC_BAD_PARM);  // 501
-  EXPECT_EQ(p.setCommand(3, 1, longText.c_str(), PARM_SRC_COMMANDLINE), KLP_RC_BAD_PARM);
-  std::string out = end();
-  size_t at = 0;
-  for (const char* id : {"KLP0503E", "KLP0541E", "KLP0501E", "KLP0500E", "KLP0541E",
-                         "KLP0501E", "KLP0502E"}) {
-    at = out.find(id, at);
-    ASSERT_NE(at, std::string::npos) << id << " missing in order in:\n" << out;
-    ++at;
+// Runs steps "op slot=value@source" separated by ";" and answers the sum of
+// their rcs. Ops: i setParm INTEGER, b setParmBool, y setBool, s setParm
+// STRING, c setCommand (flag 1), v setParmValue.
+int apply(klpParmClass& p, const std::string& steps) {
+  int rc = 0;
+  std::istringstream in(steps);
+  for (std::string st; std::getline(in, st, ';');) {
+    size_t eq = st.find('='), at = st.rfind('@');
+    int slot = std::stoi(st.substr(1, eq - 1)), src = std::stoi(st.substr(at + 1));
+    std::string v = st.substr(eq + 1, at - eq - 1);
+    switch (st[0]) {
+      case 'i': rc += p.setParm(slot, std::stoi(v), src); break;
+      case 'b': rc += p.setParmBool(slot, std::stoi(v), src); break;
+      case 'y': rc += p.setBool(slot, v[0], src); break;
+      case 's': rc += p.setParm(slot, v.c_str(), src); break;
+      case 'c': rc += p.setCommand(slot, 1, v.c_str(), src); break;
+      default: rc += p.setParmValue(slot, v.c_str(), src);
+    }
   }
-  EXPECT_NE(out.find("MYTABLE"), std::string::npos);
-  EXPECT_EQ(p.getParmInt(1), 42);
-  EXPECT_EQ(p.getNamedCommand(), -1);
+  return rc;
 }
 
-TEST_F(ParmTest, SourceLabelsAndValueTexts) {
-  const char* labels[] = {"DEFAULT", "MY TABLE", "COMMANDLINE", "CHGPARMS COMMAND",
-                          "SYSTEM OVERRIDE", "K APPLY OVERRIDE", "UNKNOWN"};
-  for (int s = 0; s < 7; ++s) EXPECT_STREQ(parmSourceLabel(s, "MY TABLE"), labels[s]) << s;
-  EXPECT_STREQ(parmSourceLabel(-1, "T"), "UNKNOWN");
-
-  struct {
-    int index;
-    const char* text;
-    bool ok;
-  } cases[] = {{1, "42", true},     {1, "  +7", true}, {1, "7 ", false}, {1, "4x", false},
-               {1, "", false},      {1, "-", false},   {1, "0", false},  {1, "101", false},
-               {1, "4294967297", false},  // wraps to 1 in 32 bits
-               {4, "yes", true},    {4, "n", true},    {4, "1", false},  {4, "YESS", false},
-               {2, "anything at all", true}, {3, "x", false}};  // a COMMAND takes no value
-  for (const auto& c : cases) EXPECT_EQ(p_->isValidValue(c.index, c.text), c.ok) << c.text;
-  EXPECT_FALSE(p_->isValidValue(2, std::string(1041, 'a').c_str()));
+// Every setter: what it stores (and from which source), what it refuses and
+// the records it logs, and the logger's console flag that follows slot 4.
+TEST_F(ParmTest, SettersStoreByPriorityAndLogTheirRefusals) {
+  const std::string sp = "<klpParmClass:setParm> 35: ", sps = "<klpParmClass::setParm> 1: ",
+                    sb = "<klpParmClass:setBool> 35: ", c1040(1040, 'c'), c1041(1041, 'c');
+  // console: the logger's flag afterwards, -1 when not looked at.
+  struct { std::string steps; int rc; std::string after; Records logged; int console; } cases[] = {
+      {"i1=7@2", 0, "7@2", {}, -1}, {"i1=1@1;i1=100@1", 0, "100@1", {}, -1},
+      {"i1=0@2", 2002, "42@0", {"503 " + sp + "0|COUNT"}, -1},
+      {"i1=101@1", 2002, "42@0", {"541 " + sp + "101|COUNT|MYTABLE"}, -1},
+      {"i2=5@2", 2002, "KLP@0", {"501 " + sp + "5|SCHEMA"}, -1},
+      {"i1=10@3;i1=20@2", 0, "10@3", {}, -1},  // a lower source is dropped
+      {"i1=10@3;i1=20@3", 0, "20@3", {}, -1}, {"i1=10@3;i1=30@5", 0, "30@5", {}, -1},
+      {"b4=1@2", 0, "1@2", {}, 1}, {"b4=1@3;b4=0@2", 0, "1@3", {}, 1},
+      {"b1=1@2", 2002, "42@0", {"501 " + sp + "Y|COUNT"}, -1},
+      {"b1=0@2", 2002, "42@0", {"501 " + sp + "N|COUNT"}, -1},
+      {"y4=y@2", 0, "1@2", {}, 1}, {"y4=Y@2;y4=n@2", 0, "0@2", {}, 0},
+      {"y4=N@4;y4=Y@3", 0, "0@4", {}, 0},
+      {"y4=x@2", 2002, "0@0", {"500 " + sb + "x|LOGSTDOUT"}, -1},
+      {"y4=1@1", 2002, "0@0", {"541 " + sb + "1|LOGSTDOUT|MYTABLE"}, -1},
+      {"y1=Y@2", 2002, "42@0", {"501 " + sb + "Y|COUNT"}, -1},
+      // STRING: quotes are kept but not counted; two quotes alone empty the
+      // value and keep the source.
+      {"s2=\"ABCDEFGH\"@2", 0, "\"ABCDEFGH\"@2", {}, -1},
+      {"s2=\"ABCDEFGHI\"@2", 2002, "KLP@0", {"502 " + sps + "\"ABCDEFGHI\"|9|SCHEMA|8"}, -1},
+      {"s2=ABCDEFGH\"@2", 2002, "KLP@0", {"502 " + sps + "ABCDEFGH\"|9|SCHEMA|8"}, -1},
+      {"s2=ABC@4;s2=\"\"@5", 0, "@4", {}, -1}, {"s2=@2", 0, "@0", {}, -1},
+      {"s2=ABC@4;s2=XYZ@3", 0, "ABC@4", {}, -1}, {"s2=ABC@2;s2=XYZ@2", 0, "XYZ@2", {}, -1},
+      {"s1=x@2", 2002, "42@0", {"501 " + sps + "x|COUNT"}, -1},
+      // COMMAND: whatever the priority; an empty text keeps the source.
+      {"c3=first@5;c3=second@1", 0, "1:second@1", {}, -1}, {"c3=@2", 0, "1:@0", {}, -1},
+      {"c1=x@2", 2002, "42@0", {"501 " + sp + "x|COUNT"}, -1},
+      {"c3=" + c1040 + "@2", 0, "1:" + c1040 + "@2", {}, -1},  // a command text of at most 1040
+      {"c3=" + c1041 + "@2", 2002, "0:@0", {"502 " + sp + c1041 + "|1041|GO|1040"}, -1},
+      // A value as a CHGPARMS change brings it.
+      {"v1=77@3", 0, "77@3", {}, -1}, {"v4=yes@3;v4=no@3", 0, "0@3", {}, 0},
+      {"v1=7x@3", 2002, "42@0", {"500 " + sp + "7x|COUNT"}, -1},
+  };
+  for (const auto& c : cases) {
+    fresh();
+    EXPECT_EQ(apply(*p_, c.steps), c.rc) << c.steps;
+    EXPECT_EQ(state(*p_, c.steps[1] - '0'), c.after) << c.steps;
+    EXPECT_EQ(log_.take(), c.logged) << c.steps;
+    EXPECT_TRUE(c.console < 0 || log_.get()->getConsoleFlag() == c.console) << c.steps;
+  }
+  // A slot set from its own text must not read freed memory.
+  fresh();
+  EXPECT_EQ(apply(*p_, "s2=\"@3") + p_->setParm(2, p_->getParmString(2), 3), 0);
+  EXPECT_EQ(state(*p_, 2), "\"@3");
 }
 
-TEST_F(ParmTest, PendingChangesHoldOneRecordPerParameter) {
+TEST_F(ParmTest, ValidValuesAndPendingChanges) {
+  struct { int index; std::string text; bool ok; } cases[] = {
+               {1, "42", true},  {1, "  +7", true}, {1, "7 ", false},   {1, "4x", false},
+               {1, "", false},   {1, "-", false},   {1, "0", false},    {1, "101", false},
+               {1, "1", true},   {1, "100", true},  {1, "4294967297", false},  // wraps to 1
+               {4, "yes", true}, {4, "n", true},    {4, "No", true},    {4, "Y", true},
+               {4, "1", false},  {4, "YESS", false}, {4, "", false},    {3, "x", false},
+               {2, "any text", true}, {2, std::string(1040, 'a'), true},
+               {2, std::string(1041, 'a'), false}};
+  for (const auto& c : cases) EXPECT_EQ(p_->isValidValue(c.index, c.text.c_str()), c.ok) << c.text;
+  std::string changeable;  // by the keyword rule, never what is not changeable
+  for (const char* kw : {"count", "LOGSTDOUT", "SCHEMA", "GO", "KLPPLACEHOLDER", "X", "LIMIT", "limits_x",
+                         "LIMI", static_cast<const char*>(nullptr)})
+    changeable += std::to_string(p_->findChangeableParm(kw)) + " ";
+  EXPECT_EQ(changeable, "1 4 -1 -1 -1 -1 8 8 -1 -1 ");
+
+  // One pending record per parameter, at most 64 of them.
   klpParmClass& p = *p_;
-  EXPECT_EQ(p.addChgParm(30, "1000"), 0);
-  EXPECT_EQ(p.addChgParm(16, "200"), 0);
-  EXPECT_EQ(p.addChgParm(30, "2000"), 0);
-  EXPECT_EQ(p.getChgParmsCount(), 2);
-  EXPECT_EQ(p.getChgParmsEntry(0)->index, 30);
-  EXPECT_STREQ(p.getChgParmsEntry(0)->value, "2000");
-  EXPECT_EQ(p.getChgParmsEntry(2)->index, -1);
+  EXPECT_EQ(p.addChgParm(30, "1000") + p.addChgParm(16, "200") + p.addChgParm(30, "2000"), 0);
+  EXPECT_EQ(p.getChgParmsEntry(2)->index, -1);  // free
   for (int i = 100; i < 162; ++i) ASSERT_EQ(p.addChgParm(i, "v"), 0);
-  EXPECT_EQ(p.getChgParmsCount(), 64);
-  begin();
-  EXPECT_EQ(p.addChgParm(500, "v"), KLP_RC_BAD_PARM);
-  EXPECT_EQ(end(), "cmdParmsClass ERROR: no find room in chgparms array\n");
+  EXPECT_EQ(klptest::stdoutOf([&] { EXPECT_EQ(p.addChgParm(500, "v"), KLP_RC_BAD_PARM); }),
+            "cmdParmsClass ERROR: no find room in chgparms array\n");
   EXPECT_EQ(p.addChgParm(16, "300"), 0);  // an existing record still takes a new value
+  EXPECT_EQ(std::to_string(p.getChgParmsCount()) + " " + std::to_string(p.getChgParmsEntry(0)->index) +
+                "=" + p.getChgParmsEntry(0)->value + " " + p.getChgParmsEntry(1)->value,
+            "64 30=2000 300");
   EXPECT_EQ(p.getChgParmsEntry(64), nullptr);
 }
 
-// The exact bytes of a query message for a known registry, and its printout.
-TEST_F(ParmTest, QueryMessageBytes) {
-  klpParmClass& p = *p_;
-  ASSERT_EQ(p.setParm(0, "DB1", PARM_SRC_COMMANDLINE), 0);
-  ASSERT_EQ(p.setParmBool(4, 1, PARM_SRC_CHGPARMS), 0);
-  // Included: 0 SERVER, 1 COUNT, 2 SCHEMA, 4 LOGSTDOUT (display 1); 5 never;
-  // 6 only once it is set from somewhere.
-  std::vector<uint8_t> expected = {4, 0, 'K', 'L', 'P', 'Q', 'R', 'Y', 'M', 'G'};
-  auto record = [&](int source, const std::string& name, const std::string& value) {
-    size_t len = 40 + value.size();
-    expected.insert(expected.end(), {static_cast<uint8_t>(len), static_cast<uint8_t>(len >> 8),
-                                     static_cast<uint8_t>(source), 0,
-                                     static_cast<uint8_t>(name.size()), 0});
-    for (size_t i = 0; i < 32; ++i) expected.push_back(i < name.size() ? name[i] : 0);
-    expected.insert(expected.end(), {static_cast<uint8_t>(value.size()), 0});
-    expected.insert(expected.end(), value.begin(), value.end());
+// preCmdLine and parseCmdLine (the base processCommandLine): the values they
+// leave (slots 0 to 4 as "value@source") and every record they log.
+TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
+  const std::string v1039(1039, 'v'), v1040(1040, 'v'), k33(33, 'K');
+  const std::string pc = "<klpParmClass::parseCmdLine> 1: ", sp = "<klpParmClass:setParm> 35: ",
+                    step = "589 <klpParmClass::processCommandLi> 1: klpParmClass::processCommandLine|",
+                    pf = step + "2002|parseCmdLine", pre = step + "2002|preCmdLine";
+  // after: "" when not looked at.
+  struct { std::vector<std::string> args; const char* sid; int rc; Records logged; std::string after; } cases[] = {
+      {{"server=db", "COUNT=7", "go=Q.1"}, nullptr, 0, {}, "DB@2 7@2 KLP@0 1:Q.1@2 0@0"},
+      {{"GO"}, "db1", 0, {}, "DB1@0 42@0 KLP@0 1:@0 0@0"},
+      {{"SERVER=a", "GO"}, "db1", 0, {}, "A@2 42@0 KLP@0 1:@0 0@0"},
+      {{"COUNT=7"}, nullptr, 2002, {"524 " + pc + "SERVER", pf}, ""},
+      {{"SERVER=a", "SCHEMA=\"\""}, nullptr, 2002, {"524 " + pc + "SCHEMA", pf}, ""},
+      {{"SERVER=a", "GO", "go"}, nullptr, 2002, {"518 <klpParmClass::parseCmdLine> 1:", pf}, ""},
+      {{"SERVER=a", "KLPPLACEHOLDER=1"}, nullptr, 2002,
+       {"504 <klpParmClass:preCmdLine> 35: KLPPLACEHOLDER=1", pre}, ""},
+      {{"SERVER=a", "?"}, nullptr, 2002, {"504 " + pc + "?", pf}, ""},
+      {{"SERVER=a", k33 + "=1"}, nullptr, 2002, {"504 " + pc + k33 + "=1", pf}, ""},
+      {{"SERVER=a", "COUNT"}, nullptr, 2002, {"504 " + pc + "COUNT", pf}, ""},
+      {{"SERVER=a", "COUNT="}, nullptr, 2002, {"500 " + pc + "|COUNT", pf}, ""},
+      // Numbers: garbage, overflow, the 32-bit bounds and the slot's range.
+      {{"SERVER=a", "COUNT=12abc"}, nullptr, 2002, {"500 " + pc + "12abc|COUNT", pf}, ""},
+      {{"SERVER=a", "COUNT=99999999999999999999x"}, nullptr, 2002,
+       {"503 " + pc + "99999999999999999999x|COUNT", pf}, ""},
+      {{"SERVER=a", "COUNT=2147483647"}, nullptr, 2002, {"503 " + pc + "2147483647|COUNT", pf}, ""},
+      {{"SERVER=a", "COUNT=-2147483648"}, nullptr, 2002, {"503 " + pc + "-2147483648|COUNT", pf}, ""},
+      {{"SERVER=a", "COUNT=-2147483647"}, nullptr, 2002, {"503 " + sp + "-2147483647|COUNT", pf}, ""},
+      {{"SERVER=a", "COUNT=101"}, nullptr, 2002, {"503 " + sp + "101|COUNT", pf}, ""},
+      {{"SERVER=a", "COUNT=100", "COUNT=1"}, nullptr, 0, {}, "A@2 1@2 KLP@0 0:@0 0@0"},
+      // Switches take Y, YES, N and NO in any case.
+      {{"SERVER=a", "LOGSTDOUT"}, nullptr, 0, {}, "A@2 42@0 KLP@0 0:@0 1@2"},
+      {{"SERVER=a", "logstdout=yEs", "LOGSTDOUT=nO"}, nullptr, 0, {}, "A@2 42@0 KLP@0 0:@0 0@2"},
+      {{"SERVER=a", "LOGSTDOUT=y"}, nullptr, 0, {}, "A@2 42@0 KLP@0 0:@0 1@2"},
+      {{"SERVER=a", "LOGSTDOUT=1"}, nullptr, 2002, {"501 " + pc + "1|LOGSTDOUT", pf}, ""},
+      {{"SERVER=a", "LOGSTDOUT=YESS"}, nullptr, 2002, {"501 " + pc + "YESS|LOGSTDOUT", pf}, ""},
+      // Value length: the "=" counts to the 1040; the slot's own limit after.
+      {{"SERVER=" + v1040}, nullptr, 2002, {"502 " + pc + v1040 + "|1041|SERVER|1040", pf}, ""},
+      {{"SERVER=" + v1039}, nullptr, 2002,
+       {"502 <klpParmClass::setParm> 1: " + v1039 + "|1039|SERVER|40",
+        "589 " + pc + "klpParmClass::parseCmdLine|2002|klpParmClass::setParm", pf}, ""},
+      // The schema: taken early, checked before it is replaced and at the end.
+      {{"SERVER=a", "schema=my_s"}, nullptr, 0, {}, "A@2 42@0 MY_S@2 0:@0 0@0"},
+      {{"SERVER=a", "SCHEMA=\"My\""}, nullptr, 0, {}, "A@2 42@0 My@2 0:@0 0@0"},
+      {{"SERVER=a", "SCHEMA=a-b"}, nullptr, 2002, {"500 " + pc + "a-b|SCHEMA", pf}, ""},
+      {{"SERVER=a", "SCHEMA=\"a b\""}, nullptr, 2002, {"500 " + pc + "\"a b\"|SCHEMA", pf}, ""},
+      // Under the user's locale (UTF-8 here): letters of any script, upper-cased.
+      {{"SERVER=a", "SCHEMA=\xc3\xbc" "ber"}, nullptr, 0, {}, "A@2 42@0 \xc3\x9c" "BER@2 0:@0 0@0"},
+      {{"SERVER=a", "SCHEMA=\"\xc3\xbc" "b\""}, nullptr, 0, {}, "A@2 42@0 \xc3\xbc" "b@2 0:@0 0@0"},
+      {{"SERVER=a", "SCHEMA=\xc3\xbc-x"}, nullptr, 2002, {"500 " + pc + "\xc3\xbc-x|SCHEMA", pf}, ""},
+      {{"SERVER=a", "SCHEMA=\xff\xfe"}, nullptr, 2002, {"500 " + pc + "\xff\xfe|SCHEMA", pf}, ""},
+      {{"SERVER=a", "SCHEMA=\xe2\x82\xac"}, nullptr, 2002,  // a symbol, not a letter
+       {"500 " + pc + "\xe2\x82\xac|SCHEMA", pf}, ""},
+      {{"SCHEMA=a-b", "SCHEMA=good"}, nullptr, 2002, {"500 <klpParmClass::preCmdLine> 35: a-b|SCHEMA", pre}, ""},
+      {{"SCHEMA=ABCDEFGHI"}, nullptr, 2002,
+       {"502 <klpParmClass::setParm> 1: ABCDEFGHI|9|SCHEMA|8",
+        "589 <klpParmClass::preCmdLine> 1: klpParmClass::preCmdLine|2002|setParm", pre}, ""},
+      {{"PWDFILE=missing.aut", "SERVER=a"}, nullptr, 806,
+       {"545 " + pc + dir_.path() + "missing.aut", step + "806|parseCmdLine"}, ""},
+      {{"?"}, nullptr, 416, {step + "416|preCmdLine"}, ""},
   };
-  record(2, "SERVER", "DB1");
-  record(0, "COUNT", "42");
-  record(0, "SCHEMA", "KLP");
-  record(3, "LOGSTDOUT", "Y");
+  for (const auto& c : cases) {
+    fresh();
+    SCOPED_TRACE(c.args.back().substr(0, 40));
+    std::string out = klptest::stdoutOf([&] { EXPECT_EQ(parse(c.args, c.sid), c.rc); });
+    EXPECT_EQ(log_.take(), c.logged);
+    EXPECT_TRUE(c.after.empty() || states(*p_) == c.after) << states(*p_);
+    EXPECT_EQ(out.rfind("usage\n", 0) == 0, c.rc == 416);  // printed before anything else
+  }
+  EXPECT_STREQ(setlocale(LC_CTYPE, nullptr), "C");  // the caller's locale is untouched
+}
+
+// getPositionalDBName: a leading word that names no parameter is the server;
+// one that does is, only when no keyword and no ORACLE_SID name the server.
+TEST_F(ParmTest, LeadingServerName) {
+  const std::string w41(41, 'w'), big = "502 <klpParmClass::setParm> 1: " + w41 + "|41|SERVER|40",
+                    set = "589 <klpParmClass::getPositionalDBN> 1: klpParmClass::getPositionalDBName|2002|setParm ";
+  struct { std::vector<std::string> args; std::string sid; int rc, consumed; std::string server; Records logged; } cases[] = {
+      {{"mydb", "GO"}, "", 0, 1, "mydb@2", {}}, {{"GO"}, "", 0, 1, "GO@2", {}},
+      {{"GO"}, "db1", 0, 0, "db1@0", {}}, {{"COUNT"}, "db1", 0, 0, "db1@0", {}},
+      {{"GO", "server=x"}, "", 0, 0, "@0", {}}, {{"klpplaceholder"}, "db1", 0, 1, "klpplaceholder@2", {}},
+      {{"COUNT=1", "server=x"}, "", 0, 0, "@0", {}}, {{"COUNT=1"}, "db1", 0, 0, "@0", {}}, {{}, "", 0, 0, "@0", {}},
+      {{"COUNT=1"}, "", 2003, 0, "@0", {"524 <klpParmClass::getPositionalDBN> 1: SERVER"}},
+      {{w41}, "", 2002, 0, "@0", {big, set + "1"}}, {{"GO"}, w41, 2002, 0, "@0", {big, set + "3"}},
+  };
+  for (const auto& c : cases) {
+    fresh();
+    c.sid.empty() ? unsetenv("ORACLE_SID") : setenv("ORACLE_SID", c.sid.c_str(), 1);
+    std::vector<char*> argv;
+    for (const std::string& a : c.args) argv.push_back(const_cast<char*>(a.c_str()));
+    int consumed = -1;
+    EXPECT_EQ(p_->getPositionalDBName(static_cast<int>(argv.size()), argv.data(), &consumed), c.rc);
+    EXPECT_EQ(std::to_string(consumed) + " " + state(*p_, 0), std::to_string(c.consumed) + " " + c.server);
+    EXPECT_EQ(log_.take(), c.logged) << &c - cases;
+  }
+}
+
+TEST_F(ParmTest, CommandLineRulesForPathPasswordFileAndPriority) {
+  // The path is the working directory with its "/"; no password file there.
+  ASSERT_EQ(parse({"SERVER=a", "SCHEMA=\"Sch\""}), 0);
+  EXPECT_EQ(state(*p_, 7) + " " + state(*p_, 6), dir_.path() + "@0 @0");
+  EXPECT_STREQ(log_.get()->getProgramQualifier(), "\"Sch\"");  // as typed, before the rule
+  fclose(fopen((dir_.path() + "klppwd.aut").c_str(), "w"));
+  fresh();
+  ASSERT_EQ(parse({"SERVER=a"}), 0);
+  EXPECT_EQ(state(*p_, 6), "klppwd.aut@0");
+  fresh();
+  ASSERT_EQ(parse({"SERVER=a", "PWDFILE=klppwd.aut"}), 0);
+  EXPECT_EQ(state(*p_, 6), "klppwd.aut@2");
+  // The command line never replaces a value from CHGPARMS or above.
+  fresh();
+  ASSERT_EQ(apply(*p_, "i1=9@3;s2=OLD@4"), 0);
+  ASSERT_EQ(parse({"SERVER=a", "COUNT=7", "SCHEMA=NEW"}), 0);
+  EXPECT_EQ(states(*p_), "A@2 9@3 OLD@4 0:@0 0@0");
+}
+
+// The exact bytes of a query message for a known registry, and its printout.
+TEST_F(ParmTest, QueryMessageBytesAndPrintout) {
+  klpParmClass& p = *p_;
+  ASSERT_EQ(apply(p, "s0=DB1@2;b4=1@3"), 0);
+  // Included: 0, 1, 2 and 4 (display 1); 5 only once it is set; 6, 7 never.
+  std::string expected("\x04\x00KLPQRYMG", 10);
+  for (auto [source, name, value] : {std::tuple<int, std::string, std::string>{2, "SERVER", "DB1"},
+                                     {0, "COUNT", "42"}, {0, "SCHEMA", "KLP"}, {3, "LOGSTDOUT", "Y"}})
+    expected += std::string{static_cast<char>(40 + value.size()), 0, static_cast<char>(source), 0,
+                            static_cast<char>(name.size()), 0} +
+                name + std::string(32 - name.size(), '\0') +
+                std::string{static_cast<char>(value.size()), 0} + value;
   ASSERT_EQ(p.getQueryMsgSize(), expected.size());
-  std::vector<uint8_t> msg(p.getQueryMsgSize(), 0xEE);
+  std::string msg(p.getQueryMsgSize(), '\xEE');
   ASSERT_EQ(p.setQueryMsg(msg.data()), 0);
   EXPECT_EQ(msg, expected);
 
-  ASSERT_EQ(p.setParm(6, "\"v\"", PARM_SRC_TABLE), 0);
+  ASSERT_EQ(apply(p, "s5=\"v\"@1;b4=0@5"), 0);
   EXPECT_EQ(p.getQueryMsgSize(), expected.size() + 40 + 3);
-
-  // The round trip prints one 521 per record with its source label.
   msg.assign(p.getQueryMsgSize(), 0);
   p.setQueryMsg(msg.data());
-  begin();
+  log_.take();
+  // The same five, from the message and from the registry.
+  const Records shown = {"SERVER|DB1|COMMANDLINE", "COUNT|42|DEFAULT", "SCHEMA|KLP|DEFAULT",
+                         "LOGSTDOUT|N|K APPLY OVERRIDE", "SOMETIMES|\"v\"|MYTABLE"};
+  Records want;
+  for (std::string how : {"521 <klpParmClass:getQueryMsg> 35: ", "529 <klpParmClass::printParms> 1: "})
+    for (const std::string& v : shown) want.push_back(how + v);
   EXPECT_EQ(p.getQueryMsg(msg.data(), msg.size()), 0);
-  std::string out = end();
-  std::vector<std::string> lines;
-  for (size_t pos = 0; (pos = out.find("KLP0521I", pos)) != std::string::npos;) {
-    size_t eol = out.find('\n', pos);
-    lines.push_back(out.substr(pos, eol - pos));
-    pos = eol;
-  }
-  ASSERT_EQ(lines.size(), 5u) << out;
-  EXPECT_NE(lines[0].find("\"SERVER\" has the value \"DB1\" from \"COMMANDLINE\""),
-            std::string::npos) << lines[0];
-  EXPECT_NE(lines[3].find("\"LOGSTDOUT\" has the value \"Y\" from \"CHGPARMS COMMAND\""),
-            std::string::npos) << lines[3];
-  EXPECT_NE(lines[4].find("\"SOMETIMES\" has the value \"\"v\"\" from \"PARAMETERS TABLE\""),
-            std::string::npos) << lines[4];
-
-  // An empty selection is the bare header.
-  std::vector<ParmEntry> t = {strEntry(0, "A", 10, "", 0)};
-  int rc = -1;
-  klpParmClass none(t.data(), 1, &rc);
-  ASSERT_EQ(none.getQueryMsgSize(), 10u);
-  uint8_t head[10];
-  none.setQueryMsg(head);
-  EXPECT_EQ(memcmp(head, "\0\0KLPQRYMG", 10), 0);
-  begin();
-  EXPECT_EQ(none.getQueryMsg(head, sizeof head), 0);
-  EXPECT_EQ(end(), "");
+  p.printParms();
+  EXPECT_EQ(log_.take(), want);
+  std::string labels;
+  for (int s = -1; s < 7; ++s) labels += std::string(parmSourceLabel(s, "T")) + ",";
+  EXPECT_EQ(labels, "UNKNOWN,DEFAULT,T,COMMANDLINE,CHGPARMS COMMAND,SYSTEM OVERRIDE,"
+                    "K APPLY OVERRIDE,UNKNOWN,");
 }
 
 // A received message is trusted for nothing: every length is checked.
 TEST_F(ParmTest, MalformedQueryMessagesEndWithAnError) {
-  klpParmClass& p = *p_;
-  std::vector<uint8_t> good(p.getQueryMsgSize());
-  p.setQueryMsg(good.data());
-
-  auto check = [&](const std::vector<uint8_t>& m, size_t len, int expectedRc, size_t lines) {
-    // An exact-size copy, so that a read past the end is caught by the
-    // sanitizers.
-    std::vector<uint8_t> exact(m.begin(), m.begin() + static_cast<long>(len));
-    begin();
-    EXPECT_EQ(p.getQueryMsg(exact.data(), exact.size()), expectedRc);
-    EXPECT_EQ(countOf(end(), "KLP0521I"), lines);
+  std::string good(p_->getQueryMsgSize(), '\0');
+  p_->setQueryMsg(good.data());
+  // cut: bytes taken off the end; printed: records printed before the end.
+  struct { std::vector<std::pair<size_t, uint8_t>> patch; size_t cut; int rc, printed; } cases[] = {
+      {{}, 0, 0, 4},
+      {{{0, 0}}, good.size() - 10, 0, 0},  // the bare header of an empty selection
+      {{}, good.size() - 9, 2002, 0},  // shorter than the header
+      {{}, 1, 2002, 3},                // last value cut short
+      {{{0, 5}}, 0, 2002, 4},          // one record more than there is
+      {{{10, 39}, {11, 0}}, 0, 2002, 0},  // a record length below 40 must not loop
+      {{{10, 0}, {11, 0}}, 0, 2002, 0},
+      {{{14, 33}}, 0, 2002, 0},  // name beyond its 32 bytes
+      {{{14, 32}}, 0, 0, 4},
+      {{{48, 0xFF}, {49, 0xFF}}, 0, 2002, 0},  // value beyond the message
+      {{{10, 0xFF}, {11, 0x7F}}, 0, 2002, 0},  // record beyond the message
+      {{{12, 6}}, 0, 0, 4},                    // an unknown source
   };
-  auto patched = [&](std::initializer_list<std::pair<size_t, uint8_t>> bytes) {
-    std::vector<uint8_t> m = good;
-    for (auto [at, value] : bytes) m[at] = value;
-    return m;
-  };
-  check(good, good.size(), 0, 4);
-  check(good, 9, KLP_RC_BAD_PARM, 0);                // shorter than the header
-  check(good, good.size() - 1, KLP_RC_BAD_PARM, 3);  // last value cut short
-  check(patched({{0, 5}}), good.size(), KLP_RC_BAD_PARM, 4);  // one record more than there is
-  for (auto m : {patched({{10, 39}, {11, 0}}),      // record length below 40 must not loop
-                 patched({{10, 0}, {11, 0}}),       // a record length of 0 neither
-                 patched({{14, 33}}),               // name length beyond the 32 name bytes
-                 patched({{48, 0xFF}, {49, 0xFF}}),   // value length beyond the message
-                 patched({{10, 0xFF}, {11, 0x7F}})})  // record length beyond the message
-    check(m, m.size(), KLP_RC_BAD_PARM, 0);
-
-  // An unknown source prints "UNKNOWN".
-  auto m = patched({{12, 6}});
-  begin();
-  EXPECT_EQ(p.getQueryMsg(m.data(), m.size()), 0);
-  EXPECT_NE(end().find("from \"UNKNOWN\""), std::string::npos);
-  EXPECT_EQ(p.getQueryMsg(nullptr, 0), KLP_RC_BAD_PARM);
-}
-
-TEST_F(ParmTest, PrintParmsShowsTheDisplayedParameters) {
-  p_->setParmBool(4, 1, PARM_SRC_COMMANDLINE);  // console on, so 529 is shown
-  begin();
-  p_->printParms();
-  std::string out = end();
-  EXPECT_EQ(countOf(out, "KLP0529I"), 4u) << out;
-  EXPECT_NE(out.find("\"COUNT\" is set to \"42\" from \"DEFAULT\""), std::string::npos) << out;
-  EXPECT_EQ(out.find("HIDDEN"), std::string::npos);
-}
-
-TEST_F(ParmTest, CurrentRegistryFeedsTheLogger) {
-  klpSetCurrentParms(p_.get());
-  EXPECT_EQ(klpGetCurrentParms(), p_.get());
+  for (const auto& c : cases) {
+    // An exact-size copy, so that a read past the end is caught.
+    std::string m = good.substr(0, good.size() - c.cut);
+    for (auto [at, value] : c.patch) m[at] = static_cast<char>(value);
+    EXPECT_EQ(p_->getQueryMsg(m.data(), m.size()), c.rc) << &c - cases;
+    Records printed = log_.take();
+    EXPECT_EQ(static_cast<int>(printed.size()), c.printed);
+    EXPECT_TRUE(&c != std::end(cases) - 1 || printed[0] == "521 <klpParmClass:getQueryMsg> 35: SERVER||UNKNOWN");
+  }
+  EXPECT_EQ(p_->getQueryMsg(nullptr, 0), KLP_RC_BAD_PARM);
   p_.reset();  // a registry that goes away stops being current
   EXPECT_EQ(klpGetCurrentParms(), nullptr);
-}
-
-TEST(SchemaRule, QuotedKeepsCaseUnquotedIsUpperCased) {
-  std::string out;
-  ASSERT_TRUE(applySchemaRule("\"My_Schema\"", &out));
-  EXPECT_EQ(out, "My_Schema");
-  ASSERT_TRUE(applySchemaRule("my_schema1", &out));
-  EXPECT_EQ(out, "MY_SCHEMA1");
-  out = "unchanged";
-  for (const char* bad : {"my-schema", "\"my schema\"", "\"abc"})
-    EXPECT_FALSE(applySchemaRule(bad, &out)) << bad;
-  EXPECT_EQ(out, "unchanged");
-
-  // Multibyte values under the user's locale.
-  const char* old = getenv("LC_ALL");
-  std::string saved = old ? old : "";
-  setenv("LC_ALL", "C.UTF-8", 1);
-  EXPECT_TRUE(applySchemaRule("\xc3\xbc" "ber", &out));  // "über"
-  EXPECT_EQ(out, "\xc3\x9c" "BER");
-  EXPECT_TRUE(applySchemaRule("\"\xc3\xbc" "ber\"", &out));
-  EXPECT_EQ(out, "\xc3\xbc" "ber");
-  EXPECT_FALSE(applySchemaRule("\xff\xfe", &out));      // not UTF-8
-  EXPECT_FALSE(applySchemaRule("\xc3\xbc-x", &out));    // "-" still refused
-  EXPECT_FALSE(applySchemaRule("\xe2\x82\xac", &out));  // a symbol, not a letter
-  old ? setenv("LC_ALL", saved.c_str(), 1) : unsetenv("LC_ALL");
-  // The caller's locale is untouched.
-  EXPECT_STREQ(setlocale(LC_CTYPE, nullptr), "C");
 }
 
 }  // namespace

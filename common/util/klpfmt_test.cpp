@@ -1,50 +1,31 @@
-// Formatting and time helpers: exact texts, buffer bounds, parse round trips.
+// Formatting and time helpers: exact texts, buffer bounds, the records the
+// helpers log, and the answers worked out once per process.
 #include "common/util/klpfmt.h"
 
 #include <gtest/gtest.h>
 
-#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <functional>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "common/env/klpenv.h"
-#include "common/msg/klplog.h"
-#include "common/msg/msglogger.h"
+#include "common/parms/klpparm.h"
 #include "common/platform/hsv.h"
 #include "common/util/klprc.h"
 #include "tests/testing/klptest.h"
+#include "xqpub/xqpubparms.h"
 
 namespace {
 
 const uint8_t kLogPos[10] = {0, 1, 2, 3, 4, 5, 6, 7, 8, 9};
+const uint8_t kLsn[8] = {0x01, 0x23, 0x45, 0x67, 0x89, 0xab, 0xcd, 0xef};
 
-// Local time equals UTC while a test runs, so local texts are fixed.
-class Fmt : public ::testing::Test {
- protected:
-  void SetUp() override {
-    const char* tz = getenv("TZ");
-    hadTz_ = tz != nullptr;
-    oldTz_ = tz ? tz : "";
-    setenv("TZ", "UTC", 1);
-    tzset();
-  }
-  void TearDown() override {
-    hadTz_ ? setenv("TZ", oldTz_.c_str(), 1) : unsetenv("TZ");
-    tzset();
-  }
-  bool hadTz_ = false;
-  std::string oldTz_;
-};
-
-// A process logger writing to a log file in its own directory.
-struct LogFile {
-  klptest::TmpDir dir;
-  klptest::ProcessLogger logger{MSG_APP_KLPKCCMD, dir.path(), "fmt.log"};
-  std::string text() const { return klptest::readFile(dir.path() + "fmt.log"); }
-};
+// Local time is UTC in this test program, so local texts are fixed.
+const bool kUtc = (setenv("TZ", "UTC", 1), tzset(), true);
 
 // A variable identifier followed by bytes that must never show up.
 std::vector<uint8_t> varId(std::initializer_list<uint8_t> bytes, int16_t count) {
@@ -55,260 +36,249 @@ std::vector<uint8_t> varId(std::initializer_list<uint8_t> bytes, int16_t count) 
   return v;
 }
 
+// "answer:text" of a buffer form given `size` characters ("x" where nothing
+// was written; "overflow" when it wrote beyond them); INTO(size, call) makes
+// the call with buffer b of k = size.
+std::string into(size_t size, const std::function<int(char*, size_t)>& f) {
+  char buf[300];
+  memset(buf, 'x', sizeof buf);
+  int n = f(buf, size);
+  if (std::string(buf + size, 8) != "xxxxxxxx") return "overflow";
+  return std::to_string(n) + ":" + std::string(buf, strnlen(buf, size));
+}
+#define INTO(size, call) into(size, [&](char* b, [[maybe_unused]] size_t k) { return call; })
+
 }  // namespace
 
-TEST_F(Fmt, IdentifiersAndTheirBufferBounds) {
-  char buf[64];
-  EXPECT_EQ(24, formatLogPosWords(buf, sizeof buf, "", kLogPos, ""));
-  EXPECT_STREQ("0001:0203:0405:0607:0809", buf);
-  EXPECT_EQ(24, formatLogPosBytes(buf, sizeof buf, "", kLogPos, ""));
-  EXPECT_STREQ("0001:0203:0405:0607:0809", buf);
-  const uint8_t high[10] = {0xff, 0xfe, 0, 0, 0, 0, 0, 0, 0x80, 0x01};
-  formatLogPosWords(buf, sizeof buf, "<", high, ">");
-  EXPECT_STREQ("<fffe:0000:0000:0000:8001>", buf);
-  EXPECT_EQ(9, formatNumPair(buf, sizeof buf, "", 12, 345, ""));
-  EXPECT_STREQ("0012:0345", buf);
-  const uint8_t lsn[8] = {0x01, 0x23, 0x45, 0x67, 0x89, 0xab, 0xcd, 0xef};
-  EXPECT_EQ(16, formatLsn(buf, 50, "", lsn, ""));
-  EXPECT_STREQ("0123456789abcdef", buf);
-
+TEST(Fmt, TextsAndTheirBufferBounds) {
+  const uint8_t high[10] = {0xff, 0xfe, 0, 0, 0, 0, 0, 0, 0x80, 0x01}, three[3] = {0x00, 0xab, 0x7f};
+  const uint8_t ts[11] = {0x20, 0x26, 0x12, 0x06, 0x11, 0x43, 0x08, 0x12, 0x34, 0x56, 0x78};
+  const auto four = varId({0xde, 0xad, 0xbe, 0xef}, 4), hex = varId({0xab, 0xcd, 0x0f}, 3);
+  klpReleaseBlock& rel = klpGetEnv()->appVersion.rel;
+  const klpReleaseBlock saved = rel;
+  rel.version = 9;
   // Too small: nothing below 17 characters, else the notice; never a part.
-  memset(buf, 'x', sizeof buf);
-  EXPECT_EQ(0, formatLogPosWords(buf, 10, "", kLogPos, ""));
-  EXPECT_EQ(0, formatLogPosBytes(buf, 16, "", kLogPos, ""));
-  EXPECT_EQ('x', buf[0]);
-  EXPECT_EQ(15, formatLogPosWords(buf, 20, "", kLogPos, ""));
-  EXPECT_STREQ("...buffer full\n", buf);
-  EXPECT_EQ(15, formatLogPosWords(buf, 39, "ab", kLogPos, "c"));  // prefix + suffix + 36
-  EXPECT_EQ(27, formatLogPosWords(buf, 40, "ab", kLogPos, "c"));
-  EXPECT_EQ(15, formatLogPosBytes(buf, 41, "", kLogPos, ""));
-  EXPECT_EQ(24, formatLogPosBytes(buf, 42, "", kLogPos, ""));
-  EXPECT_EQ(15, formatLsn(buf, 18, "ab", lsn, ""));
-  EXPECT_EQ(16, formatLsn(buf, 19, "ab", lsn, ""));
+  const std::string full = "15:...buffer full\n";
+  const std::pair<std::string, std::string> cases[] = {
+      {INTO(64, formatLogPosWords(b, k, "<", high, ">")), "26:<fffe:0000:0000:0000:8001>"},
+      {INTO(17, formatLogPosWords(b, k, "", kLogPos, "")), full},
+      {INTO(39, formatLogPosWords(b, k, "ab", kLogPos, "c")), full},  // prefix + suffix + 36
+      {INTO(40, formatLogPosWords(b, k, "ab", kLogPos, "c")), "27:ab0001:0203:0405:0607:0809c"},
+      {INTO(16, formatLogPosBytes(b, k, "", kLogPos, "")), "0:xxxxxxxxxxxxxxxx"},
+      {INTO(41, formatLogPosBytes(b, k, "", kLogPos, "")), full},
+      {INTO(42, formatLogPosBytes(b, k, "", kLogPos, "")), "24:0001:0203:0405:0607:0809"},
+      {INTO(26, formatNumPair(b, k, "a", 12, 345, "")), full},
+      {INTO(27, formatNumPair(b, k, "a", 12, 345, "")), "10:a0012:0345"},
+      {INTO(18, formatLsn(b, k, "ab", kLsn, "")), full},
+      {INTO(19, formatLsn(b, k, "ab", kLsn, "")), "16:ab0123456789abcdef"},
+      // Variable identifiers: bytes past the count are not the identifier's.
+      {INTO(64, formatVarId(b, k, "", varId({1, 2, 3, 4, 5}, 5).data(), "")), "14:0102:0304:0500"},
+      {INTO(64, formatVarId(b, k, "<", varId({0x7f}, 1).data(), ">")), "6:<7f00>"},
+      {INTO(64, formatVarId(b, k, "", varId({}, -3).data(), "")), "4:0000"},
+      {INTO(25, formatVarId(b, k, "", four.data(), "")), full},  // 2 x 4 + 4 / 2 + 15
+      {INTO(26, formatVarId(b, k, "", four.data(), "")), "9:dead:beef"},
+      {INTO(6, formatHex(hex.data(), b, k)), "-1:xxxxxx"},
+      {INTO(7, formatHex(hex.data(), b, k)), "6:ABCD0F"},
+      {INTO(6, formatHexUpper(three, 3, b, k)), "-1:xxxxxx"},
+      {INTO(7, formatHexUpper(three, 3, b, k)), "6:00AB7F"},
+      {INTO(1, formatHexUpper(three, 0, b, k)), "0:"},
+      // Local times, month first or ISO; UTC in styles C, X and D.
+      {INTO(40, formatLocalTimestamp(0, 0, b, k, false)), "14:Un-initialized"},
+      {INTO(40, formatLocalTimestamp(0, 0, b, k, true)), "19:1970-01-01T00:00:00"},
+      {INTO(40, formatLocalTimestamp(90061, 5, b, k, true)), "26:1970-01-02T01:01:01.000005"},
+      {INTO(40, formatLocalTimestamp(90061, 1, b, k, false)), "26:01-02-1970 01:01:01.000001"},
+      {INTO(40, formatLocalTimestamp(90061, 0, b, k, false)), "19:01-02-1970 01:01:01"},
+      {INTO(40, formatUtcTimestamp(0, 0, b, k, 'C')), "14:Un-initialized"},
+      {INTO(40, formatUtcTimestamp(0, 0, b, k, 'X')), "19:1970-01-01T00:00:00"},
+      {INTO(40, formatUtcTimestamp(90061, 42, b, k, 'C')), "26:01-02-1970 01:01:01.000042"},
+      {INTO(40, formatUtcTimestamp(90061, 0, b, k, 'C')), "19:01-02-1970 01:01:01"},
+      {INTO(40, formatUtcTimestamp(90061, 1, b, k, 'X')), "26:1970-01-02T01:01:01.000001"},
+      {INTO(40, formatUtcTimestamp(90061, 42, b, k, 'D')), "19:1970-01-02-01.01.01"},
+      {INTO(8, formatUtcTimestamp(90061, 0, b, k, 'D')), "7:1970-01"},
+      {INTO(8, formatUtcTimestamp(90061, 0, b, k, 'Q')), "0:xxxxxxxx"},
+      {INTO(40, formatDuration(90061, b, k)), "16:  1d  1h  1m  1s"},
+      {INTO(40, formatMillis(3723004, b, k)), "15: 1h  2m  3.004s"},
+      {INTO(40, formatMillis32(59999, b, k)), "15: 0h  0m 59.999s"},
+      {INTO(20, (secondsToTimestamp(1796557388, b), 19)), "19:2026-12-06-11.43.08"},
+      // Packed decimal: no NUL written; more than six fraction digits only
+      // from level 9.7 on, and never more than the bytes hold.
+      {INTO(12, (bcdDateToText(ts, b), 0)), "0:2026-12-06xx"},
+      {INTO(10, (bcdTimeToText(ts + 4, b), 0)), "0:11.43.08xx"},
+      {INTO(30, (rel.release = 6, bcdTimestampToText(ts, 11, 8, 8, b))),
+       "28:2026-12-06-11.43.08.12345600xx"},
+      {INTO(30, (rel.release = 7, bcdTimestampToText(ts, 11, 8, 8, b))),
+       "28:2026-12-06-11.43.08.12345678xx"},
+      {INTO(30, (rel.version = 10, rel.release = 0, bcdTimestampToText(ts, 11, 8, 8, b))),
+       "28:2026-12-06-11.43.08.12345678xx"},
+      {INTO(30, bcdTimestampToText(ts, 8, 8, 8, b)), "28:2026-12-06-11.43.08.12000000xx"},
+      {INTO(30, bcdTimestampToText(ts, 11, 3, 8, b)), "23:2026-12-06-11.43.08.123xxxxxxx"},
+      {INTO(20, bcdTimestampToText(ts, 7, 0, 8, b)), "19:2026-12-06-11.43.08x"},
+      {INTO(4, bcdTimestampToText(ts, 6, 0, 8, b)), "-1:xxxx"},
+  };
+  for (const auto& [got, want] : cases) EXPECT_EQ(got, want);
+  rel = saved;
 
-  // Variable identifiers: bytes past the count are not the identifier's.
-  EXPECT_EQ(14, formatVarId(buf, sizeof buf, "", varId({1, 2, 3, 4, 5}, 5).data(), ""));
-  EXPECT_STREQ("0102:0304:0500", buf);
-  formatVarId(buf, sizeof buf, "<", varId({0x7f}, 1).data(), ">");
-  EXPECT_STREQ("<7f00>", buf);
-  formatVarId(buf, sizeof buf, "", varId({}, -3).data(), "");
-  EXPECT_STREQ("0000", buf);
-  auto four = varId({0xde, 0xad, 0xbe, 0xef}, 4);
-  EXPECT_EQ(15, formatVarId(buf, 25, "", four.data(), ""));  // 2 x 4 + 4 / 2 + 15
-  EXPECT_EQ(9, formatVarId(buf, 26, "", four.data(), ""));
-  EXPECT_STREQ("dead:beef", buf);
-
+  // The print forms, bounded by their 256-character work buffer.
+  const std::string p239(239, 'p'), p240(240, 'p');
   testing::internal::CaptureStdout();
   printLogPosWords("[", kLogPos, "]");
   printLogPosBytes("", kLogPos, "");
   printNumPair("", 7, 1234, "|");
-  printLogPosWords(std::string(240, 'p').c_str(), kLogPos, "");  // beyond the 256 work buffer
-  EXPECT_EQ("[0001:0203:0405:0607:0809]0001:0203:0405:0607:0809\n0007:1234|...buffer full\n",
+  printVarId("<", varId({1, 2, 3}, 3).data(), ">");
+  printLsn("", kLsn, "\n");
+  printLsn(p239.c_str(), kLsn, "");
+  printLsn(p240.c_str(), kLsn, "");
+  printLogPosWords(p240.c_str(), kLogPos, "");
+  printVarId(std::string(236, 'p').c_str(), four.data(), "");
+  EXPECT_EQ("[0001:0203:0405:0607:0809]0001:0203:0405:0607:0809\n0007:1234|<0102:0300>"
+            "0123456789abcdef\n" + p239 + "0123456789abcdef...buffer full\n...buffer full\n"
+            "...buffer full\n",
             testing::internal::GetCapturedStdout());
 }
 
-TEST_F(Fmt, HexTextAndDump) {
-  char buf[16];
-  memset(buf, 'x', sizeof buf);
-  auto id = varId({0xab, 0xcd, 0x0f}, 3);
-  EXPECT_EQ(-1, formatHex(id.data(), buf, 6));
-  EXPECT_EQ('x', buf[0]);
-  EXPECT_EQ(6, formatHex(id.data(), buf, 7));
-  EXPECT_STREQ("ABCD0F", buf);
-
-  std::vector<uint8_t> data;
-  for (int i = 0; i < 25; ++i) data.push_back(static_cast<uint8_t>('A' + i));
-  data[2] = 0x07;
-  char* out = nullptr;
-  size_t len = 0;
-  FILE* f = open_memstream(&out, &len);
-  hexDump(data.size(), data.data(), f, false);
-  hexDump(4, data.data(), f, true);
-  fclose(f);
-  std::string line1 = "41420744 45464748 494A4B4C 4D4E4F50 51525354  AB.DEFGHIJKLMNOPQRST\n";
-  std::string line2 = "55565758 59       " + std::string(27, ' ') + " UVWXY\n";
-  char addr[32];
-  snprintf(addr, sizeof addr, " %08lx ",
-           static_cast<unsigned long>(reinterpret_cast<uintptr_t>(data.data())));
-  std::string line3 = std::string(addr) + "41420744 " + std::string(36, ' ') + " AB.D\n";
-  EXPECT_EQ(line1 + line2 + line3, std::string(out, len));
-  free(out);
-}
-
-TEST_F(Fmt, TimestampsParseAndPrint) {
-  int64_t s = -1;
-  int32_t us = -1;
-  ASSERT_EQ(0, timestamp2seconds("1970-01-02-01.01.01", &s, &us));
-  EXPECT_EQ(90061, s);
-  EXPECT_EQ(0, us);
-  ASSERT_EQ(0, timestamp2seconds("2026-12-06-11.43.08.123456", &s, &us));
-  EXPECT_EQ(123456, us);
-  char back[20];
-  secondsToTimestamp(s, back);
-  EXPECT_STREQ("2026-12-06-11.43.08", back);
-  ASSERT_EQ(0, timestamp2seconds("2026/12/06 11:43:08", &s, &us));  // separators not examined
-  secondsToTimestamp(s, back);
-  EXPECT_STREQ("2026-12-06-11.43.08", back);
-
-  char buf[KLP_TIMESTAMP_BUF];
-  formatLocalTimestamp(0, 0, buf, sizeof buf, false);
-  EXPECT_STREQ("Un-initialized", buf);
-  formatLocalTimestamp(90061, 5, buf, sizeof buf, true);
-  EXPECT_STREQ("1970-01-02T01:01:01.000005", buf);
-  formatLocalTimestamp(90061, 0, buf, sizeof buf, false);
-  EXPECT_STREQ("01-02-1970 01:01:01", buf);
-  struct Utc { int64_t s; int32_t us; char style; const char* text; };
-  for (const Utc& c : {Utc{0, 0, 'C', "Un-initialized"}, {90061, 0, 'X', "1970-01-02T01:01:01"},
-                       {90061, 42, 'C', "01-02-1970 01:01:01.000042"},
-                       {90061, 42, 'D', "1970-01-02-01.01.01"}}) {
-    formatUtcTimestamp(c.s, c.us, buf, sizeof buf, c.style);
-    EXPECT_STREQ(c.text, buf) << c.style;
+TEST(Fmt, IdentifiersWordsAndPads) {
+  struct { std::string in; int rc; std::string out; int32_t len; } ids[] = {
+      {"\"ab\"\"c\"", 0, "\"ab\"\"c\"", 4}, {"\"\"", 0, "\"\"", 0}, {"Mixed1", 0, "MIXED1", 6},
+      {"ab\"c", 2002, "ab\"c", -1}, {"\"abc", 2002, "\"abc", -1}, {"\"a\"b\"", 2002, "\"a\"b\"", -1},
+      {"\"", 2002, "\"", -1}, {"\"ab\"\"\"\"", 2002, "\"ab\"\"\"\"", -1}};
+  for (auto c : ids) {
+    int32_t len = -1;
+    EXPECT_EQ(c.rc, checkIdentifier(c.in.data(), &len)) << c.in;
+    EXPECT_EQ(c.out + "/" + std::to_string(c.len), c.in + "/" + std::to_string(len));
   }
-  EXPECT_EQ(0, formatUtcTimestamp(90061, 0, buf, sizeof buf, 'Q'));
-  EXPECT_STREQ("1970-01-02-01.01.01", buf);  // untouched
-  char small[8];
-  formatUtcTimestamp(90061, 0, small, sizeof small, 'D');
-  EXPECT_STREQ("1970-01", small);
-
-  formatDuration(90061, buf, sizeof buf);
-  EXPECT_STREQ("  1d  1h  1m  1s", buf);
-  formatMillis(3723004, buf, sizeof buf);
-  EXPECT_STREQ(" 1h  2m  3.004s", buf);
-  formatMillis32(59999, buf, sizeof buf);
-  EXPECT_STREQ(" 0h  0m 59.999s", buf);
-
-  // A wrong length is reported with the length, on a line of its own.
-  LogFile log;
-  EXPECT_EQ(-1, timestamp2seconds("2026-12-06-11.43.08.12345", &s, nullptr));
-  EXPECT_EQ(-1, timestamp2seconds(nullptr, &s, nullptr));
-  EXPECT_NE(std::string::npos, log.text().find("<timestamp2seconds> KLP8999D Expected timestamp "
-                                               "len of 19 or 26. Received 25\n"))
-      << log.text();
-  // Fields with more digits than a number holds are no time.
-  for (const char* huge : {"99999999999999999999999999", "2026-12-06-11.999999999999",
-                           "2026-12-999999999999999999"}) {
-    s = 7;
-    EXPECT_EQ(-1, timestamp2seconds(huge, &s, nullptr)) << huge;
-    EXPECT_EQ(0, s) << huge;
-  }
-  EXPECT_EQ(5u, klptest::lines(log.text()).size()) << log.text();
-}
-
-TEST_F(Fmt, PackedDecimalDatesAndFractionPrecision) {
-  char out[40];
-  memset(out, '#', sizeof out);
-  const uint8_t date[4] = {0x20, 0x26, 0x12, 0x06};
-  bcdDateToText(date, out);
-  EXPECT_EQ("2026-12-06#", std::string(out, 11));  // no NUL written
-  const uint8_t time[3] = {0x11, 0x43, 0x08};
-  bcdTimeToText(time, out);
-  EXPECT_EQ("11.43.08", std::string(out, 8));
-
-  const uint8_t ts[11] = {0x20, 0x26, 0x12, 0x06, 0x11, 0x43, 0x08, 0x12, 0x34, 0x56, 0x78};
-  klpReleaseBlock& rel = klpGetEnv()->appVersion.rel;
-  klpReleaseBlock saved = rel;
-  rel.version = 9;
-  rel.release = 5;  // before 9.7: six fraction digits at most
-  memset(out, '#', sizeof out);
-  EXPECT_EQ(28, bcdTimestampToText(ts, sizeof ts, 8, 8, out));
-  EXPECT_EQ("2026-12-06-11.43.08.12345600#", std::string(out, 29));
-  rel.release = 7;
-  EXPECT_EQ(28, bcdTimestampToText(ts, sizeof ts, 8, 8, out));
-  EXPECT_EQ("2026-12-06-11.43.08.12345678", std::string(out, 28));
-  EXPECT_EQ(28, bcdTimestampToText(ts, 8, 8, 8, out));  // only the bytes that exist
-  EXPECT_EQ("2026-12-06-11.43.08.12000000", std::string(out, 28));
-  EXPECT_EQ(-1, bcdTimestampToText(ts, 6, 0, 8, out));
-  rel = saved;
-}
-
-TEST_F(Fmt, StringCopyIdentifiersWordsAndPads) {
-  LogFile log;
-  char dst[6] = "xxxxx";
-  EXPECT_EQ(0, copyStringIntoBuffer(dst, "abcde", 6));
-  EXPECT_EQ(KLP_RC_TOO_LONG, copyStringIntoBuffer(dst, "abcdef", 6));
-  EXPECT_STREQ("abcde", dst);
-  EXPECT_NE(std::string::npos, log.text().find("String size exeeds buffer size"));
-
-  int32_t len = -1;
-  char quoted[] = "\"ab\"\"c\"";
-  EXPECT_EQ(0, checkIdentifier(quoted, &len));
-  EXPECT_EQ(4, len);
-  char empty[] = "\"\"";
-  EXPECT_EQ(0, checkIdentifier(empty, &len));
-  EXPECT_EQ(0, len);
-  char plain[] = "MixedCase1";
-  EXPECT_EQ(0, checkIdentifier(plain, &len));
-  EXPECT_STREQ("MIXEDCASE1", plain);
-  for (std::string bad : {"ab\"c", "\"abc", "\"a\"b\"", "\"", "\"ab\"\"\"\""})
-    EXPECT_EQ(KLP_RC_BAD_PARM, checkIdentifier(bad.data(), &len)) << bad;
 
   klpWord words[2] = {{6, "select"}, {4, "FROM"}};
-  auto has = [&](const char* t) {
-    return searchWordSequence(static_cast<int32_t>(strlen(t)), t, 2, words);
-  };
-  EXPECT_EQ(1, has("x = 1; SELECT \t\r\n from t"));
-  EXPECT_EQ(1, has("sselect from"));  // the breaking character may start the word
-  EXPECT_EQ(0, has("select x from"));
-  EXPECT_EQ(0, has("sel ect from"));  // a separator inside a word starts over
+  // The character that breaks a match may start the first word again; a
+  // separator inside a word starts over.
+  for (auto [text, found] : {std::pair<std::string, int>{"x = 1; SELECT \t\r\n from t", 1},
+                             {"sselect from", 1}, {"select x from", 0}, {"sel ect from", 0}})
+    EXPECT_EQ(found, searchWordSequence(static_cast<int32_t>(text.size()), text.c_str(), 2, words));
   EXPECT_EQ(0, searchWordSequence(10, "select from", 2, words));
+  EXPECT_EQ(KLP_RC_BAD_PARM, checkIdentifier(nullptr, nullptr));
 
-  char pad[2] = {'z', 'z'};
-  EXPECT_EQ(2, getPadChar(941, pad));
-  EXPECT_EQ(0x40, pad[1]);
-  EXPECT_EQ(KLP_RC_UNKNOWN_CCSID, getPadChar(819, pad));
-  EXPECT_EQ(0x40, pad[1]);
+  struct { std::vector<int> ccsids; std::string pad; } pads[] = {
+      {{1208, 1209, 947, 1252}, " "}, {{1200}, std::string("\x30\x00", 2)},
+      {{37, 273, 277, 278, 285, 424, 500}, "@"}, {{941}, "\x81\x40"}, {{819, 0, 1201, 36}, ""}};
+  for (const auto& p : pads) {
+    for (int ccsid : p.ccsids) {
+      char out[2] = {'z', 'z'};
+      EXPECT_EQ(p.pad.empty() ? KLP_RC_UNKNOWN_CCSID : static_cast<int>(p.pad.size()),
+                getPadChar(ccsid, out)) << ccsid;
+      EXPECT_EQ(p.pad + std::string(2 - p.pad.size(), 'z'), std::string(out, 2)) << ccsid;
+    }
+  }
 }
 
-TEST_F(Fmt, ProgramFilesOpenUnderTheirNames) {
-  LogFile log;
-  klptest::TmpDir dir;  // after the log's, so that it is the TMPDIR in force
+// The answer is kept once the program and its parameter set are known, and
+// only then: each case runs in a process of its own.
+TEST(Fmt, CompatibilityLevelOfTheServerWorkedOutOnce) {
+  klptest::TmpDir dir;
+  struct { const char* program; const char* level; int answer; } cases[] = {
+      {"xqpub", "0802", 0}, {"xqpub", "0901", 0}, {"xqpub", "0905", 0}, {"xqpub", "0801", 1},
+      {"xqpub", "\"0905\"", 1}, {"xqpubcmd", "0802", 1}, {"xqpu", "0905", 1}};
+  for (const auto& c : cases) {
+    klptest::Child r = klptest::inChild(dir.path(), [&] {
+      klpEnvClear(klpGetEnv());
+      ParmEntry t[XQPUB_PARM_COUNT];
+      int rc = (buildXqpubParmTable(t), 0);
+      xqpubParms p(t, XQPUB_PARM_COUNT, &rc);
+      int unknown = getCompatibilityLevel();  // no parameter set yet
+      klpSetCurrentParms(&p);
+      unknown += getCompatibilityLevel();  // no program name yet
+      setEnvTovRIB(klpGetEnv(), c.program, 9, 7, 8);
+      p.setParm(33, c.level, PARM_SRC_COMMANDLINE);
+      int first = getCompatibilityLevel();
+      p.setParm(33, first ? "0802" : "0700", PARM_SRC_CHGPARMS);
+      setEnvTovRIB(klpGetEnv(), first ? "xqpub" : "other", 9, 7, 8);
+      return unknown == 2 && getCompatibilityLevel() == first ? first : 12;
+    });
+    EXPECT_EQ(c.answer, r.exitCode) << c.program << " " << c.level;
+  }
+}
+
+// The program's own files, and each helper that reports: its answer and
+// the records it logs.
+TEST(Fmt, ProgramFilesAndTheReportsOfTheHelpers) {
+  klptest::TmpDir dir;
+  klptest::ProcessLogger log;
   klpEnv* env = klpGetEnv();
   ASSERT_EQ(0, klpEnvClear(env));
   setEnvTovRIB(env, "fmttestprogram", 9, 7, 8);
   FILE* f = nullptr;
-  char name[256];
-  ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_WRITE, "dat", name, sizeof name,
+  char name[256], err[8] = "old", tiny[8];
+  const std::string temp = dir.path() + "fmttestpr." + std::to_string(hsvProcessID());
+  ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_WRITE, "dat", name, sizeof name, nullptr, 0));
+  EXPECT_EQ(temp + ".dat", name);
+  fputs("hello", f), fclose(f);
+  ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_APPEND | KLP_FILE_BINARY, "dat", nullptr, 0,
                              nullptr, 0));
-  std::string expected = dir.path() + "fmttestpr." + std::to_string(hsvProcessID()) + ".dat";
-  EXPECT_EQ(expected, name);
-  fputs("hello", f);
+  fputs(" again", f), fclose(f);
+  EXPECT_EQ("hello again", klptest::readFile(name));
+  // Without the temporary flag: the path parameter and the name prefix.
+  ParmEntry t[XQPUB_PARM_COUNT];
+  buildXqpubParmTable(t);
+  int rc = 0;
+  xqpubParms parms(t, XQPUB_PARM_COUNT, &rc);
+  parms.setParm(PARM_IDX_SERVER, "DB", PARM_SRC_COMMANDLINE);
+  parms.setParm(PARM_IDX_SCHEMA, "K", PARM_SRC_COMMANDLINE);
+  parms.setParm(PARM_IDX_PATH, dir.path().c_str(), PARM_SRC_COMMANDLINE);
+  klpSetCurrentParms(&parms);
+  ASSERT_EQ(0, setEnvNamePrefix(env, "W"));
+  ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_WRITE, "log", name, sizeof name, nullptr, 0));
   fclose(f);
-  ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_APPEND | KLP_FILE_BINARY, "dat",
-                             nullptr, 0, nullptr, 0));
-  fputs(" again", f);
-  fclose(f);
-  EXPECT_EQ("hello again", klptest::readFile(expected));
+  EXPECT_EQ(dir.path() + "DB.K.W.log", name);
+  log.take();
 
-  char err[8] = "old";
-  EXPECT_EQ(ENOENT,
-            getFileHandle(&f, KLP_FILE_TEMP, "missing", name, sizeof name, err, sizeof err));
-  EXPECT_EQ(nullptr, f);
-  EXPECT_STREQ("", name);
-  EXPECT_STREQ("", err);
-  EXPECT_NE(std::string::npos, log.text().find("KLP0626")) << log.text();
-  char tiny[8];  // a name that does not fit is not opened at all
-  EXPECT_EQ(ENAMETOOLONG, getFileHandle(&f, KLP_FILE_TEMP | KLP_FILE_WRITE, "x", tiny,
-                                        sizeof tiny, nullptr, 0));
+  char dst[6] = "xxxxx";
+  int64_t s = 7;
+  const std::string len = "8999 <timestamp2seconds> 12: Expected timestamp len of 19 or 26. Received ",
+                    mktime = "8999 <timestamp2seconds> 12: mktime could not calculate seconds";
+  int32_t us = -1;
+  // The answer, then the records logged.
+  const std::pair<std::function<int()>, std::vector<std::string>> cases[] = {
+      // Seconds (or microseconds) of the local time; the separators are not examined.
+      {[&] { return timestamp2seconds("1970-01-02-01.01.01", &s, &us) ? -1 : int(s) + us; }, {"90061"}},
+      {[&] { return timestamp2seconds("2026/12/06 11:43:08", &s, &us) ? -1 : int(s); }, {"1796557388"}},
+      {[&] { return timestamp2seconds("2026-12-06-11.43.08.123456", &s, &us) ? -1 : us; }, {"123456"}},
+      {[&] { return copyStringIntoBuffer(dst, "abcde", 6); }, {"0"}},
+      {[&] { return copyStringIntoBuffer(dst, "abcdef", 6); },
+       {"6005", "569 <copyStringIntoBuffer> 12: String size exeeds buffer size"}},
+      {[&] { return timestamp2seconds("2026-12-06-11.43.08.12345", &s, nullptr); }, {"-1", len + "25"}},
+      {[&] { return timestamp2seconds(nullptr, &s, nullptr); }, {"-1", len + "0"}},
+      // Fields with more digits than a number holds are no time.
+      {[&] { return timestamp2seconds("99999999999999999999999999", &s, nullptr); }, {"-1", mktime}},
+      {[&] { return timestamp2seconds("2026-12-06-11.999999999999", &s, nullptr); }, {"-1", mktime}},
+      {[&] { return getFileHandle(&f, KLP_FILE_TEMP, "none", name, sizeof name, err, sizeof err); },
+       {"2", "626 <getFileHandle> 1: fopen|" + temp + ".none|rt|2"}},
+      // A name that does not fit is not opened at all.
+      {[&] { return getFileHandle(&f, KLP_FILE_WRITE, "x", tiny, sizeof tiny, nullptr, 0); },
+       {"36", "626 <getFileHandle> 1: fopen|" + dir.path() + "DB.K.W.x|wt+|36"}},
+  };
+  for (const auto& [call, want] : cases) {
+    std::vector<std::string> got = {std::to_string(call())};
+    for (const std::string& r : log.take()) got.push_back(r);
+    EXPECT_EQ(got, want);
+  }
+  EXPECT_EQ(std::string(dst) + "/" + name + "/" + err + "/" + std::to_string(s) + (f ? "f" : ""), "abcde///0");
+  klpSetCurrentParms(nullptr);
   klpEnvClear(env);
 }
 
-TEST_F(Fmt, WildcardPreparationAndMatching) {
-  struct Prepared { const char* in; int32_t kind; const char* out; };
-  for (const Prepared& c :
-       {Prepared{"AB%", KLP_WILD_PREFIX, "AB%"}, {"%%%", KLP_WILD_ALL, "%"},
-        {"A%B%", KLP_WILD_FULL, "A%B%"}, {"A\\%B", KLP_WILD_NONE, "A%B"},
-        {"A%%B", KLP_WILD_FULL, "A%B"}, {"AB\\%%", KLP_WILD_PREFIX, "AB%%"},
-        {"A\\%%%B", KLP_WILD_FULL, "A\\%%B"}}) {
-    std::string p = c.in;
-    EXPECT_EQ(c.kind, prepareIgnTransCriteria(p.data())) << c.in;
-    EXPECT_STREQ(c.out, p.c_str()) << c.in;
+TEST(Fmt, WildcardPreparationAndMatching) {
+  const std::tuple<std::string, int32_t, std::string> prepared[] = {
+      {"AB%", KLP_WILD_PREFIX, "AB%"}, {"%%%", KLP_WILD_ALL, "%"}, {"A%B%", KLP_WILD_FULL, "A%B%"},
+      {"A\\%B", KLP_WILD_NONE, "A%B"}, {"A%%B", KLP_WILD_FULL, "A%B"},
+      {"AB\\%%", KLP_WILD_PREFIX, "AB%%"}, {"A\\%%%B", KLP_WILD_FULL, "A\\%%B"}};
+  for (auto [in, kind, out] : prepared) {
+    EXPECT_EQ(kind, prepareIgnTransCriteria(in.data())) << out;
+    EXPECT_EQ(out, in.c_str());
   }
   // A later occurrence is tried when the first one leads nowhere; "%" may
   // come before an escaped character.
-  struct Match { const char* pattern; const char* text; int result; };
-  for (const Match& m :
-       {Match{"A%C", "ABBC", 1}, {"A%C", "ABBD", 0}, {"%", "", 1}, {"", "x", 0}, {"a%c", "ABC", 0},
-        {"A%B%C", "AxByBzC", 1}, {"A%C", "ABCC", 1}, {"A%CD", "ACXCD", 1}, {"A\\%C", "A%C", 1},
-        {"A\\%C", "ABC", 0}, {"%\\%", "50%", 1}, {"A\\", "A\\", 0}})
-    EXPECT_EQ(m.result, compareIgnTransCriteria(m.pattern, m.text)) << m.pattern << " " << m.text;
+  const std::tuple<const char*, const char*, int> matches[] = {
+      {"A%C", "ABBC", 1}, {"A%C", "ABBD", 0}, {"%", "", 1}, {"", "x", 0}, {"a%c", "ABC", 0},
+      {"A%B%C", "AxByBzC", 1}, {"A%C", "ABCC", 1}, {"A%CD", "ACXCD", 1}, {"A\\%C", "A%C", 1},
+      {"A\\%C", "ABC", 0}, {"%\\%", "50%", 1}, {"A\\", "A\\", 0}};
+  for (auto [pattern, text, result] : matches)
+    EXPECT_EQ(result, compareIgnTransCriteria(pattern, text)) << pattern << " " << text;
 }

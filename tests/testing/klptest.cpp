@@ -18,6 +18,8 @@
 #include <thread>
 #include <utility>
 
+#include <gtest/gtest.h>
+
 #include "common/msg/msglogger.h"
 #include "common/platform/hsv.h"
 #include "common/thread/klpthread.h"
@@ -167,6 +169,14 @@ std::vector<std::string> LogCapture::take() {
   std::vector<std::string> r;
   r.swap(logger_->records);
   return r;
+}
+
+std::string stdoutOf(const std::function<void()>& f) {
+  fflush(stdout);
+  ::testing::internal::CaptureStdout();
+  f();
+  fflush(stdout);
+  return ::testing::internal::GetCapturedStdout();
 }
 
 Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs) {

@@ -96,6 +96,9 @@ class LogCapture {
   msgLogger* saved_;
 };
 
+// What f writes to standard output while it runs.
+std::string stdoutOf(const std::function<void()>& f);
+
 // Runs body in a forked child whose standard output and error go to files
 // under dir (ending in "/"); it exits with body's answer or is killed after
 // timeoutMs.
