@@ -35,8 +35,10 @@ bench:
 	cmake --build build-bench -j $(JOBS)
 	./scripts/bench.sh build-bench
 
+# Optimised but with assertions kept: a campaign needs millions of executions.
 fuzz:
-	CC=clang CXX=clang++ cmake -S . -B build-fuzz -DCMAKE_BUILD_TYPE=Debug -DKLP_FUZZ=ON >/dev/null
+	CC=clang CXX=clang++ cmake -S . -B build-fuzz -DCMAKE_BUILD_TYPE=Debug \
+	  -DCMAKE_C_FLAGS_DEBUG="-g -O1" -DCMAKE_CXX_FLAGS_DEBUG="-g -O1" -DKLP_FUZZ=ON >/dev/null
 	cmake --build build-fuzz -j $(JOBS)
 	@echo "fuzz targets are in build-fuzz/bin (run one with -max_total_time=60)"
 
