@@ -1,5 +1,6 @@
 // Fuzz target: a reply payload as a server could send it, taken as status
-// data of each format and as a status size answer. The first two bytes are
+// data of each format, as a status size answer and as a STATUS reply the
+// command program prints (its messages captured). The first two bytes are
 // the capacity of the caller's buffer, which is allocated to exactly that
 // size so that any write beyond it is caught.
 #include <cstdint>
@@ -8,6 +9,8 @@
 #include <vector>
 
 #include "common/ipc/cmdapi.h"
+#include "common/msg/klplog.h"
+#include "common/msg/msglogger.h"
 #include "common/util/klprc.h"
 
 namespace {
@@ -22,9 +25,20 @@ void convert(Converter conv, const char* payload, size_t len, size_t outLen) {
   if (rc != KLP_API_BAD_REPLY && required <= 0) abort();
 }
 
+// Messages are composed but go nowhere.
+bool quietLogger() {
+  msgLogger* logger = createMsgLoggerU(5, 0);
+  for (char sev : {'I', 'W', 'E', 'D'}) logger->setRoutingWord(sev, 0);
+  logger->loadBuiltinMsgs(builtinMsgTable);
+  klpSetProcessLogger(logger);
+  return true;
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  static bool ready = quietLogger();
+  (void)ready;
   if (size < 2) return 0;
   size_t outLen = static_cast<size_t>(data[0]) | (static_cast<size_t>(data[1]) << 8);
   const char* payload = reinterpret_cast<const char*>(data + 2);
@@ -43,5 +57,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     int rc = klpStatusSizeFromReply(kind, reply.data(), &statusSize, nullptr);
     if (rc == 0 ? statusSize < 32 : (rc != KLP_API_BAD_REPLY || statusSize != 0)) abort();
   }
+
+  // An exact-size copy, so that a read past the payload is caught.
+  std::vector<char> exact(payload, payload + len);
+  klpMsgCapture capture{};
+  printState(exact.empty() ? nullptr : exact.data(), len, &capture);
+  if (capture.length > KLP_CAPTURE_CHARS || capture.text[capture.length] != '\0') abort();
   return 0;
 }
