@@ -13,40 +13,22 @@ set -euo pipefail
 BUILD_DIR=${1:-build}
 RUNS=${2:-200}
 BIN="$BUILD_DIR/bin"
-for p in klpkcap klpkccmd; do
-  if [[ ! -x "$BIN/$p" ]]; then
-    echo "bench: $BIN/$p not found; build first" >&2
-    exit 2
-  fi
-done
+. "$(dirname "$0")/klpserver.sh"
+klp_need "$BIN" klpkcap klpkccmd
 
 SERVER=BENCH
-DIR=$(mktemp -d "${TMPDIR:-/tmp}/klpbench.XXXXXX")
-export TMPDIR="$DIR/"
+klp_private_ipc klpbench
 SERVER_PID=""
 
 cleanup() {
   trap - EXIT INT TERM
-  if [[ -n "$SERVER_PID" ]] && kill -0 "$SERVER_PID" 2>/dev/null; then
-    kill -TERM "$SERVER_PID" 2>/dev/null || true
-    for i in $(seq 1 150); do
-      kill -0 "$SERVER_PID" 2>/dev/null || break
-      sleep 0.1
-    done
-    kill -KILL "$SERVER_PID" 2>/dev/null || true
-    wait "$SERVER_PID" 2>/dev/null || true
-  fi
+  klp_end_process "$SERVER_PID"
   rm -rf "$DIR"
 }
 trap cleanup EXIT
 trap 'exit 130' INT TERM
 
-"$BIN/klpkcap" "CAPTURE_SERVER=$SERVER" "CAPTURE_PATH=$DIR/" >"$DIR/klpkcap.out" 2>&1 &
-SERVER_PID=$!
-for i in $(seq 1 100); do
-  grep -q KLP0594I "$DIR/$SERVER.KLP.KCAP.log" 2>/dev/null && break
-  sleep 0.1
-done
+klp_start_server "$BIN" "$SERVER"
 
 python3 - "$BIN/klpkccmd" "$SERVER" "$RUNS" <<'EOF'
 import os, statistics, subprocess, sys, time

@@ -11,16 +11,11 @@ set -euo pipefail
 
 BUILD_DIR=${1:-build}
 BIN="$BUILD_DIR/bin"
-for p in klpkcap klpkccmd klptrc klptrcbp; do
-  if [[ ! -x "$BIN/$p" ]]; then
-    echo "demo: $BIN/$p not found; build first (make build)" >&2
-    exit 2
-  fi
-done
+. "$(dirname "$0")/klpserver.sh"
+klp_need "$BIN" klpkcap klpkccmd klptrc klptrcbp
 
 SERVER=DEMO
-DIR=$(mktemp -d "${TMPDIR:-/tmp}/klpdemo.XXXXXX")
-export TMPDIR="$DIR/"
+klp_private_ipc klpdemo
 LOG="$DIR/$SERVER.KLP.KCAP.log"
 SERVER_QUEUE="$DIR/$SERVER.KLP.KCAP.IPC"
 SERVER_PID=""
@@ -40,26 +35,12 @@ rt.mq_unlink(("/klpq.%016x" % h).encode())
 EOF
 }
 
-# Ends a process we started: politely first, then for sure.
-end_process() {
-  local pid=$1 i
-  [[ -n "$pid" ]] || return 0
-  kill -0 "$pid" 2>/dev/null || return 0
-  kill -TERM "$pid" 2>/dev/null || true
-  for i in $(seq 1 150); do
-    kill -0 "$pid" 2>/dev/null || break
-    sleep 0.1
-  done
-  if kill -0 "$pid" 2>/dev/null; then kill -KILL "$pid" 2>/dev/null || true; fi
-  wait "$pid" 2>/dev/null || true
-}
-
 cleanup() {
   trap - EXIT INT TERM
   [[ -n "$TRACE_ON" ]] && "$BIN/klptrc" kill -db "$SERVER" -kcap >/dev/null 2>&1
-  end_process "$CLIENT_PID"
+  klp_end_process "$CLIENT_PID"
   [[ -n "$CLIENT_PID" ]] && unlink_queue "$SERVER_QUEUE.CMD$CLIENT_PID"
-  end_process "$SERVER_PID"
+  klp_end_process "$SERVER_PID"
   unlink_queue "$SERVER_QUEUE"
   rm -rf "$DIR"
 }
@@ -68,19 +49,7 @@ trap 'echo; echo "demo: interrupted"; exit 130' INT TERM
 
 echo "IPC directory: $TMPDIR"
 echo "\$ klpkcap CAPTURE_SERVER=$SERVER CAPTURE_PATH=$DIR/ &"
-"$BIN/klpkcap" "CAPTURE_SERVER=$SERVER" "CAPTURE_PATH=$DIR/" >"$DIR/klpkcap.out" 2>&1 &
-SERVER_PID=$!
-
-# The server is ready once its log says that it created its queue.
-for i in $(seq 1 100); do
-  grep -q KLP0594I "$LOG" 2>/dev/null && break
-  if ! kill -0 "$SERVER_PID" 2>/dev/null; then
-    echo "demo: klpkcap did not start:" >&2
-    cat "$DIR/klpkcap.out" >&2
-    exit 1
-  fi
-  sleep 0.1
-done
+klp_start_server "$BIN" "$SERVER"
 
 failures=0
 command() {
@@ -133,7 +102,7 @@ for i in $(seq 1 300); do
 done
 if kill -0 "$SERVER_PID" 2>/dev/null; then
   echo "klpkcap did not stop; ending it"
-  end_process "$SERVER_PID"
+  klp_end_process "$SERVER_PID"
   failures=$((failures + 1))
 else
   wait "$SERVER_PID" || rc=$?

@@ -3,6 +3,7 @@
 // the bytes it holds or round in circles.
 #include "common/trace/trcread.h"
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <cerrno>
@@ -46,6 +47,15 @@ bool ioFailure(trcIter* it, const char* fmt) {
   return false;
 }
 
+// Whether the file holds `end` bytes. A trace written to file may grow while
+// it is read, so its size is looked at again before a record is refused.
+bool fileHolds(trcIter* it, uint64_t end) {
+  if (end <= it->fileSize) return true;
+  struct stat st;
+  if (fstat(fileno(it->file), &st) == 0 && st.st_size > 0) it->fileSize = static_cast<uint64_t>(st.st_size);
+  return end <= it->fileSize;
+}
+
 bool readFromFile(trcIter* it, uint32_t room) {
   uint64_t pos = static_cast<uint64_t>(it->dataOffset) + it->offset;
   // Records follow each other in the file: seek only where they do not, as
@@ -63,7 +73,10 @@ bool readFromFile(trcIter* it, uint32_t room) {
     return ioFailure(it, "Error reading record %d.\n");
   uint32_t length;
   memcpy(&length, it->buffer, sizeof length);
-  if (length < TRC_RECORD_HEADER_SIZE || (length & 3) != 0 || length > room)
+  // The counters of a damaged header may claim gigabytes: a length is taken
+  // only as far as the file holds it, before any memory is sized by it.
+  if (length < TRC_RECORD_HEADER_SIZE || (length & 3) != 0 || length > room ||
+      !fileHolds(it, pos + length))
     return badRecord(it, length);
   if (length > it->bufferSize) {
     size_t grown = it->bufferSize * 2 > length ? it->bufferSize * 2 : length;

@@ -36,6 +36,7 @@ struct trcIter {
   uint32_t dataOffset, writeOffset, oldestOffset, highWater, entryCount;
   FILE* file;
   uint64_t filePos;      // where the file stands after the last read; no seek needed there
+  uint64_t fileSize;     // the file's size when last looked at
   uint8_t* buffer;
   size_t bufferSize;
 };

@@ -10,6 +10,7 @@
 // Starting or Running) or the block is gone. It never destroys the block:
 // that is left to the trace command and the server. See
 // docs/trace-keeper.md.
+#include <cstddef>
 #include <cstring>
 
 #include "common/platform/hsv.h"
@@ -33,8 +34,13 @@ int hold(const char* keyPart1, const char* keyPart2) {
   HSVHIPCMemory* memory = nullptr;
   trcBlockHeader* block = nullptr;
   if (trcOpenBlock(keyPart1, keyPart2, &memory, &block) != ECF_OK) return 0;
+  // The header is packed, but the block is page-aligned and the status word
+  // sits at a multiple of 4: read it as the aligned word it is, which every
+  // compiler loads inline.
+  const uint32_t* statusWord = reinterpret_cast<const uint32_t*>(
+      reinterpret_cast<const char*>(block) + offsetof(trcBlockHeader, status));
   for (int polls = 1;; ++polls) {
-    uint32_t status = __atomic_load_n(&block->status, __ATOMIC_ACQUIRE);
+    uint32_t status = __atomic_load_n(statusWord, __ATOMIC_ACQUIRE);
     if (status != TRC_STATE_RUNNING && status != TRC_STATE_STARTING) break;
     if (polls % kPresenceEvery == 0 && !stillNamed(keyPart1, keyPart2)) break;
     hsvSleep(kPollMs);
