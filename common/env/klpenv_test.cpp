@@ -1,5 +1,4 @@
-// The process environment: program level, name prefix, IPC directory, and
-// the server's receiving queue with the records each step logs.
+// The process environment: program level, name prefix, IPC directory, receiving queue.
 #include "common/env/klpenv.h"
 
 #include <fcntl.h>
@@ -83,8 +82,7 @@ TEST_F(Env, NamePrefixAndIpcDirectory) {
     EXPECT_EQ(c.rc, setEnvNamePrefix(env_, "KCAP")) << c.schema;
     EXPECT_EQ(c.prefix, getEnvNamePrefix(env_));
   }
-  // The IPC directory: TMPDIR with its "/", filled once; unset, empty or too
-  // long: the default. An empty value is followed by another character, never read.
+  // IPC directory: TMPDIR and "/", filled once; else /tmp/ (an empty value's next byte is never read).
   const std::string longest(1038, 'd');
   const std::pair<std::string, std::string> dirs[] = {
       {"TMPDIR=/x/tmp", "/x/tmp/"}, {"TMPDIR=/else/", "/else/"}, {"", "/tmp/"},

@@ -1,5 +1,4 @@
-// The logger: composed texts, the message catalogue, routing and destinations, lost
-// messages, and what is issued.
+// The logger: texts, the catalogue, routing, destinations, lost messages, what is issued.
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
@@ -16,8 +15,7 @@
 #include "common/util/klprc.h"
 #include "tests/testing/klptest.h"
 
-// Every allocation of the logger is a nothrow one: a test makes the one after
-// `allocationsLeft` more fail.
+// The logger allocates with nothrow new only: a test makes the one after `allocationsLeft` fail.
 static std::atomic<int> allocationsLeft{-1};
 void* operator new(std::size_t n, const std::nothrow_t&) noexcept {
   return allocationsLeft >= 0 && allocationsLeft-- == 0 ? nullptr : ::operator new(n);
@@ -53,8 +51,7 @@ struct LoggerTest : ::testing::Test {
     l.getKlpMsgText(number, "test", "T", buf, sizeof buf, v1, v2);
     return buf;
   }
-  // The values putKlpMsg stores (nine, missing ones "*") joined by "|", or
-  // with `lengths` their lengths joined by " ".
+  // The nine values putKlpMsg stores (missing: "*") joined by "|", or their lengths by " ".
   std::string values(int number, std::vector<const char*> v, bool lengths = false) {
     logMsg* r = msgNewRecord(number, 0, "test", "T");
     v.resize(MSG_MAX_VALUES);
@@ -67,8 +64,7 @@ struct LoggerTest : ::testing::Test {
   }
 };
 
-// A logger whose messages all have one text (as if from the catalogue); what
-// setRouting makes of the last one is kept instead of printed.
+// One text for every message (as from the catalogue); the last routing is kept, not printed.
 template <class Base>
 struct Fixed : Base {
   const char* fixed;
@@ -107,9 +103,8 @@ TEST(Routing, FollowsTheSeverityWordsAndTheConsoleFlag) {
                           : Fixed<msgLogger>(r.text).route(r.console, r.asked));
 }
 
-// Each line opens, writes and closes the log file (one moved away starts anew);
-// a failed open is reported once until a line is written again; origin and
-// thread name are cut to 30 and 15 characters.
+// Each line opens, writes, closes the file (a moved one starts anew); a failed open is
+// reported once until a line is written again; origin and thread name cut to 30 and 15.
 TEST_F(LoggerTest, TheLogFile) {
   std::string bad = tmp.path() + "missing-dir", t = "01234567890123456789", log = tmp.path() + "test.log";
   auto c = klptest::inChild(tmp.path(), [&] {
@@ -141,8 +136,7 @@ TEST_F(LoggerTest, TheLogFile) {
   EXPECT_EQ(std::string(128, 's') + ".T", l.setMsgTableName(std::string(200, 's').c_str(), "T"));
 }
 
-// Asynchronous mode serves the console at once and queues the rest; stopLogging
-// drains the queue and stops file output until restartLogging.
+// Asynchronous: console at once, the rest queued; stopLogging drains, files wait for restart.
 TEST_F(LoggerTest, QueuedFileOutputStopAndRestart) {
   auto c = klptest::inChild(tmp.path(), [&] {
     msgLogger q(MSG_APP_KLPKCCMD, 1);
@@ -163,8 +157,7 @@ TEST_F(LoggerTest, QueuedFileOutputStopAndRestart) {
             "<restarter> KLP8999D Message logging re-enabled\n", log());
 }
 
-// A message without memory for its record, text or a value is lost and says
-// so; one without memory for its log line goes to standard error.
+// Lost for want of memory (record, text, value): said so; no memory for its line: to stderr.
 TEST_F(LoggerTest, NoMessageIsLostSilentlyForWantOfMemory) {
   constexpr int kTries = 30;
   auto c = klptest::inChild(tmp.path(), [&] {
@@ -217,8 +210,7 @@ TEST(MessageTable, RowsAreWrittenUntilTheDatabaseIsGone) {
   msgSetTableWriter(nullptr);
 }
 
-// One definition per message found, kept before the header's last line; a
-// header that cannot be opened is reported once.
+// One definition per message, before the header's last line; an unopenable header reported once.
 TEST_F(LoggerTest, DefinitionsHeader) {
   auto c = klptest::inChild(tmp.path(), [&] {
     if (chdir(tmp.path().c_str()) != 0) return 2;
@@ -250,8 +242,7 @@ msgSqlca sqlca(int code, int16_t tokenLength) {
   memcpy(ca.sqlerrp, "SQLNQ1F0EXTRA", 8);
   return ca;
 }
-// What each issuing function of this library issues: number, origin, routing
-// asked for and the caller's values, in order.
+// What each issuing function issues: number, origin, routing asked for, the caller's values.
 TEST(Issuing, EachFunctionIssuesItsMessages) {
   const std::string tokens(70, 'T');
   msgSetStringParmProvider([](int i) { return i == 29 ? "parm 29" : i == 17 ? "parm 17" : "?"; });
@@ -333,8 +324,7 @@ TEST_F(LoggerTest, TextsComposeFromTheirRowsValuesAndHeaderValues) {
       // Negative numbers are outside the table, never an out-of-range bucket.
       {-7, "A", nullptr, "KLP0553W" + h + "An internal error  \"4\" occurred for message number \"-7\" "
                          "containing \"9\" substitution fields: \"A\", \"*\", \"*\", \"*\", " + stars},
-      // Control characters in values are written escaped: a value from
-      // another process must not end or split the line it is written on.
+      // Control characters escaped: another process's value must not end or split the line.
       {8999, "Q1\nKLP0522I forged\r\t", nullptr, "KLP8999D Q1\\nKLP0522I forged\\r\\t"},
       {8999, "\x1b[31mred\x7f\x01", nullptr, "KLP8999D \\x1B[31mred\\x7F\\x01"},
       {8999, "back\\slash \xc3\xbc", nullptr, "KLP8999D back\\slash \xc3\xbc"},
@@ -362,8 +352,7 @@ TEST_F(LoggerTest, HeaderValuesFollowTheNumberRangesAndPushOutTheLastCallerValue
     EXPECT_EQ(*want, values(number, {"1", "2", "3", "4", "5", "6", "7", "8", "9"})) << number;
 }
 
-// The sum of the values is bounded by 1161: 1161 / 9 = 129 is the share, and
-// only values longer than it lose the same number of characters.
+// The values sum to at most 1161, a share of 129: only longer values lose, all the same amount.
 TEST_F(LoggerTest, ValueLengthBoundCutsLongValuesEvenly) {
   std::string v200(200, 'v'), v1000(1000, 'w'), v129(129, 's'), v130(130, 'm'), huge(20000, 'h');
   const char *p = v200.c_str(), *w = v1000.c_str(), *m = v130.c_str();
@@ -371,8 +360,7 @@ TEST_F(LoggerTest, ValueLengthBoundCutsLongValuesEvenly) {
   // 1800 over 9: excess 639, each loses 71; 2135 over two long values: 487 each.
   EXPECT_EQ("129 513 513 1 1 1 1 1 1",
             values(8999, {v129.c_str(), w, w, "a", "b", "c", "d", "e", "f"}, true));
-  // The even cut (19879 / 9 = 2208) exceeds what the 130-character ones hold:
-  // they are emptied, never cut below nothing.
+  // The even cut (19879 / 9 = 2208) exceeds the 130-character ones: emptied, never below nothing.
   EXPECT_EQ("0 0 0 0 0 0 0 0 17792", values(8999, {m, m, m, m, m, m, m, m, huge.c_str()}, true));
 }
 
@@ -456,24 +444,21 @@ std::string lookup(const std::vector<uint8_t>& image, const char* key) {
 // The reason of a failed catalogue call: three characters after the ':'.
 int reasonOf(const std::string& text) { return atoi(text.c_str() + text.find(':') + 3); }
 
-// In either byte order only a decimal message number finds a text, and only
-// a text that begins with its own id; the first of two wins.
-TEST(MoReader, OnlyDecimalIdsWithTheirOwnTextsAreFound) {
+// Either byte order: only a decimal number finds a text, one with its own id; the first one wins.
+// A damaged image is refused without reading outside it.
+TEST(MoReader, FindsOnlyDecimalIdsWithTheirOwnTextsAndRefusesDamage) {
   Entries entries = {
       {"", "KLP0000E header"},      {"0500", "KLP0500E leading zero"}, {"abc", "KLP0500E letters"},
       {"500", "KLP0500E first"},    {"500", "KLP0500E second"},        {"501", "KLP0500E misfiled"},
       {"502", "KLP0502X severity"}, {"503", "KLP0503"},                {"504", "hello"},
       {"12345", "KLP2345E five"},   {"7", "KLP0007W seven"},           {"9999", "KLP9999D last"}};
-  const std::pair<const char*, const char*> rows[] = {
-      {"500", "KLP0500E first"}, {"7", "KLP0007W seven"}, {"9999", "KLP9999D last"},
-      {"", "<none>"},   {"0", "<none>"},   {"0500", "<none>"},  {"abc", "<none>"}, {"501", "<none>"},
-      {"502", "<none>"}, {"503", "<none>"}, {"504", "<none>"}, {"12345", "<none>"},
-      {"2345", "<none>"}, {"-1", "<none>"}};
-  for (bool big : {false, true})
-    for (const auto& [key, want] : rows) EXPECT_EQ(want, lookup(moImage(entries, big), key)) << key;
-}
-
-TEST(MoReader, DamagedImagesAreRefusedWithoutReadingOutside) {
+  for (bool big : {false, true}) {
+    auto image = moImage(entries, big);
+    EXPECT_EQ("KLP0500E first|KLP0007W seven|KLP9999D last",
+              lookup(image, "500") + "|" + lookup(image, "7") + "|" + lookup(image, "9999"));
+    for (const char* key : {"", "0", "0500", "abc", "501", "502", "503", "504", "12345", "2345", "-1"})
+      EXPECT_EQ("<none>", lookup(image, key)) << key;
+  }
   auto good = moImage({{"500", "KLP0500E first"}, {"501", "KLP0501E second"}});
   EXPECT_EQ("KLP0501E second", lookup(good, "501"));
   for (size_t cut = 0; cut < good.size(); ++cut)
@@ -492,9 +477,8 @@ TEST(MoReader, DamagedImagesAreRefusedWithoutReadingOutside) {
   EXPECT_EQ("<damaged 3>", lookup(moImage(Entries(70000)), "500"));
 }
 
-// The text with the values substituted, or why not: 2 missing, 3 unreadable or
-// damaged, 4 no such message, 5 a bad call. Only a regular, whole file under
-// the name in KLP_CATALOG_DIR is used; nothing there blocks.
+// The text, or why not: 2 missing, 3 unreadable or damaged, 4 no such message, 5 a bad call;
+// only a regular, whole file in KLP_CATALOG_DIR is used and nothing there blocks.
 TEST(Catalogue, TextsOrTheReasonWhyNot) {
   std::string image = klptest::readFile(kCatalog);
   char* values[4] = {const_cast<char*>("App"), const_cast<char*>("KLP\" : \"T"),
@@ -538,9 +522,8 @@ struct NamedCatalogLogger : msgLoggerU {
     snprintf(catalogName_, sizeof catalogName_, "%s", name);
   }
 };
-// Below 8000 the catalogue's text, else or without it the table's; without a
-// catalogue KLP0513E once, to standard error and the log file. A blank thread
-// name is the run-time thread's, cut to 15 characters.
+// Below 8000 the catalogue's text, else the table's; without one KLP0513E once, to standard
+// error and the log file. A blank thread name is the run-time thread's, cut to 15 characters.
 TEST_F(LoggerTest, LoggerUsesTheCatalogueAndFallsBack) {
   auto c = klptest::inChild(tmp.path(), [&] {
     msgSetThreadNameProvider([]() -> const char* { return "a-very-long-thread-name"; });
@@ -572,24 +555,20 @@ TEST_F(LoggerTest, LoggerUsesTheCatalogueAndFallsBack) {
 
 }  // namespace
 
-// Every number the programs issue has a text in the built catalogue that
-// begins with its id and severity, and whose markers all get substituted
-// (they must stand in ascending order). The status labels 7112-7124 and
-// 7193 have no header values: the report cuts their first ten characters.
+// Every issued number has a built catalogue text with its id, severity and every marker
+// substituted (ascending); status labels 7112-7124, 7193 have no header values (cut by ten).
 TEST(Catalogue, BuiltFileHoldsEveryIssuedNumber) {
-  const int issued[] = {500, 501, 502, 503, 504, 506, 507, 508, 509, 510, 511, 513, 514, 517,
-                        518, 519, 520, 521, 522, 523, 524, 525, 526, 527, 529, 534, 541, 543,
-                        545, 552, 554, 568, 569, 574, 575, 589, 590, 591, 592, 593, 594, 595,
-                        596, 597, 598, 599, 600, 601, 602, 606, 615, 616, 617, 619, 624, 626,
-                        7112, 7113, 7114, 7115, 7116, 7117, 7118, 7119, 7120, 7121, 7122, 7123,
-                        7124, 7193};
+  const int issued[] = {500, 501, 502, 503, 504, 506, 507, 508, 509, 510, 511, 513, 514, 517, 518, 519, 520,
+                        521, 522, 523, 524, 525, 526, 527, 529, 534, 541, 543, 545, 552, 554, 568, 569, 574,
+                        575, 589, 590, 591, 592, 593, 594, 595, 596, 597, 598, 599, 600, 601, 602, 606, 615,
+                        616, 617, 619, 624, 626, 7112, 7113, 7114, 7115, 7116, 7117, 7118, 7119, 7120, 7121,
+                        7122, 7123, 7124, 7193};
   char v[9][3] = {"v1", "v2", "v3", "v4", "v5", "v6", "v7", "v8", "v9"};
   char* values[9] = {v[0], v[1], v[2], v[3], v[4], v[5], v[6], v[7], v[8]};
   for (int number : issued) {
     char text[1100], id[8];
     snprintf(id, sizeof id, "KLP%04d", number);
-    ASSERT_GT(retrieveCatalogMsg(kCatalog.c_str(), number, nullptr, values, 9, text, sizeof text),
-              0) << number;
+    ASSERT_GT(retrieveCatalogMsg(kCatalog.c_str(), number, nullptr, values, 9, text, sizeof text), 0) << number;
     EXPECT_EQ(0, strncmp(text, id, 7)) << text;
     EXPECT_NE(nullptr, strchr("EIW", text[7])) << text;
     bool label = number >= 7112;
@@ -599,8 +578,7 @@ TEST(Catalogue, BuiltFileHoldsEveryIssuedNumber) {
   }
 }
 
-// A program finds the catalogue beside itself or through KLP_CATALOG_DIR,
-// never in the build tree it was built in: a copy elsewhere has none.
+// The catalogue is beside the program or in KLP_CATALOG_DIR, never taken from the build tree.
 TEST(Catalogue, ProgramsLookBesideThemselvesNotInTheBuildTree) {
   klptest::TmpDir tmp;
   std::string built = klptest::binPath("klpkccmd"), copy = tmp.path() + "klpkccmd";

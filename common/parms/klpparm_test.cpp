@@ -1,6 +1,4 @@
-// The registry: table checks, every setter's rule and refusal with the
-// records it logs, the command-line steps, the query message bytes and the
-// parsing of a query message received from another process.
+// The registry: table checks, setters, the command line, the query message made and parsed.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -45,11 +43,9 @@ std::string states(const klpParmClass& p, std::vector<int> slots = {0, 1, 2, 3, 
   return s;
 }
 
-// A logger that keeps what is issued; a registry of one parameter of each kind, made
-// current, numbered as every program numbers them (8 matched by its first 5 characters);
-// a UTF-8 user locale; a private working directory (the password file's place).
-class ParmTest : public ::testing::Test {
- protected:
+// A current registry of each kind, numbered as the programs do (8 matched by 5 characters), the
+// logger keeping what is issued, a UTF-8 user locale, a private working directory.
+struct ParmTest : ::testing::Test {
   void SetUp() override {
     setenv("LC_ALL", "C.UTF-8", 1);
     ASSERT_EQ(chdir(dir_.path().c_str()), 0);
@@ -72,8 +68,7 @@ class ParmTest : public ::testing::Test {
     log_.get()->setConsoleFlag(0);
     log_.take();
   }
-  // The base command-line rule over "prog" and args, or with `leading` the
-  // leading server name rule over args alone ("consumed server@source").
+  // processCommandLine over "prog" and args, or getPositionalDBName into `leading`.
   int parse(std::vector<std::string> args, const char* sid = nullptr, std::string* leading = nullptr) {
     if (!leading) args.insert(args.begin(), "prog");
     std::vector<char*> argv;
@@ -85,7 +80,6 @@ class ParmTest : public ::testing::Test {
     *leading = std::to_string(consumed) + " " + state(*p_, 0);
     return rc;
   }
-
   std::string cwd_ = std::filesystem::current_path().string();
   klptest::TmpDir dir_;
   klptest::ProcessLogger log_;
@@ -121,8 +115,7 @@ TEST_F(ParmTest, ConstructorRefusesBadTablesAndGettersTheirMisuse) {
   EXPECT_EQ(rc, KLP_RC_BAD_PARM);
   EXPECT_EQ(state(*p, 0) + state(*p, 6) + state(*p, 7) + state(*p, 5), "5@010@020@0" + v1040 + "@0");
   for (int refused : {1, 2, 3, 4}) EXPECT_STREQ(p->peekSlot(refused)->name, "KLPPLACEHOLDER");
-  // Getters of the wrong type or outside the count; an index equal to the
-  // count is stored but not readable.
+  // Getters of the wrong type or outside the count (an index equal to it is stored, unreadable).
   t = {intEntry(0, "A", 0, 9, 1), intEntry(2, "C", 0, 9, 7)};
   p = std::make_unique<klpParmClass>(t.data(), 2, &rc);
   EXPECT_EQ(klptest::stdoutOf([&] {
@@ -145,9 +138,8 @@ TEST_F(ParmTest, ConstructorRefusesBadTablesAndGettersTheirMisuse) {
   EXPECT_EQ(rc, 2002);
 }
 
-// Runs steps "op slot=value@source" separated by ";" and answers the sum of
-// their rcs. Ops: i setParm INTEGER, b setParmBool, y setBool, s setParm
-// STRING, c setCommand (flag 1), v setParmValue.
+// Runs steps "op slot=value@source" split by ";", answers the sum of their rcs. Ops: i setParm
+// INTEGER, b setParmBool, y setBool, s setParm STRING, c setCommand (flag 1), v setParmValue.
 int apply(klpParmClass& p, const std::string& steps) {
   int rc = 0;
   std::istringstream in(steps);
@@ -167,8 +159,7 @@ int apply(klpParmClass& p, const std::string& steps) {
   return rc;
 }
 
-// Every setter: what it stores (and from which source), what it refuses and
-// the records it logs, and the logger's console flag that follows slot 4.
+// Every setter: what it stores from which source, its refusals and records; slot 4 is the console flag.
 TEST_F(ParmTest, SettersStoreByPriorityAndLogTheirRefusals) {
   const std::string sp = "<klpParmClass:setParm> 35: ", sps = "<klpParmClass::setParm> 1: ",
                     sb = "<klpParmClass:setBool> 35: ", c1040(1040, 'c'), c1041(1041, 'c');
@@ -239,8 +230,7 @@ TEST_F(ParmTest, ValidValuesAndPendingChanges) {
   EXPECT_EQ(p.getChgParmsEntry(64), nullptr);
 }
 
-// preCmdLine and parseCmdLine (the base processCommandLine): the values they
-// leave (slots 0 to 4 as "value@source") and every record they log.
+// The base processCommandLine: the slots 0 to 4 it leaves and every record it logs.
 TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
   const std::string v1039(1039, 'v'), v1040(1040, 'v'), k33(33, 'K');
   const std::string pc = "<klpParmClass::parseCmdLine> 1: ", sp = "<klpParmClass:setParm> 35: ",
@@ -342,8 +332,7 @@ TEST_F(ParmTest, CommandLineRulesForPathPasswordFileAndPriority) {
   EXPECT_EQ(states(*p_), "A@2 9@3 OLD@4 0:@0 0@0");
 }
 
-// The exact bytes of a query message for a known registry, its printout, and
-// the parsing of a damaged one.
+// A query message's exact bytes, its printout, and the parsing of a damaged one.
 TEST_F(ParmTest, QueryMessageBytesPrintoutAndDamage) {
   klpParmClass& p = *p_;
   ASSERT_EQ(apply(p, "s0=DB1@2;b4=1@3"), 0);
@@ -377,8 +366,7 @@ TEST_F(ParmTest, QueryMessageBytesPrintoutAndDamage) {
   for (int s = -1; s < 7; ++s) labels += std::string(parmSourceLabel(s, "T")) + ",";
   EXPECT_EQ(labels, "UNKNOWN,DEFAULT,T,COMMANDLINE,CHGPARMS COMMAND,SYSTEM OVERRIDE,K APPLY OVERRIDE,UNKNOWN,");
 
-  // A received message is trusted for nothing: every length is checked. cut:
-  // bytes taken off the end; printed: records printed before the end.
+  // Every length received is checked. cut: bytes off the end; printed: records before the end.
   struct { std::vector<std::pair<size_t, uint8_t>> patch; size_t cut; int rc, printed; } cases[] = {
       {{{0, 0}}, msg.size() - 10, 0, 0},  // the bare header of an empty selection
       {{}, msg.size() - 9, 2002, 0},      // shorter than the header
