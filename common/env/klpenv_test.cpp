@@ -60,6 +60,7 @@ TEST_F(Env, ProgramLevelRecordedAndSchemaPutBack) {
   // A long name is cut for the block's fields only; the fields after them keep their contents.
   const klpReleaseBlock& rel = env_->appVersion.rel;
   EXPECT_EQ(rel.version * 100 + rel.release * 10 + rel.modification, 123);
+  EXPECT_EQ(std::string(rel.programFixLevel, 8) + std::string(rel.baseFixLevel, 33), std::string(41, '\0'));
   EXPECT_EQ(std::string(getEnvProgramName(env_)) + " " + getEnvJobName(env_) + " " + rel.programName,
             "averylongprogramname averylong averylong");
   EXPECT_EQ(0, memcmp(reinterpret_cast<const char*>(&env_->appVersion) + 178, "0801", 4));

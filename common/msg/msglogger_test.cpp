@@ -257,6 +257,8 @@ TEST(Issuing, EachFunctionIssuesItsMessages) {
       {[] { logInternalError("where", 2002, "op", ""); }, {"589 <where> 1: where|2002|op"}},
       {[] { auto ca = sqlca(-204, 30000); logSqlError(&ca, "sql", 2, nullptr, "b", "c"); },
        {"552 <sql> 3: |b|c|-204|42704|" + tokens + "|SQLNQ1F0"}},
+      {[] { auto ca = sqlca(-204, -3); logSqlError(&ca, "sql", 2, nullptr, "b", "c"); },  // no tokens
+       {"552 <sql> 3: |b|c|-204|42704||SQLNQ1F0"}},
       {[] { auto ca = sqlca(-964, 2); logSqlError(&ca, "sql", 0, "full", "b", "c"); },
        {"552 <sql> 12: full|b|c|-964|42704|TT|SQLNQ1F0", "554 <sql> 12: full"}},
       {[] { auto ca = sqlca(-952, 2); logSqlError(&ca, "sql", 1, "a", "b", "c"); }, {}},
