@@ -232,7 +232,7 @@ TEST_F(ParmTest, ValidValuesAndPendingChanges) {
 
 // The base processCommandLine: the slots 0 to 4 it leaves and every record it logs.
 TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
-  const std::string v1039(1039, 'v'), v1040(1040, 'v'), k33(33, 'K');
+  const std::string v1039(1039, 'v'), v1040(1040, 'v'), k33(33, 'K'), w41(41, 'w');
   const std::string pc = "<klpParmClass::parseCmdLine> 1: ", sp = "<klpParmClass:setParm> 35: ",
                     step = "589 <klpParmClass::processCommandLi> 1: klpParmClass::processCommandLine|",
                     pf = step + "2002|parseCmdLine", pre = step + "2002|preCmdLine";
@@ -240,6 +240,7 @@ TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
                 const char* sid = nullptr; };
   // Refused by parseCmdLine after a good SERVER: the record before the step's own.
   auto bad = [&](std::string arg, std::string record) { return Case{{"SERVER=a", arg}, 2002, {record, pf}}; };
+  auto ok = [](std::string arg, std::string after) { return Case{{"SERVER=a", arg}, 0, {}, after}; };
   const Case cases[] = {  // after: "" when not looked at
       {{"server=db", "COUNT=7", "go=Q.1"}, 0, {}, "DB@2 7@2 KLP@0 1:Q.1@2 0@0"},
       {{"GO"}, 0, {}, "DB1@0 42@0 KLP@0 1:@0 0@0", "db1"},
@@ -257,9 +258,8 @@ TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
       bad("COUNT=-2147483647", "503 " + sp + "-2147483647|COUNT"), bad("COUNT=101", "503 " + sp + "101|COUNT"),
       {{"SERVER=a", "COUNT=100", "COUNT=1"}, 0, {}, "A@2 1@2 KLP@0 0:@0 0@0"},
       // Switches take Y, YES, N and NO in any case.
-      {{"SERVER=a", "LOGSTDOUT"}, 0, {}, "A@2 42@0 KLP@0 0:@0 1@2"},
       {{"SERVER=a", "logstdout=yEs", "LOGSTDOUT=nO"}, 0, {}, "A@2 42@0 KLP@0 0:@0 0@2"},
-      {{"SERVER=a", "LOGSTDOUT=y"}, 0, {}, "A@2 42@0 KLP@0 0:@0 1@2"},
+      ok("LOGSTDOUT", "A@2 42@0 KLP@0 0:@0 1@2"), ok("LOGSTDOUT=y", "A@2 42@0 KLP@0 0:@0 1@2"),
       bad("LOGSTDOUT=1", "501 " + pc + "1|LOGSTDOUT"), bad("LOGSTDOUT=YESS", "501 " + pc + "YESS|LOGSTDOUT"),
       // Value length: the "=" counts to the 1040; the slot's own limit after.
       {{"SERVER=" + v1040}, 2002, {"502 " + pc + v1040 + "|1041|SERVER|1040", pf}},
@@ -267,17 +267,19 @@ TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
                                    "589 " + pc + "klpParmClass::parseCmdLine|2002|klpParmClass::setParm", pf}},
       // The schema: taken early, checked before it is replaced and at the end;
       // under the user's locale (UTF-8 here) letters of any script, upper-cased.
-      {{"SERVER=a", "schema=my_s"}, 0, {}, "A@2 42@0 MY_S@2 0:@0 0@0"},
-      {{"SERVER=a", "SCHEMA=\"My\""}, 0, {}, "A@2 42@0 My@2 0:@0 0@0"},
+      ok("schema=my_s", "A@2 42@0 MY_S@2 0:@0 0@0"), ok("SCHEMA=\"My\"", "A@2 42@0 My@2 0:@0 0@0"),
       bad("SCHEMA=a-b", "500 " + pc + "a-b|SCHEMA"), bad("SCHEMA=\"a b\"", "500 " + pc + "\"a b\"|SCHEMA"),
-      {{"SERVER=a", "SCHEMA=\xc3\xbc" "ber"}, 0, {}, "A@2 42@0 \xc3\x9c" "BER@2 0:@0 0@0"},
-      {{"SERVER=a", "SCHEMA=\"\xc3\xbc" "b\""}, 0, {}, "A@2 42@0 \xc3\xbc" "b@2 0:@0 0@0"},
+      ok("SCHEMA=\xc3\xbc" "ber", "A@2 42@0 \xc3\x9c" "BER@2 0:@0 0@0"),
+      ok("SCHEMA=\"\xc3\xbc" "b\"", "A@2 42@0 \xc3\xbc" "b@2 0:@0 0@0"),
       bad("SCHEMA=\xc3\xbc-x", "500 " + pc + "\xc3\xbc-x|SCHEMA"),
       bad("SCHEMA=\xff\xfe", "500 " + pc + "\xff\xfe|SCHEMA"),
       bad("SCHEMA=\xe2\x82\xac", "500 " + pc + "\xe2\x82\xac|SCHEMA"),  // a symbol, not a letter
       {{"SCHEMA=a-b", "SCHEMA=good"}, 2002, {"500 <klpParmClass::preCmdLine> 35: a-b|SCHEMA", pre}},
       {{"SCHEMA=ABCDEFGHI"}, 2002, {"502 <klpParmClass::setParm> 1: ABCDEFGHI|9|SCHEMA|8",
                                     "589 <klpParmClass::preCmdLine> 1: klpParmClass::preCmdLine|2002|setParm", pre}},
+      {{"SERVER=a"}, 2002, {"502 <klpParmClass::setParm> 1: " + w41 + "|41|SERVER|40",  // ORACLE_SID too long
+                            "589 <klpParmClass::preCmdLine> 1: klpParmClass::preCmdLine|2002|setParm", pre},
+       "", w41.c_str()},
       {{"PWDFILE=missing.aut", "SERVER=a"}, 806,
        {"545 " + pc + dir_.path() + "missing.aut", step + "806|parseCmdLine"}},
       {{"?"}, 416, {step + "416|preCmdLine"}},
