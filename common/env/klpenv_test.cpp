@@ -1,5 +1,4 @@
-// The process environment: program level, name prefix, IPC directory, and
-// the server's receiving queue with the records each step logs.
+// The process environment: program level, name prefix, IPC directory, receiving queue.
 #include "common/env/klpenv.h"
 
 #include <fcntl.h>
@@ -7,10 +6,8 @@
 #include <mqueue.h>
 #include <unistd.h>
 
-#include <cstdlib>
 #include <cstring>
 #include <string>
-#include <tuple>
 
 #include "common/ipc/ipcmsg.h"
 #include "common/msg/msglogger.h"
@@ -36,10 +33,8 @@ struct ServerParms {
   ~ServerParms() { klpSetCurrentParms(nullptr); }
 };
 
-// Every test starts from a cleared environment and leaves one behind; the
-// logger keeps what is issued.
-class Env : public ::testing::Test {
- protected:
+// A cleared environment before and after; the logger keeps what is issued.
+struct Env : ::testing::Test {
   void SetUp() override {
     ASSERT_EQ(0, klpEnvClear(env_));
     for (char severity : {'E', 'W'}) log_->setRoutingWord(severity, 0);  // kept, not printed
@@ -62,10 +57,10 @@ TEST_F(Env, ProgramLevelRecordedAndSchemaPutBack) {
   EXPECT_GE(env_->startTime, before);
   EXPECT_EQ(parms.p.getParmString(2) + std::to_string(parms.p.getParmSource(2)) +  // the schema
                 log_.get()->getProgramQualifier(), "QRS22QRS2");  // is back, also in the logger
-  // A long name is cut for the block's fields only; the fields after them
-  // keep their contents.
+  // A long name is cut for the block's fields only; the fields after them keep their contents.
   const klpReleaseBlock& rel = env_->appVersion.rel;
   EXPECT_EQ(rel.version * 100 + rel.release * 10 + rel.modification, 123);
+  EXPECT_EQ(std::string(rel.programFixLevel, 8) + std::string(rel.baseFixLevel, 33), std::string(41, '\0'));
   EXPECT_EQ(std::string(getEnvProgramName(env_)) + " " + getEnvJobName(env_) + " " + rel.programName,
             "averylongprogramname averylong averylong");
   EXPECT_EQ(0, memcmp(reinterpret_cast<const char*>(&env_->appVersion) + 178, "0801", 4));
@@ -75,23 +70,20 @@ TEST_F(Env, NamePrefixAndIpcDirectory) {
   EXPECT_EQ(KLP_RC_NO_SERVER, setEnvNamePrefix(env_, "KCAP"));  // no parameter set yet
   EXPECT_EQ(nullptr, getEnvNamePrefix(env_));
   // A trailing dot of the schema is dropped; a prefix longer than its 160
-  // characters is refused whole and the old one stays.
+  // characters is refused whole and the old one stays; the last one names the reply queue.
   ServerParms parms("MYDB", nullptr);
-  const std::string s128(128, 'S'), c26(26, 'C'), c27(27, 'C');
-  const std::tuple<std::string, std::string, int, std::string> cases[] = {
+  const std::string s128(128, 'S'), c26(26, 'C'), c27(27, 'C'), kept = s128 + "." + c26 + ".KCAP";
+  const struct { std::string server, schema; int rc; std::string prefix; } cases[] = {
       {"MYDB", "KLP", 0, "MYDB.KLP.KCAP"}, {"MYDB", "KLP.", 0, "MYDB.KLP.KCAP"},
-      {s128, c27, KLP_RC_TOO_LONG, "MYDB.KLP.KCAP"}, {s128, c26, 0, s128 + "." + c26 + ".KCAP"},
-      {"", "KLP", KLP_RC_NO_SERVER, s128 + "." + c26 + ".KCAP"}};
-  for (const auto& [server, schema, rc, prefix] : cases) {
-    parms.p.setParm(0, server.c_str(), PARM_SRC_COMMANDLINE);
-    parms.p.setParm(2, schema.c_str(), PARM_SRC_COMMANDLINE);
-    EXPECT_EQ(rc, setEnvNamePrefix(env_, "KCAP")) << schema;
-    EXPECT_EQ(prefix, getEnvNamePrefix(env_));
+      {s128, c27, KLP_RC_TOO_LONG, "MYDB.KLP.KCAP"}, {s128, c26, 0, kept},
+      {"", "KLP", KLP_RC_NO_SERVER, kept}, {"DB", "S", 0, "DB.S.KCAP"}};
+  for (const auto& c : cases) {
+    parms.p.setParm(0, c.server.c_str(), PARM_SRC_COMMANDLINE);
+    parms.p.setParm(2, c.schema.c_str(), PARM_SRC_COMMANDLINE);
+    EXPECT_EQ(c.rc, setEnvNamePrefix(env_, "KCAP")) << c.schema;
+    EXPECT_EQ(c.prefix, getEnvNamePrefix(env_));
   }
-
-  // The IPC directory: TMPDIR with its "/", filled once; unset, empty or too
-  // long: the default.
-  // An empty value is followed in memory by another character, never read.
+  // IPC directory: TMPDIR and "/", filled once; else /tmp/ (an empty value's next byte is never read).
   const std::string longest(1038, 'd');
   const std::pair<std::string, std::string> dirs[] = {
       {"TMPDIR=/x/tmp", "/x/tmp/"}, {"TMPDIR=/else/", "/else/"}, {"", "/tmp/"},
@@ -104,9 +96,6 @@ TEST_F(Env, NamePrefixAndIpcDirectory) {
     EXPECT_EQ(dir, getEnvIPCDir(env_)) << entry;
     env_->ipcDir[0] = '\0';
   }
-  parms.p.setParm(0, "DB", PARM_SRC_COMMANDLINE);
-  parms.p.setParm(2, "S", PARM_SRC_COMMANDLINE);
-  ASSERT_EQ(0, setEnvNamePrefix(env_, "KCAP"));
   setenv("TMPDIR", "/d/t", 1);
   char path[256];
   ASSERT_EQ(0, ipcEnvReplyQueuePath(path, sizeof path, 4711));
@@ -119,8 +108,7 @@ TEST_F(Env, ReceivingQueueStepsAndTheirRecords) {
   const std::string path = dir_.path() + "MYDB.KLP.KCAP.IPC";
   HSVResID id;
   ASSERT_EQ(ECF_OK, hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id));
-  // Puts one request, on a queue an earlier server created and left behind
-  // or on the one that serves now.
+  // Puts one request, on a queue a crashed server left behind or on the live one.
   auto putOne = [&](bool create) {
     HSVHIPCQueue q;
     IpcMsg* msg = nullptr;
@@ -153,14 +141,13 @@ TEST_F(Env, ReceivingQueueStepsAndTheirRecords) {
     klptest::Child other = klptest::inChild(dir_.path(), [&] { return putOne(false); });
     char buf[IPC_MAX_MSG_SIZE];
     size_t len = 0;
-    IpcMsgView view;
+    IpcMsgView view{};
     bool got = getEnvIpcQRcvHdl(env_)->get(buf, sizeof buf, &len, 20000) == ECF_OK &&
                ipcDecodeMsg(buf, len, &view) == 0;
     step("reached by another process", other.exitCode + (got ? view.header.subFunc : -1));
     delEnvIpcQRcvHdl(env_);
     step("destroyed", klptest::queueExists(path) + self->rcvyMgr.resList.count);
-    delEnvIpcQRcvHdl(env_);
-    step("destroyed again", 0);
+    step("destroyed again", (delEnvIpcQRcvHdl(env_), 0));
     step("stale", putOne(true) + setEnvIpcQRcvHdl(env_));
     step("stale request kept", getEnvIpcQRcvHdl(env_)->hasMessage());
     delEnvIpcQRcvHdl(env_);
@@ -180,9 +167,8 @@ TEST_F(Env, ReceivingQueueStepsAndTheirRecords) {
   });
   EXPECT_EQ(0, c.exitCode);
   std::string out = c.out;
-  const std::string name = std::string("(mqueue, ") + id.posixName() + ", 48)";
-  for (size_t at; (at = out.find(name)) != std::string::npos;) out.replace(at, name.size(), "Q");
-  for (size_t at; (at = out.find(path)) != std::string::npos;) out.replace(at, path.size(), "P");
+  for (auto [from, to] : {std::pair{std::string("(mqueue, ") + id.posixName() + ", 48)", "Q"}, {path, "P"}})
+    for (size_t at; (at = out.find(from)) != std::string::npos;) out.replace(at, from.size(), to);
   EXPECT_EQ(out, klptest::readFile(KLP_SOURCE_DIR "/common/env/receiving_queue.golden"));
   EXPECT_FALSE(klptest::queueExists(path));
 }
