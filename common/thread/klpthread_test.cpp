@@ -58,12 +58,12 @@ bool onIdList(klpThread* t) { return t->tid.oleAnchor == klpThreadIdList(); }
 // Real threads on a shared list, with the main thread registered first.
 struct MtThread : ::testing::Test {
   klptest::TmpDir tmp;
+  klptest::LogRecords records{tmp.path()};
   OrdList list{"Threads"};
   int highest = 3;
   void SetUp() override {
     klptest::mainThreadReady();
-    g_release = false;
-    g_runs = 0;
+    g_release = false, g_runs = 0;
     list.makeShared(nullptr, 1);
   }
   klpThread* make(const char* name, int restart = 1, int critical = 0, int shared = 0) {
@@ -76,7 +76,6 @@ struct MtThread : ::testing::Test {
 };
 
 TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
-  klptest::LogRecords records(tmp.path());
   klpThread* t = make("Worker");
   ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
   EXPECT_TRUE(g_seenCurrent == t && g_seenState == KLP_THREAD_INIT && onIdList(t));
@@ -116,7 +115,6 @@ TEST(KlpThreadFirst, OnlyOneOfTwoThreadsAtOnceTakesTheFirstPrologue) {
 }
 
 TEST_F(MtThread, StopRemovesAnEndedThreadEndsAWorkingOneAndWithdrawsOneItMustCutOff) {
-  klptest::LogRecords records(tmp.path());
   struct { const char* name; int32_t ready; int rc; const char* log; } rows[] = {  // ready: stopped in
       {"Ender", KLP_THREAD_STOP, 77, "590|klpThread::stop|1|Initial|77|Ender"},  // its end code
       {"NoEnd", KLP_THREAD_STOP, 2011, "590|klpThread::stop|1|Initial|2011|NoEnd"},  // returned
@@ -211,19 +209,6 @@ TEST_F(MtThread, SupervisionJudgesTheSetRestartsAndRemoves) {
   EXPECT_EQ(1, g_runs.load());
 }
 
-TEST(KlpThread, ConnectionLookupCreatesOnlyForKindOAndAStopInterruptsTheWorkInProgress) {
-  klpThread t;
-  klpDbConn* o = t.getThrdCtlConn('O', "ORCL", 1208);
-  EXPECT_TRUE(o && o == t.getThrdCtlConn('O', "ORCL", 1208) && o != t.getThrdCtlConn('O', "ORCL", 819));
-  EXPECT_EQ(nullptr, t.getThrdCtlConn('D', "SAMPLE", 1208));
-  klpDbConn* d = t.connect('D', "SAMPLE", 1208);
-  EXPECT_EQ(d, t.getThrdCtlConn('D', "SAMPLE", 1208));
-  t.interruptDbWork(), t.detachCurrentConn();  // the current connection,
-  t.interruptDbWork();                         // then, with none, the database context
-  EXPECT_TRUE(d->interrupts == 1 && t.dbCtx.interrupts == 1);
-  t.cleanupConns();  // the sanitizer build reports a leak if one is left
-}
-
 using Logs = std::vector<std::string>;
 
 void action(uint64_t arg) { printf("action %d\n", static_cast<int>(arg)), fflush(stdout); }
@@ -231,12 +216,8 @@ void action(uint64_t arg) { printf("action %d\n", static_cast<int>(arg)), fflush
 bool endsWithMarker(const std::string& s) { return s.rfind(std::string("***E**O**D**M***\0", 17)) == s.size() - 17; }
 HSVHIPCQueue* g_ipcQueue = nullptr;  // of the queue actions: outlives every frame
 
-// Every routine of the folder that reports, with the records it logs; a stop's and the
-// signal handler's are with their tables.
-TEST(ThreadRecords, EachRoutineLogsItsRecords) {
-  klptest::mainThreadReady();
-  klptest::TmpDir tmp;
-  klptest::LogRecords records(tmp.path());
+// Routines with the records they log (a stop's and the signal handler's are with their tables).
+TEST_F(MtThread, EachRoutineLogsItsRecords) {
   char owner[32], ref[24];
   snprintf(owner, sizeof owner, "Initial:0x%08x",
            static_cast<unsigned>(reinterpret_cast<uintptr_t>(klpMainThread()) & 0xFFFFFFFFu));
@@ -265,6 +246,19 @@ TEST(ThreadRecords, EachRoutineLogsItsRecords) {
   };
   const std::string what = "591|recoveryMgr::erWhatSignal|1|Initial|";
   struct { std::function<void()> run; Logs logs; } rows[] = {
+      {[] {  // connections are made for kind O only; a stop interrupts the work in progress
+         klpThread t;
+         klpDbConn* o = t.getThrdCtlConn('O', "ORCL", 1208);
+         EXPECT_TRUE(o && o == t.getThrdCtlConn('O', "ORCL", 1208) && o != t.getThrdCtlConn('O', "ORCL", 819));
+         EXPECT_EQ(nullptr, t.getThrdCtlConn('D', "SAMPLE", 1208));
+         klpDbConn* d = t.connect('D', "SAMPLE", 1208);
+         EXPECT_EQ(d, t.getThrdCtlConn('D', "SAMPLE", 1208));
+         t.interruptDbWork(), t.detachCurrentConn();  // the current connection,
+         t.interruptDbWork();                         // then, with none, the database context
+         EXPECT_TRUE(d->interrupts == 1 && t.dbCtx.interrupts == 1);
+         t.cleanupConns();  // the sanitizer build reports a leak if one is left
+       },
+       {}},
       {[] {  // a new thread wants STOP, RESUME and SUSPEND; codes beyond 0..63 are refused
          klpThread t;
          for (int code = -1; code <= 64; ++code)
@@ -362,8 +356,7 @@ void sigBody(klpThread* t) {
   if (g_plan.sig == 0) t->setState(KLP_THREAD_WAIT);
   for (int i = 0; i < 2000 && g_plan.sig == 0 && !g_release; ++i) hsvSleep(5);
   sigset_t set;  // created threads block SIGINT and SIGTERM: unblocked on purpose
-  erProcessSignals(&set);
-  pthread_sigmask(SIG_UNBLOCK, &set, nullptr);
+  erProcessSignals(&set), pthread_sigmask(SIG_UNBLOCK, &set, nullptr);
   raise(g_plan.sig);
   threadEnd(t, 0);
 }
@@ -413,13 +406,12 @@ int drive(const Plan& plan) {
   list.makeShared(nullptr, 1);
   int code = -1, highest = 0;
   klpThread* t = createThread(&code, &list, sigBody, "Sig", nullptr, 1, nullptr, 0, 0);
-  auto is = [t](int32_t s) { return klptest::waitFor([&] { return t->getState() == s; }); };
-  if (has('s') && is(KLP_THREAD_WAIT)) {
+  if (has('s') && waitState(t, KLP_THREAD_WAIT)) {
     pthread_mutex_lock(&g_order);
     printf("stop=%d\n", klpThread::stop(t));  // withdrawn: on its way out, or still waiting
     pthread_mutex_unlock(&g_order), g_release = true;
   }
-  int supervised = has('r') && is(KLP_THREAD_STOP) ? supervise(&list, 0, &highest) : 0;
+  int supervised = has('r') && waitState(t, KLP_THREAD_STOP) ? supervise(&list, 0, &highest) : 0;
   void* ret = nullptr;
   pthread_join(t->handle, &ret);
   if (has('r')) printf("supervised=%d\n", supervised);  // printed once the new run is over
@@ -429,10 +421,7 @@ int drive(const Plan& plan) {
   return 0;
 }
 
-TEST(SigRecovery, SignalsComeBackToTheThreadsRecoveryPointWithItsCleanUpsOrEndTheProcess) {
-  klptest::mainThreadReady();
-  klptest::TmpDir tmp;
-  klptest::LogRecords records(tmp.path());
+TEST_F(MtThread, SignalsComeBackToTheThreadsRecoveryPointWithItsCleanUpsOrEndTheProcess) {
   const std::string sig = "591|recoveryMgr::erWhatSignal|1|Sig|";
   const std::string stop = "590|klpThread::stop|1|Initial|0|Sig";
   const std::string ret = "return 1 rc=2009 signal=", ended = "end=2009 code=2009 global=";

@@ -57,7 +57,7 @@ std::string play(const char* script, bool locked) {
   return out;
 }
 
-TEST(OrdList, PutsTakesBrowsesAndDeChainsKeepOrderAndLinks) {
+TEST(OrdList, PutsTakesBrowsesDeChainsAndDeletesKeepOrderAndLinks) {
   struct { const char* script; const char* gives; } rows[] = {
       {"T1 T2 T3 h h h h t", "1 2 3 - - "},  // first in, first out; empty: null
       {"H1 H2 H3 h t h", "3 1 2 "},          // putHead reverses
@@ -69,10 +69,7 @@ TEST(OrdList, PutsTakesBrowsesAndDeChainsKeepOrderAndLinks) {
   };
   for (bool locked : {false, true})
     for (const auto& row : rows) EXPECT_EQ(row.gives, play(row.script, locked)) << row.script;
-}
-
-TEST(OrdList, DelListFreesEveryElementAndADestroyedListLeavesThemFree) {
-  OrdList two;
+  OrdList two;  // delList frees every element; a destroyed list leaves its elements free
   for (int i = 0; i < 5; ++i) two.putTail(new OrdListElement);
   two.delList();  // the sanitizer build reports a leak if one is left
   EXPECT_TRUE(two.count == 0 && !two.olHead && !two.olTail);
@@ -142,7 +139,7 @@ TEST(MtOrdList, TheOwnerReentersAndOnlyItsLastReleaseLetsOthersIn) {
 struct Rec { QueueElement qe; int id; };
 int idOf(OrdListElement* e) { return e ? reinterpret_cast<Rec*>(e)->id : 0; }
 
-TEST(Queue, TakesFollowTheEndsAndThePrioritiesWithoutWaiting) {
+TEST(Queue, TakesFollowTheEndsAndThePrioritiesAndAWaitTimesOutOnlyWhenEmpty) {
   // Elements 1, 2, 3 put (T putTail, H putHead, or a priority digit), taken from the head (h)
   // or the tail (t) in this order (0: none).
   struct { const char* puts, *ends, *order; } rows[] = {
@@ -168,10 +165,7 @@ TEST(Queue, TakesFollowTheEndsAndThePrioritiesWithoutWaiting) {
     EXPECT_TRUE(q.count == 0 && !q.head && !q.tail && !r[0].qe.ole.olePrev && !r[0].qe.ole.oleNext);
     EXPECT_TRUE(q.idlePosts == 3 && q.waitpost.wait(0) == ECF_TIMEOUT);  // nobody waited: no post
   }
-}
-
-TEST(Queue, AWaitTakesAtOnceWhenItNeedNotWaitAndTimesOutOnAnEmptyQueue) {
-  Queue q;
+  Queue q;  // a wait takes at once when it need not wait; on an empty queue it times out
   Rec a{{}, 1};
   for (int32_t wait : {0, -5}) EXPECT_TRUE(q.getHeadWithWait(&wait) == nullptr && wait == 0);
   q.putTailAndNotify(&a.qe.ole);
