@@ -1,5 +1,4 @@
-// Resource ids, wait/post, clocks, processes, libraries, the trap file; queues, shared memory
-// and byte locks between processes.
+// The platform layer: ids, wait/post, clocks, processes, libraries, trap files and IPC.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <mqueue.h>
@@ -48,7 +47,7 @@ TEST(ResID, NamesAreTheFnv1aHashOfThePath) {
   EXPECT_STREQ("unknown platform error", ecfErrorGetDescription(0x12345678));
 }
 
-TEST(Waitpost, PostsAreKeptOneAWaitAndDestroyWakesAWaiter) {
+TEST(Waitpost, PostsAreKeptOneAWaitAndDestroyWakesAWaiterAndRacingCalls) {
   HSVHIPCWaitpost wp;
   EXPECT_TRUE(wp.wait(0) == ECF_WAITPOST_NOT_INITIALIZED && wp.post() == ECF_WAITPOST_NOT_INITIALIZED);
   ASSERT_EQ(ECF_OK, wp.create(HSV_CREATE_OPTION));
@@ -67,11 +66,7 @@ TEST(Waitpost, PostsAreKeptOneAWaitAndDestroyWakesAWaiter) {
   EXPECT_EQ(ECF_OK, wp.destroy());
   waiter.join();
   EXPECT_TRUE(result == ECF_WAITPOST_NOT_INITIALIZED && wp.wait(0) == ECF_WAITPOST_NOT_INITIALIZED);
-}
-
-// Calls racing with destroy and create find the object closed or open, never freed state.
-TEST(Waitpost, CallsRacingWithDestroyFindItClosedOrOpen) {
-  HSVHIPCWaitpost wp;
+  // Calls racing with destroy and create find the object closed or open, never freed state.
   ASSERT_EQ(ECF_OK, wp.create(HSV_CREATE_OPTION));
   std::atomic<bool> done{false};
   std::atomic<int> odd{0};
@@ -86,7 +81,7 @@ TEST(Waitpost, CallsRacingWithDestroyFindItClosedOrOpen) {
   EXPECT_EQ(0, odd.load());
 }
 
-TEST(Clock, TimeAndIds) {
+TEST(Process, ClockIdsAndHelpersStartWithDefaultDispositions) {
   HSVTimeUTC t = hsvTimeGetUTC();
   struct tm local {};
   EXPECT_LE(std::llabs(t.seconds - static_cast<int64_t>(time(nullptr))), 2);
@@ -94,11 +89,7 @@ TEST(Clock, TimeAndIds) {
   EXPECT_FALSE(hsvTimeGmTime(0, nullptr) || hsvTimeLocalTime(0, nullptr));
   EXPECT_TRUE(hsvThreadID() == static_cast<uint64_t>(syscall(SYS_gettid)) && hsvProcessID() == getpid());
   EXPECT_EQ(ECF_OK, hsvOneTimeOnly() | hsvOneTimeOnly());
-}
-
-// Helpers start with default signal dispositions, whatever the caller ignores;
-// what cannot be run is not found.
-TEST(Process, HelpersStartWithDefaultDispositions) {
+  // Helpers start with default signal dispositions; what cannot be run is not found.
   klptest::TmpDir tmp;
   std::ofstream(tmp.path() + "plain") << "exit 0\n";  // not executable
   const char* const term[] = {"sh", "-c", "kill -TERM $$; exit 3", nullptr};
@@ -147,11 +138,9 @@ TEST(TrapFile, DumpFromASignalHandlerIsAppended) {
     if (trap.open(file.c_str(), HSV_TRAPFILE_OPEN_OPTION) | trap.seekToEnd()) return 1;
     gTrap = &trap;
     struct sigaction sa {};
-    sa.sa_sigaction = dumpAndExit;
-    sa.sa_flags = SA_SIGINFO;
+    sa.sa_sigaction = dumpAndExit, sa.sa_flags = SA_SIGINFO;
     sigaction(SIGSEGV, &sa, nullptr);
-    printf("%d", getpid());
-    fflush(stdout);
+    printf("%d", getpid()), fflush(stdout);
     *static_cast<volatile int*>(page) = 1;  // traps
     return 3;
   });
@@ -178,8 +167,7 @@ TEST(TrapFile, DumpFromASignalHandlerIsAppended) {
   EXPECT_EQ(ECF_NOT_ATTACHED, t.close());
 }
 
-// The test's queue and shared-memory block (not a page multiple: attach must
-// report this size), created first and checked gone at the end.
+// A queue and a block (not a page multiple: attach reports this size), gone at the end.
 struct IpcTest : ::testing::Test {
   static constexpr size_t kSize = 100000;
   klptest::TmpDir tmp;
@@ -218,8 +206,7 @@ std::string message(int i) {
   return m;
 }
 
-// Several times the queue's depth, so the sender waits for room; a wait for a
-// message takes none; both processes see the same bytes.
+// More than the queue holds (the sender waits for room); a wait takes none; the same bytes.
 TEST_F(IpcTest, MessagesAndBytesCrossProcessesWholeAndInOrder) {
   auto* p = static_cast<char*>(m.getAddress());
   EXPECT_TRUE(m.getSize() == kSize && std::string(p, kSize) == std::string(kSize, '\0'));
@@ -244,10 +231,8 @@ TEST_F(IpcTest, MessagesAndBytesCrossProcessesWholeAndInOrder) {
   EXPECT_STREQ("from child", p + kSize - 11);
 }
 
-// A queue or block made first under our name by someone else: only a private
-// one of ours is used. A second user is not at hand in a test, but the mode
-// such a user would have to grant us is, and is refused the same way. Root
-// opens a read-only object all the same, so that row is for other users.
+// Objects made first under our name: only private ones of ours are used (the mode another
+// user would have to grant stands for that user; root opens a read-only one all the same).
 TEST_F(IpcTest, OnlyPrivateObjectsOfOursAreUsed) {
   ASSERT_EQ(ECF_OK, q.destroy() | m.destroy());
   const struct { mode_t mode; hsvRC attach, create; } rows[] = {
@@ -272,8 +257,7 @@ TEST_F(IpcTest, OnlyPrivateObjectsOfOursAreUsed) {
   ASSERT_EQ(ECF_OK, q.create(id, HSV_MAX_MSG_SIZE, 51) | m.create(mid, kSize, 51));
 }
 
-// What callers pass is checked: lengths, buffers, ids, the object's state. A
-// refused get leaves the message where it was.
+// Callers' lengths, buffers, ids and object state are checked; a refused get leaves the message.
 TEST_F(IpcTest, CallersMistakesAreRefused) {
   HSVHIPCQueue closed;
   HSVHIPCMemory none;

@@ -94,13 +94,11 @@ TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
   EXPECT_EQ("Worker>8006|body|1|fromWorker", got.empty() ? "" : got[0]);
 }
 
-// Two threads run their first prologue at once; exits 0 when exactly one of
-// them took the process's first prologue. The first to take it is held at
-// the thread-id list's lock meanwhile, so the other surely comes by.
+// Exits 0 when exactly one of two threads took the first prologue; the id list's lock holds
+// the first to take it, so the other surely comes by.
 void firstPrologueRace() {
   OrdList* ids = klpThreadIdList();
-  ids->makeShared("KlpThreadIDList", 0);
-  ids->lockList();
+  ids->makeShared("KlpThreadIDList", 0), ids->lockList();
   klpThread a, b;
   std::thread ta(klpThread::prologue, &a), tb(klpThread::prologue, &b);
   hsvSleep(200);  // not needed for the verdict: lets both threads come by
@@ -147,8 +145,7 @@ TEST_F(MtThread, StopRemovesAnEndedThreadEndsAWorkingOneAndWithdrawsOneItMustCut
   klpThread::stop(t);
 }
 
-// After a failed stop, stop all rests a while: shown as resting (state 5)
-// unless the thread waits for its database (8), and its state comes back.
+// After a failed stop, stop all rests (state 5) unless waiting for the database (8), then restores.
 TEST_F(MtThread, StopAllToleratesOnlyAnUnstoppableHoldLThreadAndRestsAfterAFailure) {
   EXPECT_EQ(0, stopAll(nullptr));
   for (const char* name : {"HoldLThread", "HoldOn"}) {
@@ -158,9 +155,7 @@ TEST_F(MtThread, StopAllToleratesOnlyAnUnstoppableHoldLThreadAndRestsAfterAFailu
     int32_t before = name[4] == 'L' ? KLP_THREAD_RUN : KLP_THREAD_DBWAIT;
     m->setState(before);
     std::atomic<bool> rested{false}, stopped{false};
-    std::thread watcher([&] {
-      for (; !stopped; hsvSleep(1)) rested = rested || m->getState() == KLP_THREAD_REST;
-    });
+    std::thread watcher([&] { for (; !stopped; hsvSleep(1)) rested = rested || m->getState() == KLP_THREAD_REST; });
     EXPECT_EQ(name[4] == 'L' ? 0 : KLP_RC_RECOVERED, stopAll(&list)) << name;
     stopped = true;
     watcher.join();
@@ -263,16 +258,14 @@ TEST_F(MtThread, EachRoutineLogsItsRecords) {
          klpThread t;
          for (int code = -1; code <= 64; ++code)
            EXPECT_EQ(code == 14 || code == 18 || code == 19, interestedInCmd(&t, code)) << code;
-         setCmdInterest(&t, 20, 7);
-         setCmdInterest(&t, 64, 1);
+         setCmdInterest(&t, 20, 7), setCmdInterest(&t, 64, 1);
          EXPECT_EQ(7, interestedInCmd(&t, 20));
        },
        {"8006|klpThread::interestedInCmd|1|-1", "8006|klpThread::interestedInCmd|1|64",
         "8006|klpThread::setCmdInterest|1|64"}},
       {[] {  // unlocked by a thread that does not hold the lock
          OrdList l("Guarded");
-         l.makeShared(nullptr, 1);
-         l.lockList();
+         l.makeShared(nullptr, 1), l.lockList();
          std::thread([&] { EXPECT_EQ(1005, l.unlockList()); }).join();
          EXPECT_TRUE(l.depth() == 1 && l.owner() == klpMainThread());  // still ours
          EXPECT_EQ(0, l.unlockList());
@@ -326,13 +319,10 @@ TEST_F(MtThread, EachRoutineLogsItsRecords) {
   }
 }
 
-// Signals, in forked children: the handler jumps, threads end and the process-wide record
-// changes, none of which may touch the test process. The thread "Sig" adds the resources of
-// its pass (passes split by '|'), then raises sig on itself (0: waits in state 7 for a stop).
-// Flags: u no prologue; n no recovery point; c carries on after a return there (else ends
-// with the code); l raises inside the thread-id list's lock; d gives its point up before it
-// waits. The main thread: s stops it; r restarts it once ended; e catches ending signals
-// first; C, O make a library call instead.
+// Signals, in forked children. Thread "Sig" adds its pass's resources (passes split by '|'),
+// then raises sig (0: waits in state 7). Flags: u no prologue; n no recovery point; c carries
+// on after a return (else ends with its code); l raises in the id list's lock; d gives its point
+// up first. Main thread: s stops it; r restarts it; e catches ending signals; C, O library calls.
 struct Plan { const char* adds; int sig; const char* flags; } g_plan;
 int g_pass = 0;
 // Makes the stopper's message come first (a signal is no ordering the race detector sees).
@@ -365,8 +355,7 @@ std::atomic<int> g_callerSaw{0};
 std::atomic<bool> g_inCall{false};
 void callerHandler(int sig) { g_callerSaw = sig; }
 
-// Calls of the control interface with a clean-up registered and a SIGINT on the call's own
-// thread or on another of the caller's; the caller's handler is back afterwards.
+// Interface calls with a clean-up and a SIGINT on their own thread or another; the caller's handler comes back.
 int libraryCall(bool otherThread) {
   std::thread other([otherThread] {
     if (otherThread && klptest::waitFor([] { return g_inCall.load(); })) raise(SIGINT);
@@ -422,8 +411,7 @@ int drive(const Plan& plan) {
 }
 
 TEST_F(MtThread, SignalsComeBackToTheThreadsRecoveryPointWithItsCleanUpsOrEndTheProcess) {
-  const std::string sig = "591|recoveryMgr::erWhatSignal|1|Sig|";
-  const std::string stop = "590|klpThread::stop|1|Initial|0|Sig";
+  const std::string sig = "591|recoveryMgr::erWhatSignal|1|Sig|", stop = "590|klpThread::stop|1|Initial|0|Sig";
   const std::string ret = "return 1 rc=2009 signal=", ended = "end=2009 code=2009 global=";
   // The signal that ends the process (0: none), the trap line's part (null: none), output, records.
   struct { Plan plan; int endSig; const char* trap; std::string out; Logs logs; } rows[] = {

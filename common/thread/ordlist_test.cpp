@@ -22,11 +22,9 @@ void expectSound(OrdList& l) {
   EXPECT_TRUE(last == l.olTail && n == l.count);
 }
 
-// Runs a script over elements 0..9 and answers what each take and browse
-// gave ("-": none), checking the list after every step and that a removed
-// element is left free. Tn putTail, Hn putHead, h getHead, t getTail,
-// Dn ordListDeChain, Wn withdraw, b browseHead, B browseTail, Pn browsePrev,
-// Nn browseNext, Xn put on another list (refused while on this one).
+// What each take and browse of a script over elements 0..9 gave ("-": none), the list checked
+// at every step. Tn putTail, Hn putHead, h getHead, t getTail, Dn ordListDeChain, Wn withdraw,
+// b browseHead, B browseTail, Pn browsePrev, Nn browseNext, Xn put on another list (refused).
 std::string play(const char* script, bool locked) {
   OrdListElement items[10];  // outlive the list, which unlinks them
   OrdList l("Script");
@@ -107,9 +105,7 @@ TEST(OrdList, PrintsAndADamagedElementOrListIsFatalWithDiagnosticsOnStandardOutp
       l.print(), OrdList::print(&a);
       klpThread t;
       t.setName("BehinderWorkerThread"), t.endCode = 7;  // the name cut to 14
-      klpThread::print(&t);
-      t.restart = 0;
-      klpThread::print(&t);
+      for (int restart : {1, 0}) t.restart = restart, klpThread::print(&t);
       return 0;
     });
     EXPECT_EQ(row.signal, c.signal);
@@ -140,8 +136,7 @@ struct Rec { QueueElement qe; int id; };
 int idOf(OrdListElement* e) { return e ? reinterpret_cast<Rec*>(e)->id : 0; }
 
 TEST(Queue, TakesFollowTheEndsAndThePrioritiesAndAWaitTimesOutOnlyWhenEmpty) {
-  // Elements 1, 2, 3 put (T putTail, H putHead, or a priority digit), taken from the head (h)
-  // or the tail (t) in this order (0: none).
+  // Elements 1-3 put (T tail, H head, or a priority digit), taken from the head h or tail t (0: none).
   struct { const char* puts, *ends, *order; } rows[] = {
       {"TTH", "thtt", "2310"},  // 3 1 2 from the head
       {"HHH", "hhh", "321"},
