@@ -284,8 +284,6 @@ TEST_F(IpcTest, CallersMistakesAreRefused) {
   EXPECT_EQ("hello", got());
 }
 
-void ignoreSignal(int) {}
-
 // A signal (no SA_RESTART) must not cut a timed wait short; a full queue times out.
 TEST_F(IpcTest, WaitsLastThroughSignals) {
   const std::pair<const char*, std::function<void()>> rows[] = {
@@ -297,7 +295,7 @@ TEST_F(IpcTest, WaitsLastThroughSignals) {
          EXPECT_TRUE(q.putWait(&len, sizeof len, 0) == ECF_QUEUE_FULL && q.putWait(&len, sizeof len, 250) == ECF_QUEUE_FULL);
        }}};
   struct sigaction sa {}, old{};
-  sa.sa_handler = ignoreSignal;
+  sa.sa_handler = [](int) {};
   ASSERT_EQ(0, sigaction(SIGUSR2, &sa, &old));
   for (const auto& [what, wait] : rows) {
     std::thread poker([self = pthread_self()] {

@@ -157,8 +157,7 @@ TEST_F(MtThread, StopAllToleratesOnlyAnUnstoppableHoldLThreadAndRestsAfterAFailu
     std::atomic<bool> rested{false}, stopped{false};
     std::thread watcher([&] { for (; !stopped; hsvSleep(1)) rested = rested || m->getState() == KLP_THREAD_REST; });
     EXPECT_EQ(name[4] == 'L' ? 0 : KLP_RC_RECOVERED, stopAll(&list)) << name;
-    stopped = true;
-    watcher.join();
+    stopped = true, watcher.join();
     EXPECT_TRUE(rested == (before == KLP_THREAD_RUN) && m->getState() == before);
     EXPECT_TRUE(hold->ole.withdrawn && list.count == 1);  // only the withdrawn one is left
     m->setState(KLP_THREAD_RUN);
@@ -169,8 +168,7 @@ TEST_F(MtThread, StopAllToleratesOnlyAnUnstoppableHoldLThreadAndRestsAfterAFailu
 }
 
 TEST_F(MtThread, SupervisionJudgesTheSetRestartsAndRemoves) {
-  // Threads by name as body ("!" critical, "-" no restart), their end code, the stopping flag,
-  // per pass the result and the threads left, the highest end code from 3.
+  // Threads ("!" critical, "-" no restart), end code, stopping, per pass result and threads left, highest.
   struct { std::vector<const char*> threads; int endWith, stopping; std::vector<std::pair<int, int>> passes;
            int highest; } rows[] = {
       {{}, 0, 0, {{2007, 0}}, 3},
