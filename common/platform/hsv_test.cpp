@@ -45,6 +45,7 @@ TEST(ResID, NamesAreTheFnv1aHashOfThePath) {
             printable(raw));
   EXPECT_STREQ("time-out", ecfErrorGetDescription(0x90000013));
   EXPECT_STREQ("unknown platform error", ecfErrorGetDescription(0x12345678));
+  for (hsvRC c = 0x90000000; c <= 0x90000401; ++c) ASSERT_NE(nullptr, ecfErrorGetDescription(c)) << c;  // printed with %s
 }
 
 TEST(Waitpost, PostsAreKeptOneAWaitAndDestroyWakesAWaiterAndRacingCalls) {
@@ -92,7 +93,7 @@ TEST(Process, ClockIdsAndHelpersStartWithDefaultDispositions) {
   // Helpers start with default signal dispositions; what cannot be run is not found.
   klptest::TmpDir tmp;
   std::ofstream(tmp.path() + "plain") << "exit 0\n";  // not executable
-  const char* const term[] = {"sh", "-c", "kill -TERM $$; exit 3", nullptr};
+  const char* const term[] = {"sh", "-c", "echo x || exit 4; kill -TERM $$; exit 3", nullptr};  // stdout writable
   int32_t pid = 0;
   int code = 0;
   sighandler_t old = signal(SIGTERM, SIG_IGN);
