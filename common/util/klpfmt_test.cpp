@@ -36,9 +36,8 @@ std::vector<uint8_t> varId(std::initializer_list<uint8_t> bytes, int16_t count) 
   return v;
 }
 
-// "answer:text" of a buffer form given `size` characters ("x" where nothing
-// was written; "overflow" when it wrote beyond them); INTO(size, call) makes
-// the call with buffer b of k = size.
+// "answer:text" of a call with buffer b of k = size characters ("x" where nothing
+// was written; "overflow" when it wrote beyond them).
 std::string into(size_t size, const std::function<int(char*, size_t)>& f) {
   char buf[300];
   memset(buf, 'x', sizeof buf);
@@ -120,20 +119,20 @@ TEST(Fmt, TextsAndTheirBufferBounds) {
 
   // The print forms, bounded by their 256-character work buffer.
   const std::string p239(239, 'p'), p240(240, 'p');
-  testing::internal::CaptureStdout();
-  printLogPosWords("[", kLogPos, "]");
-  printLogPosBytes("", kLogPos, "");
-  printNumPair("", 7, 1234, "|");
-  printVarId("<", varId({1, 2, 3}, 3).data(), ">");
-  printLsn("", kLsn, "\n");
-  printLsn(p239.c_str(), kLsn, "");
-  printLsn(p240.c_str(), kLsn, "");
-  printLogPosWords(p240.c_str(), kLogPos, "");
-  printVarId(std::string(236, 'p').c_str(), four.data(), "");
-  EXPECT_EQ("[0001:0203:0405:0607:0809]0001:0203:0405:0607:0809\n0007:1234|<0102:0300>"
-            "0123456789abcdef\n" + p239 + "0123456789abcdef...buffer full\n...buffer full\n"
-            "...buffer full\n",
-            testing::internal::GetCapturedStdout());
+  auto printed = klptest::stdoutOf([&] {
+    printLogPosWords("[", kLogPos, "]");
+    printLogPosBytes("", kLogPos, "");
+    printNumPair("", 7, 1234, "|");
+    printVarId("<", varId({1, 2, 3}, 3).data(), ">");
+    printLsn("", kLsn, "\n");
+    printLsn(p239.c_str(), kLsn, "");
+    printLsn(p240.c_str(), kLsn, "");
+    printLogPosWords(p240.c_str(), kLogPos, "");
+    printVarId(std::string(236, 'p').c_str(), four.data(), "");
+  });
+  EXPECT_EQ(printed, "[0001:0203:0405:0607:0809]0001:0203:0405:0607:0809\n0007:1234|<0102:0300>"
+                     "0123456789abcdef\n" + p239 + "0123456789abcdef...buffer full\n"
+                     "...buffer full\n...buffer full\n");
 }
 
 TEST(Fmt, IdentifiersWordsAndPads) {
@@ -196,8 +195,7 @@ TEST(Fmt, CompatibilityLevelOfTheServerWorkedOutOnce) {
   }
 }
 
-// The program's own files, and each helper that reports: its answer and
-// the records it logs.
+// The program's own files, and each helper that reports: its answer and its records.
 TEST(Fmt, ProgramFilesAndTheReportsOfTheHelpers) {
   klptest::TmpDir dir;
   klptest::ProcessLogger log;
@@ -219,9 +217,9 @@ TEST(Fmt, ProgramFilesAndTheReportsOfTheHelpers) {
   buildXqpubParmTable(t);
   int rc = 0;
   xqpubParms parms(t, XQPUB_PARM_COUNT, &rc);
-  parms.setParm(PARM_IDX_SERVER, "DB", PARM_SRC_COMMANDLINE);
-  parms.setParm(PARM_IDX_SCHEMA, "K", PARM_SRC_COMMANDLINE);
-  parms.setParm(PARM_IDX_PATH, dir.path().c_str(), PARM_SRC_COMMANDLINE);
+  for (auto [i, v] : {std::pair<int, const char*>{PARM_IDX_SERVER, "DB"}, {PARM_IDX_SCHEMA, "K"},
+                      {PARM_IDX_PATH, dir.path().c_str()}})
+    parms.setParm(i, v, PARM_SRC_COMMANDLINE);
   klpSetCurrentParms(&parms);
   ASSERT_EQ(0, setEnvNamePrefix(env, "W"));
   ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_WRITE, "log", name, sizeof name, nullptr, 0));
