@@ -160,20 +160,21 @@ TEST(ConvMgr, ValuesAndRunningBuffers) {
   EXPECT_EQ(m.cpcvc(930, "\x42\xC1", 1208, &len, &t, 1, 0, 1, 0), 0);
   EXPECT_EQ(std::string(buf, len), "\xEF\xBC\xA1");
 
-  struct Row { const char* in; int32_t remaining; int rc; int32_t used; };  // used: after
+  struct Row { const char* in; int32_t remaining; int rc; int32_t left; const char* out; };
   const Row rows[] = {
-      {"\xC1\xC2", 3, 6024, 1},            // fewer than length + 2 left
-      {"\xC1\xC2", -1, 6024, 1},           // a negative count
-      {"\x63\x63\x63\x63", 6, 6024, 1},    // fits the check, not the output
-      {"\xC1\xC2", 4, 0, 3},
+      {"\xC1\xC2", 3, 6024, 3, ""},       // fewer than length + 2 left
+      {"\xC1\xC2", -1, 6024, -1, ""},     // a negative count
+      {"\x63\x63\x63", 5, 6024, 5, ""},  // fits the check, not the output: cut inside a character
+      {"", 2, 0, 2, ""},
+      {"\xC1\xC2", 4, 0, 2, "AB"},        // nothing of the cut value is left over
   };
   for (const Row& r : rows) {
     char area[16];
     memset(area, '#', sizeof area);
     ConvRunBuf rb{area, 1, r.remaining};
     EXPECT_EQ(m.cpcvb(37, 1208, r.in, static_cast<int32_t>(strlen(r.in)), &rb, 0), r.rc) << r.in;
-    EXPECT_EQ(rb.used, r.used);
-    EXPECT_EQ(rb.remaining, r.rc ? r.remaining : r.remaining - 2);
+    EXPECT_EQ(std::string(area + 1, rb.used - 1), r.out) << r.in;
+    EXPECT_EQ(rb.remaining, r.left);
     EXPECT_EQ(std::string(area + 1 + r.remaining + (r.remaining < 0 ? 1 : 0), 2), "##");
   }
   // Only the converted value that did not fit was reported.

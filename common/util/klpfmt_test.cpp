@@ -8,6 +8,7 @@
 #include <cstring>
 #include <ctime>
 #include <functional>
+#include <regex>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -110,7 +111,7 @@ TEST(Fmt, TextsAndTheirBufferBounds) {
       {INTO(30, (rel.version = 10, rel.release = 0, bcdTimestampToText(ts, 11, 8, 8, b))),
        "28:2026-12-06-11.43.08.12345678xx"},
       {INTO(30, bcdTimestampToText(ts, 8, 8, 8, b)), "28:2026-12-06-11.43.08.12000000xx"},
-      {INTO(30, bcdTimestampToText(ts, 11, 3, 8, b)), "23:2026-12-06-11.43.08.123xxxxxxx"},
+      {INTO(30, bcdTimestampToText(ts, 11, 1, 8, b)), "21:2026-12-06-11.43.08.1xxxxxxxxx"},
       {INTO(20, bcdTimestampToText(ts, 7, 0, 8, b)), "19:2026-12-06-11.43.08x"},
       {INTO(4, bcdTimestampToText(ts, 6, 0, 8, b)), "-1:xxxx"},
   };
@@ -133,6 +134,17 @@ TEST(Fmt, TextsAndTheirBufferBounds) {
   EXPECT_EQ(printed, "[0001:0203:0405:0607:0809]0001:0203:0405:0607:0809\n0007:1234|<0102:0300>"
                      "0123456789abcdef\n" + p239 + "0123456789abcdef...buffer full\n"
                      "...buffer full\n...buffer full\n");
+  // The dump: twenty bytes a line in groups of four, the printable ones after them.
+  const char data[] = "abcdefghijklmnopqrst\x01z";
+  printed = klptest::stdoutOf([&] {
+    hexDump(22, data, stdout, false);
+    hexDump(1, data, stdout, true);
+  });
+  EXPECT_EQ(printed.substr(0, 116),
+            "61626364 65666768 696A6B6C 6D6E6F70 71727374  abcdefghijklmnopqrst\n017A" +
+                std::string(42, ' ') + ".z\n");
+  EXPECT_TRUE(std::regex_match(printed.substr(116), std::regex(" [0-9a-f]{8,} 61 {44}a\n")))
+      << printed;
 }
 
 TEST(Fmt, IdentifiersWordsAndPads) {
