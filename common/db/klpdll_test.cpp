@@ -1,6 +1,5 @@
-// Run-time library loading: candidates that are no library or absent, a
-// driver missing functions, and the OCI wrappers over stand-in client
-// libraries (all 39 functions, one lacking OCILobRead2, none at all).
+// Run-time library loading: candidates that are no library or absent, a driver missing
+// functions, and the OCI wrappers over stand-in client libraries.
 #include "common/db/klpdll.h"
 
 #include <gtest/gtest.h>
@@ -24,23 +23,6 @@ size_t count(const std::string& text, const std::string& what) {
   return n;
 }
 
-// Runs body in a child with a process logger writing oci.log: the OCI state
-// is process-wide and each case starts without a library.
-struct OciRun {
-  klptest::Child child;
-  std::string log;
-};
-OciRun inChild(const std::function<int()>& body) {
-  klptest::TmpDir dir;
-  OciRun r;
-  r.child = klptest::inChild(dir.path(), [&] {
-    klptest::ProcessLogger logger(MSG_APP_KLPKCCMD, dir.path(), "oci.log");
-    return body();
-  });
-  r.log = klptest::readFile(dir.path() + "oci.log");
-  return r;
-}
-
 }  // namespace
 
 TEST(KlpDll, CandidatesLoadOnceAndFailuresReportOnce) {
@@ -49,10 +31,8 @@ TEST(KlpDll, CandidatesLoadOnceAndFailuresReportOnce) {
   auto log = [&] { return klptest::readFile(dir.path() + "dll.log"); };
 
   const klpDLLCandidate loads[] = {{kTextFile.c_str(), "A"}, {kDriver.c_str(), "A"}};
-  klpDLLFunc funcs[] = {{"SQLAllocHandle", nullptr},
-                        {"SQLCancel", KLPDLL_OPTIONAL},
-                        {"SQLDisconnect", nullptr},
-                        {"SQLConnect", nullptr}};
+  klpDLLFunc funcs[] = {{"SQLAllocHandle", nullptr}, {"SQLCancel", KLPDLL_OPTIONAL},
+                        {"SQLDisconnect", nullptr}, {"SQLConnect", nullptr}};
   klpDLL good("ODB_DLL", loads, 2, funcs, 4);
   EXPECT_EQ(klpdll::loadLib(&good), 0);
   EXPECT_EQ(good.state, 1);  // the second candidate
@@ -140,10 +120,15 @@ TEST(OraDl, WrappersOverStandInClientLibraries) {
        },
        {{"KLP06", 0}}},
   };
-  for (const Row& r : rows) {
-    OciRun run = inChild(r.body);
-    EXPECT_EQ(run.child.exitCode, 0) << r.what << "\n" << run.child.out << run.child.err;
+  for (const Row& r : rows) {  // each in a child: the OCI state is process-wide
+    klptest::TmpDir dir;
+    auto c = klptest::inChild(dir.path(), [&] {
+      klptest::ProcessLogger logger(MSG_APP_KLPKCCMD, dir.path(), "oci.log");
+      return r.body();
+    });
+    const std::string log = klptest::readFile(dir.path() + "oci.log");
+    EXPECT_EQ(c.exitCode, 0) << r.what << "\n" << c.out << c.err;
     for (const auto& [text, times] : r.logged)
-      EXPECT_EQ(count(run.log, text), times) << r.what << ": " << text << "\n" << run.log;
+      EXPECT_EQ(count(log, text), times) << r.what << ": " << text << "\n" << log;
   }
 }

@@ -8,6 +8,7 @@
 #include <cstring>
 #include <ctime>
 #include <functional>
+#include <regex>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -36,9 +37,8 @@ std::vector<uint8_t> varId(std::initializer_list<uint8_t> bytes, int16_t count) 
   return v;
 }
 
-// "answer:text" of a buffer form given `size` characters ("x" where nothing
-// was written; "overflow" when it wrote beyond them); INTO(size, call) makes
-// the call with buffer b of k = size.
+// "answer:text" of a call with buffer b of k = size characters ("x" where nothing
+// was written; "overflow" when it wrote beyond them).
 std::string into(size_t size, const std::function<int(char*, size_t)>& f) {
   char buf[300];
   memset(buf, 'x', sizeof buf);
@@ -111,7 +111,7 @@ TEST(Fmt, TextsAndTheirBufferBounds) {
       {INTO(30, (rel.version = 10, rel.release = 0, bcdTimestampToText(ts, 11, 8, 8, b))),
        "28:2026-12-06-11.43.08.12345678xx"},
       {INTO(30, bcdTimestampToText(ts, 8, 8, 8, b)), "28:2026-12-06-11.43.08.12000000xx"},
-      {INTO(30, bcdTimestampToText(ts, 11, 3, 8, b)), "23:2026-12-06-11.43.08.123xxxxxxx"},
+      {INTO(30, bcdTimestampToText(ts, 11, 1, 8, b)), "21:2026-12-06-11.43.08.1xxxxxxxxx"},
       {INTO(20, bcdTimestampToText(ts, 7, 0, 8, b)), "19:2026-12-06-11.43.08x"},
       {INTO(4, bcdTimestampToText(ts, 6, 0, 8, b)), "-1:xxxx"},
   };
@@ -120,20 +120,31 @@ TEST(Fmt, TextsAndTheirBufferBounds) {
 
   // The print forms, bounded by their 256-character work buffer.
   const std::string p239(239, 'p'), p240(240, 'p');
-  testing::internal::CaptureStdout();
-  printLogPosWords("[", kLogPos, "]");
-  printLogPosBytes("", kLogPos, "");
-  printNumPair("", 7, 1234, "|");
-  printVarId("<", varId({1, 2, 3}, 3).data(), ">");
-  printLsn("", kLsn, "\n");
-  printLsn(p239.c_str(), kLsn, "");
-  printLsn(p240.c_str(), kLsn, "");
-  printLogPosWords(p240.c_str(), kLogPos, "");
-  printVarId(std::string(236, 'p').c_str(), four.data(), "");
-  EXPECT_EQ("[0001:0203:0405:0607:0809]0001:0203:0405:0607:0809\n0007:1234|<0102:0300>"
-            "0123456789abcdef\n" + p239 + "0123456789abcdef...buffer full\n...buffer full\n"
-            "...buffer full\n",
-            testing::internal::GetCapturedStdout());
+  auto printed = klptest::stdoutOf([&] {
+    printLogPosWords("[", kLogPos, "]");
+    printLogPosBytes("", kLogPos, "");
+    printNumPair("", 7, 1234, "|");
+    printVarId("<", varId({1, 2, 3}, 3).data(), ">");
+    printLsn("", kLsn, "\n");
+    printLsn(p239.c_str(), kLsn, "");
+    printLsn(p240.c_str(), kLsn, "");
+    printLogPosWords(p240.c_str(), kLogPos, "");
+    printVarId(std::string(236, 'p').c_str(), four.data(), "");
+  });
+  EXPECT_EQ(printed, "[0001:0203:0405:0607:0809]0001:0203:0405:0607:0809\n0007:1234|<0102:0300>"
+                     "0123456789abcdef\n" + p239 + "0123456789abcdef...buffer full\n"
+                     "...buffer full\n...buffer full\n");
+  // The dump: twenty bytes a line in groups of four, the printable ones after them.
+  const char data[] = "abcdefghijklmnopqrst\x01z";
+  printed = klptest::stdoutOf([&] {
+    hexDump(22, data, stdout, false);
+    hexDump(1, data, stdout, true);
+  });
+  EXPECT_EQ(printed.substr(0, 116),
+            "61626364 65666768 696A6B6C 6D6E6F70 71727374  abcdefghijklmnopqrst\n017A" +
+                std::string(42, ' ') + ".z\n");
+  EXPECT_TRUE(std::regex_match(printed.substr(116), std::regex(" [0-9a-f]{8,} 61 {44}a\n")))
+      << printed;
 }
 
 TEST(Fmt, IdentifiersWordsAndPads) {
@@ -196,8 +207,7 @@ TEST(Fmt, CompatibilityLevelOfTheServerWorkedOutOnce) {
   }
 }
 
-// The program's own files, and each helper that reports: its answer and
-// the records it logs.
+// The program's own files, and each helper that reports: its answer and its records.
 TEST(Fmt, ProgramFilesAndTheReportsOfTheHelpers) {
   klptest::TmpDir dir;
   klptest::ProcessLogger log;
@@ -219,9 +229,9 @@ TEST(Fmt, ProgramFilesAndTheReportsOfTheHelpers) {
   buildXqpubParmTable(t);
   int rc = 0;
   xqpubParms parms(t, XQPUB_PARM_COUNT, &rc);
-  parms.setParm(PARM_IDX_SERVER, "DB", PARM_SRC_COMMANDLINE);
-  parms.setParm(PARM_IDX_SCHEMA, "K", PARM_SRC_COMMANDLINE);
-  parms.setParm(PARM_IDX_PATH, dir.path().c_str(), PARM_SRC_COMMANDLINE);
+  for (auto [i, v] : {std::pair<int, const char*>{PARM_IDX_SERVER, "DB"}, {PARM_IDX_SCHEMA, "K"},
+                      {PARM_IDX_PATH, dir.path().c_str()}})
+    parms.setParm(i, v, PARM_SRC_COMMANDLINE);
   klpSetCurrentParms(&parms);
   ASSERT_EQ(0, setEnvNamePrefix(env, "W"));
   ASSERT_EQ(0, getFileHandle(&f, KLP_FILE_WRITE, "log", name, sizeof name, nullptr, 0));

@@ -7,15 +7,14 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <mutex>
+#include <sstream>
 #include <stdexcept>
-#include <thread>
 #include <utility>
 
 #include <gtest/gtest.h>
@@ -50,11 +49,9 @@ namespace {
 std::vector<std::string> mergedEnv(const std::vector<std::string>& extra) {
   std::vector<std::string> env;
   auto name = [](const std::string& entry) { return entry.substr(0, entry.find('=')); };
-  for (char** e = environ; *e; ++e) {
-    bool overridden = false;
-    for (auto& x : extra) overridden = overridden || name(x) == name(*e);
-    if (!overridden) env.push_back(*e);
-  }
+  for (char** e = environ; *e; ++e)
+    if (std::none_of(extra.begin(), extra.end(), [&](auto& x) { return name(x) == name(*e); }))
+      env.push_back(*e);
   for (auto& x : extra)
     if (x.find('=') != std::string::npos) env.push_back(x);
   return env;
@@ -92,19 +89,14 @@ std::string outputName(const char* kind) {
 
 // Waits for pid up to timeoutMs; fills exit code or signal.
 bool reap(int pid, int timeoutMs, ProcessResult& r) {
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
-  for (;;) {
-    int status = 0;
-    pid_t w = waitpid(pid, &status, WNOHANG);
-    if (w == pid) {
-      r.exited = WIFEXITED(status);
-      if (WIFEXITED(status)) r.exitCode = WEXITSTATUS(status);
-      if (WIFSIGNALED(status)) r.signal = WTERMSIG(status);
-      return true;
-    }
-    if (std::chrono::steady_clock::now() >= deadline) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
+  int status = 0;
+  bool ended = false;
+  if (!waitFor([&] { return ended || (ended = waitpid(pid, &status, WNOHANG) == pid); }, timeoutMs))
+    return false;
+  r.exited = WIFEXITED(status);
+  if (r.exited) r.exitCode = WEXITSTATUS(status);
+  if (WIFSIGNALED(status)) r.signal = WTERMSIG(status);
+  return true;
 }
 
 // reap, killing pid when it has not ended within timeoutMs.
@@ -124,51 +116,108 @@ std::string readFile(const std::string& path) {
 
 std::vector<std::string> lines(const std::string& text) {
   std::vector<std::string> out;
-  for (size_t start = 0; start < text.size();) {
-    size_t nl = std::min(text.find('\n', start), text.size());
-    out.push_back(text.substr(start, nl - start));
-    start = nl + 1;
-  }
+  std::istringstream in(text);
+  for (std::string line; std::getline(in, line);) out.push_back(line);
   return out;
 }
 
-class LogCapture::Recorder : public msgLoggerU {
- public:
-  Recorder() : msgLoggerU(MSG_APP_KLPKCCMD, 0) { loadBuiltinMsgs(builtinMsgTable); }
-  std::vector<std::string> records;
+// The one recorder behind ProcessLogger (issued), LogCapture (captured) and
+// LogRecords (filed): each words a message its own way, without the header
+// values the logger put in front and the trailing pads.
+enum class Form { issued, captured, filed };
+thread_local int composing = 0;  // the number a message was issued with
 
+class RecordingLogger : public msgLoggerU {
+ public:
+  RecordingLogger(int app, Form form, std::string file = "")
+      : msgLoggerU(app, 0), form_(form), file_(std::move(file)) {
+    loadBuiltinMsgs(builtinMsgTable);
+  }
+  void composeKlpMsg(logMsg* r) override {
+    composing = r->msgNumber;
+    msgLoggerU::composeKlpMsg(r);
+  }
+  void writeConsole(logMsg* r) override { if (form_ != Form::filed) msgLoggerU::writeConsole(r); }
+  void writeStderr(logMsg* r) override { if (form_ != Form::filed) msgLoggerU::writeStderr(r); }
   void setRouting(logMsg* r) override {
     char qt[MSG_QUALIFIER_MAX + MSG_THREAD_NAME_MAX + 8];
     qualifierAndThread(r->threadName, qt, sizeof qt);
-    int from = 0, to = r->valueCount;
-    auto is = [&](int i, const char* v) { return i < to && strcmp(r->values[i], v) == 0; };
-    if (is(0, getApplicationName()) && is(1, qt)) from = 2;
-    else if (is(0, qt)) from = 1;
-    while (to > from && is(to - 1, " ")) --to;
-    int kind = r->routing == 12 ? 0 : (r->routing & MSG_DEST_STDOUT) ? 2 : 1;
-    std::string line = std::to_string(r->internalNumber ? r->internalNumber : r->msgNumber) +
-                       " " + r->origin + " " + std::to_string(kind) + " ";
-    for (int i = from; i < to; ++i) line += (i > from ? "|" : "") + std::string(r->values[i]);
-    records.push_back(line);
-    r->routing = 0;
+    auto is = [r](int i, const char* v) { return i < r->valueCount && strcmp(r->values[i], v) == 0; };
+    int i = is(0, getApplicationName()) && is(1, qt) ? 2 : is(0, qt) ? 1 : 0, end = r->valueCount;
+    if (form_ == Form::issued && i == 0) i = is(0, getApplicationName());
+    while (end > i && (is(end - 1, " ") || (form_ != Form::captured && is(end - 1, "*")))) --end;
+    std::string values, line;
+    for (int k = i; k < end; ++k) values += (k > i ? "|" : "") + std::string(r->values[k]);
+    auto number = [](long long n) { return std::to_string(n); };
+    if (form_ == Form::issued) {
+      line = number(composing) + " <" + r->origin + "> " + number(r->routing) + ":" +
+             (i < end ? " " + values : "");
+      if (r->extra[0] != -1 || r->extra[1] != -1)
+        line += " (" + number(r->extra[0]) + "," + number(r->extra[1]) + ")";
+    } else if (form_ == Form::captured) {
+      int kind = r->routing == 12 ? 0 : (r->routing & MSG_DEST_STDOUT) ? 2 : 1;
+      line = number(r->internalNumber ? r->internalNumber : r->msgNumber) + " " + r->origin + " " +
+             number(kind) + " " + values;
+    } else {
+      int k = r->routing == 12 ? 0 : r->routing == 1 ? 1 : r->routing == 35 ? 2 : -1;
+      std::ofstream(file_, std::ios::app)
+          << r->threadName << ">" << r->msgNumber << "|" << r->origin << "|"
+          << (k < 0 ? "r" + number(r->routing) : number(k)) << (i < end ? "|" : "") << values << "\n";
+    }
+    if (form_ != Form::filed) {
+      std::lock_guard<std::mutex> hold(lock_);
+      records_.push_back(line);
+    }
+    if (form_ == Form::captured) r->routing = 0;  // written nowhere
+    else msgLoggerU::setRouting(r);
   }
+  std::vector<std::string> take() {
+    std::lock_guard<std::mutex> hold(lock_);
+    return std::exchange(records_, {});
+  }
+
+ private:
+  Form form_;
+  std::string file_;
+  std::mutex lock_;
+  std::vector<std::string> records_;
 };
 
-LogCapture::LogCapture() : logger_(new Recorder), saved_(klpGetProcessLogger()) {
-  klpSetProcessLogger(logger_);
+// Installs logger as the process logger; answers the one it replaces.
+static msgLogger* install(msgLogger* logger) {
+  msgLogger* old = klpGetProcessLogger();
+  klpSetProcessLogger(logger);
+  return old;
 }
 
-LogCapture::~LogCapture() {
-  klpSetProcessLogger(saved_);
-  delete logger_;
-}
-
+LogCapture::LogCapture()
+    : logger_(new RecordingLogger(MSG_APP_KLPKCCMD, Form::captured)), saved_(install(logger_)) {}
+LogCapture::~LogCapture() { install(saved_), delete logger_; }
 msgLogger* LogCapture::get() const { return logger_; }
+std::vector<std::string> LogCapture::take() { return logger_->take(); }
 
-std::vector<std::string> LogCapture::take() {
-  std::vector<std::string> r;
-  r.swap(logger_->records);
-  return r;
+ProcessLogger::ProcessLogger(int applicationIndex, const std::string& logDir,
+                             const std::string& logFile)
+    : logger_(new RecordingLogger(applicationIndex, Form::issued)), saved_(install(logger_)) {
+  if (!logDir.empty() && !logFile.empty()) logger_->setLogFileName(logDir.c_str(), logFile.c_str());
+}
+ProcessLogger::~ProcessLogger() { install(saved_), delete logger_; }
+msgLogger* ProcessLogger::operator->() const { return logger_; }
+msgLogger* ProcessLogger::get() const { return logger_; }
+std::vector<std::string> ProcessLogger::take() { return logger_->take(); }
+
+// The records go to a file so that forked children's count too.
+LogRecords::LogRecords(const std::string& dir)
+    : file_(dir + "records"), logger_(new RecordingLogger(10, Form::filed, file_)),
+      saved_(install(logger_)) {}
+LogRecords::~LogRecords() { install(saved_), delete logger_; }
+
+std::vector<std::string> LogRecords::take(bool withThread) {
+  std::vector<std::string> out = lines(readFile(file_));
+  std::ofstream(file_, std::ios::trunc).flush();
+  for (std::string& line : out)
+    if (!withThread) line.erase(0, line.find('>') + 1);
+  return out;
 }
 
 std::string stdoutOf(const std::function<void()>& f) {
@@ -183,32 +232,27 @@ Child inChild(const std::string& dir, const std::function<int()>& body, int time
   static int serial = 0;
   std::string base = dir + "child" + std::to_string(++serial);
   std::string outFile = base + ".out", errFile = base + ".err";
-  fflush(stdout);
-  fflush(stderr);
+  fflush(stdout), fflush(stderr);
   pid_t pid = fork();
   if (pid == 0) {
     int o = open(outFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
     int e = open(errFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
     if (o < 0 || e < 0) _exit(99);
-    dup2(o, 1);
-    dup2(e, 2);
+    dup2(o, 1), dup2(e, 2);
     int rc = body();
-    fflush(stdout);
-    fflush(stderr);
+    fflush(stdout), fflush(stderr);
     _exit(rc);
   }
   Child c;
   if (pid < 0) return c;
   reapOrKill(pid, timeoutMs, c);
-  c.out = readFile(outFile);
-  c.err = readFile(errFile);
+  c.out = readFile(outFile), c.err = readFile(errFile);
   return c;
 }
 
 ProcessResult run(const std::vector<std::string>& argv, const std::vector<std::string>& extraEnv,
                   int timeoutMs) {
-  Background p(argv, extraEnv);
-  return p.wait(timeoutMs);
+  return Background(argv, extraEnv).wait(timeoutMs);
 }
 
 Background::Background(const std::vector<std::string>& argv, const std::vector<std::string>& extraEnv)
@@ -218,21 +262,17 @@ Background::Background(const std::vector<std::string>& argv, const std::vector<s
 
 Background::~Background() {
   if (!reaped_ && pid_ > 0) reapOrKill(pid_, 0, result_);
-  unlink(outFile_.c_str());
-  unlink(errFile_.c_str());
+  unlink(outFile_.c_str()), unlink(errFile_.c_str());
 }
 
 ProcessResult Background::wait(int timeoutMs) {
   if (!reaped_) reapOrKill(pid_, timeoutMs, result_);
   reaped_ = true;
-  result_.out = out();
-  result_.err = err();
+  result_.out = out(), result_.err = err();
   return result_;
 }
 
-void Background::kill(int sig) {
-  if (!reaped_) ::kill(pid_, sig);
-}
+void Background::kill(int sig) { if (!reaped_) ::kill(pid_, sig); }
 
 bool Background::running() {
   if (!reaped_) reaped_ = reap(pid_, 0, result_);
@@ -253,108 +293,6 @@ bool queueExists(const std::string& path) {
 }
 bool memoryExists(const std::string& path) {
   return exists<HSVHIPCMemory>(path, hsvIPCGetResID, HSV_MEMORY_RESID_OPTION);
-}
-
-// Notes each message as setRouting sees it, by its number before composing.
-thread_local int composing = 0;
-class RecordingLogger : public msgLoggerU {
- public:
-  explicit RecordingLogger(int applicationIndex) : msgLoggerU(applicationIndex, 0) {}
-  void composeKlpMsg(logMsg* r) override {
-    composing = r->msgNumber;
-    msgLoggerU::composeKlpMsg(r);
-  }
-  void setRouting(logMsg* r) override {
-    std::string qt = std::string(getProgramQualifier()) + "\" : \"" + r->threadName, pads = " *";
-    int i = 0, last = r->valueCount;
-    if (i < last && getApplicationName() == std::string(r->values[i])) ++i;
-    if (i < last && qt == r->values[i]) ++i;
-    while (last > i && strlen(r->values[last - 1]) == 1 && pads.find(r->values[last - 1][0]) < 2)
-      --last;
-    std::string line = std::to_string(composing) + " <" + r->origin + "> ";
-    line += std::to_string(r->routing) + ":";
-    for (char sep = ' '; i < last; ++i, sep = '|') line += sep + std::string(r->values[i]);
-    if (r->extra[0] != -1 || r->extra[1] != -1)
-      line += " (" + std::to_string(r->extra[0]) + "," + std::to_string(r->extra[1]) + ")";
-    std::lock_guard<std::mutex> hold(lock_);
-    issued_.push_back(line);
-    msgLoggerU::setRouting(r);
-  }
-  std::vector<std::string> take() {
-    std::lock_guard<std::mutex> hold(lock_);
-    return std::exchange(issued_, {});
-  }
-
- private:
-  std::mutex lock_;
-  std::vector<std::string> issued_;
-};
-
-ProcessLogger::ProcessLogger(int applicationIndex, const std::string& logDir,
-                             const std::string& logFile)
-    : logger_(new RecordingLogger(applicationIndex)), saved_(klpGetProcessLogger()) {
-  logger_->loadBuiltinMsgs(builtinMsgTable);
-  if (!logDir.empty() && !logFile.empty()) logger_->setLogFileName(logDir.c_str(), logFile.c_str());
-  klpSetProcessLogger(logger_);
-}
-
-ProcessLogger::~ProcessLogger() {
-  klpSetProcessLogger(saved_);
-  delete logger_;
-}
-
-msgLogger* ProcessLogger::operator->() const { return logger_; }
-msgLogger* ProcessLogger::get() const { return logger_; }
-std::vector<std::string> ProcessLogger::take() { return logger_->take(); }
-
-// ---------------------------------------------------------------------------
-// Logged records; waiting for a condition; the process's first prologue
-// ---------------------------------------------------------------------------
-namespace {
-
-class FileRecordingLogger : public msgLoggerU {
- public:
-  explicit FileRecordingLogger(const std::string& file) : msgLoggerU(10, 0), file_(file) {
-    loadBuiltinMsgs(builtinMsgTable);
-  }
-  void writeConsole(logMsg*) override {}
-  void writeStderr(logMsg*) override {}
-  void setRouting(logMsg* r) override {  // every record, with the routing asked for
-    char qt[MSG_QUALIFIER_MAX + MSG_THREAD_NAME_MAX + 8];
-    qualifierAndThread(r->threadName, qt, sizeof qt);
-    auto is = [r](int i, const char* v) { return i < r->valueCount && strcmp(r->values[i], v) == 0; };
-    int first = is(0, getApplicationName()) && is(1, qt) ? 2 : is(0, qt) ? 1 : 0, end = r->valueCount;
-    while (end > first && (is(end - 1, " ") || is(end - 1, "*"))) --end;
-    int k = r->routing == 12 ? 0 : r->routing == 1 ? 1 : r->routing == 35 ? 2 : -1;
-    std::string line = std::string(r->threadName) + ">" + std::to_string(r->msgNumber) + "|" +
-                       r->origin + "|" + (k < 0 ? "r" + std::to_string(r->routing) : std::to_string(k));
-    for (int i = first; i < end; ++i) line += std::string("|") + r->values[i];
-    std::ofstream(file_, std::ios::app) << line << "\n";
-    msgLoggerU::setRouting(r);
-  }
-
- private:
-  std::string file_;
-};
-
-}  // namespace
-
-LogRecords::LogRecords(const std::string& dir)
-    : file_(dir + "records"), logger_(new FileRecordingLogger(file_)), saved_(klpGetProcessLogger()) {
-  klpSetProcessLogger(logger_);
-}
-
-LogRecords::~LogRecords() {
-  klpSetProcessLogger(saved_);
-  delete logger_;
-}
-
-std::vector<std::string> LogRecords::take(bool withThread) {
-  std::vector<std::string> out = lines(readFile(file_));
-  std::ofstream(file_, std::ios::trunc).flush();
-  for (std::string& line : out)
-    if (!withThread) line.erase(0, line.find('>') + 1);
-  return out;
 }
 
 bool waitFor(const std::function<bool()>& cond, int ms) {

@@ -10,6 +10,8 @@ class msgLogger;
 
 namespace klptest {
 
+class RecordingLogger;
+
 // A fresh directory under /tmp ending in "/", TMPDIR of this process and
 // those it starts while the object lives; removed with its files.
 class TmpDir {
@@ -21,8 +23,7 @@ class TmpDir {
   const std::string& path() const { return path_; }
 
  private:
-  std::string path_;
-  std::string oldTmpdir_;
+  std::string path_, oldTmpdir_;
   bool hadTmpdir_ = false;
 };
 
@@ -44,7 +45,7 @@ std::string binPath(const std::string& program);
 ProcessResult run(const std::vector<std::string>& argv,
                   const std::vector<std::string>& extraEnv = {}, int timeoutMs = 60000);
 
-// A started process that runs in the background until stop() or destruction.
+// A started process that runs in the background until wait() or destruction.
 class Background {
  public:
   Background(const std::vector<std::string>& argv, const std::vector<std::string>& extraEnv = {});
@@ -91,8 +92,7 @@ class LogCapture {
   std::vector<std::string> take();
 
  private:
-  class Recorder;
-  Recorder* logger_;
+  RecordingLogger* logger_;
   msgLogger* saved_;
 };
 
@@ -103,8 +103,6 @@ std::string stdoutOf(const std::function<void()>& f);
 // under dir (ending in "/"); it exits with body's answer or is killed after
 // timeoutMs.
 Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs = 20000);
-
-class RecordingLogger;
 
 // The process logger a program makes first (application 10 unless given,
 // synchronous, built-in texts loaded), installed for the object's life and
@@ -130,9 +128,6 @@ class ProcessLogger {
   msgLogger* saved_;
 };
 
-// ---------------------------------------------------------------------------
-// Logged records; waiting for a condition; the process's first prologue
-// ---------------------------------------------------------------------------
 // The process logger while the object lives, writing nowhere but a record
 // file in dir (so that forked children's records count): per message
 // "number|origin|kind|values..." with the destination kind 0, 1 or 2 (or
