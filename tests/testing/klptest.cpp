@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -81,7 +82,7 @@ int spawn(std::vector<std::string> argv, const std::vector<std::string>& extraEn
 }
 
 std::string outputName(const char* kind) {
-  static int seq = 0;
+  static std::atomic<int> seq{0};  // tests start processes from several threads
   const char* dir = getenv("TMPDIR");
   std::string d = std::string(dir && *dir ? dir : "/tmp") + "/";
   return d + "proc." + std::to_string(getpid()) + "." + std::to_string(++seq) + "." + kind;
@@ -229,7 +230,7 @@ std::string stdoutOf(const std::function<void()>& f) {
 }
 
 Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs) {
-  static int serial = 0;
+  static std::atomic<int> serial{0};
   std::string base = dir + "child" + std::to_string(++serial);
   std::string outFile = base + ".out", errFile = base + ".err";
   fflush(stdout), fflush(stderr);
