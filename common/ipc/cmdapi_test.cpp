@@ -12,14 +12,10 @@
 #include <unistd.h>
 
 #include <chrono>
-#include <cstddef>
 #include <cstdlib>
 #include <cstring>
-#include <functional>
 #include <memory>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "common/env/klpenv.h"
 #include "common/ipc/ipcmsg.h"
@@ -30,6 +26,7 @@
 #include "common/util/klprc.h"
 #include "include/klpapi.h"
 #include "tests/testing/klptest.h"
+#include "xqpub/dispatch.h"
 #include "xqpub/kcapcmdparms.h"
 #include "xqpub/xqpubparms.h"
 
@@ -150,6 +147,7 @@ TEST(CmdApiStatusData, Format3FromItsOffsetsOrNothing) {
     size_t len;                                      // payload length
     int rc;
     const char *logFile = "", *sectionText = "";
+    size_t outLen = 2224;
   } cases[] = {
       {{}, 400, 0, "/var/log/kcp", "hello"},
       {{{16, 0}, {68, 0}, {60, 60000}}, 400, 0, "", ""},  // no log file, no section
@@ -159,17 +157,18 @@ TEST(CmdApiStatusData, Format3FromItsOffsetsOrNothing) {
       {{{68, 380}}, 400, 2017},   // section fields past the end
       {{{260, 400}}, 400, 2017},  // section text past the end
       {{}, 69, 2017},             // fixed fields cut short
+      {{}, 400, 1001, "", "", 2223},  // a buffer one byte short gets nothing
   };
   for (const auto& c : cases) {
     auto p = kcapPayload();
     p.resize(c.len, 'x');
     for (const auto& [at, value] : c.words) put16(p, at, value);
-    std::vector<char> out(2224, 0x55);
+    std::vector<char> out(c.outLen, 0x55);
     int32_t required = 0;
     EXPECT_EQ(klpStatusFromKcap(p.data(), p.size(), out.data(), out.size(), &required), c.rc) << c.len;
     EXPECT_EQ(required, 2224);
     if (c.rc != 0) {
-      EXPECT_EQ(out, std::vector<char>(2224, 0x55));
+      EXPECT_EQ(out, std::vector<char>(c.outLen, 0x55));
       continue;
     }
     klpStatusFmt3 s;
@@ -182,11 +181,6 @@ TEST(CmdApiStatusData, Format3FromItsOffsetsOrNothing) {
     EXPECT_EQ(std::string(s.sectionA, 30) + std::string(s.sectionB, 30),
               *c.sectionText ? std::string(30, 'A') + std::string(30, 'B') : std::string(60, '\0'));
   }
-  auto p = kcapPayload();  // a buffer one byte short gets nothing
-  std::vector<char> out(2223, 0x55);
-  int32_t required = 0;
-  EXPECT_EQ(klpStatusFromKcap(p.data(), p.size(), out.data(), out.size(), &required), 1001);
-  EXPECT_EQ(out, std::vector<char>(2223, 0x55));
 }
 
 // A KAPP detailed status: each record with the fields that take more than a
@@ -248,23 +242,36 @@ TEST(CmdApiStatusData, Format2RecordsCopiedWidenedAndCut) {
 // ---------------------------------------------------------------------------
 
 // The calls' messages recorded, the main thread known to the recovery
-// manager, and the IPC directory the test's own.
+// manager, the IPC directory the test's own; useParms() makes a command's
+// parameter sets the current ones.
 class CmdApiExchange : public ::testing::Test {
  protected:
   static void SetUpTestSuite() { klpEnsureMainThread(); }
   void SetUp() override { ASSERT_EQ(klpEnvClear(klpGetEnv()), 0); }
-  void TearDown() override { klpEnvClear(klpGetEnv()); }
+  void TearDown() override {
+    klpEnvClear(klpGetEnv());
+    if (cmd_) klpSetCurrentParms(saved_);
+  }
+  void useParms() {
+    ParmEntry ct[KCAPCMD_PARM_COUNT], st[XQPUB_PARM_COUNT];
+    buildKCapCmdParmTable(ct);
+    buildXqpubParmTable(st);
+    int rc1 = 0, rc2 = 0;
+    cmd_ = std::make_unique<kCapCmdParmClass>(ct, KCAPCMD_PARM_COUNT, &rc1);
+    server_ = std::make_unique<xqpubParms>(st, XQPUB_PARM_COUNT, &rc2);
+    ASSERT_EQ(rc1 | rc2, 0);
+    cmd_->setServerParms(server_.get());
+    saved_ = klpGetCurrentParms();
+    klpSetCurrentParms(cmd_.get());
+  }
   std::string replyPath(const std::string& server) {
     return tmp_.path() + server + ".IPC.CMD" + std::to_string(getpid());
   }
-  HSVResID serverId(const std::string& server) {
-    HSVResID id{};
-    EXPECT_EQ(hsvIPCGetQueResID((tmp_.path() + server + ".IPC").c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
-    return id;
-  }
   klptest::TmpDir tmp_;
   klptest::LogCapture log_;
-  HSVResID id_;
+  std::unique_ptr<kCapCmdParmClass> cmd_;
+  std::unique_ptr<xqpubParms> server_;
+  klpParmClass* saved_ = nullptr;
 };
 
 // Server side in a forked child: owns the server queue (created before the
@@ -355,40 +362,20 @@ klpStatusRequest statusRequest(const char* server, const char* schema, std::vect
   return req;
 }
 
-// Polls `done` every 10 ms for up to 10 s.
-bool eventually(const std::function<bool()>& done) {
-  for (int i = 0; i < 1000; ++i, usleep(10000))
-    if (done()) return true;
-  return false;
+// The records logged since the last look, one line each, match pattern.
+testing::AssertionResult logged(klptest::LogCapture& log, const std::string& pattern) {
+  std::string got;
+  for (const auto& r : log.take()) got += (got.empty() ? "" : "\n") + r;
+  if (fnmatch(pattern.c_str(), got.c_str(), 0) == 0) return testing::AssertionSuccess();
+  return testing::AssertionFailure() << got;
 }
-
-// The records logged since the last look, one line each.
-std::string records(klptest::LogCapture& log) {
-  std::string text;
-  for (const auto& r : log.take()) text += (text.empty() ? "" : "\n") + r;
-  return text;
-}
-#define EXPECT_RECORDS(log, pattern)                                               \
-  do {                                                                             \
-    std::string got_ = records(log);                                               \
-    EXPECT_EQ(fnmatch(std::string(pattern).c_str(), got_.c_str(), 0), 0) << got_; \
-  } while (0)
 
 // What the client's routines log: number, origin, destination kind, values
 // in order. A stale reply queue of our name, with a message in it, is
 // replaced before the STATUS exchanges.
 TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
-  ParmEntry cmdTable[KCAPCMD_PARM_COUNT], srvTable[XQPUB_PARM_COUNT];
-  buildKCapCmdParmTable(cmdTable);
-  buildXqpubParmTable(srvTable);
-  int rc1 = 0, rc2 = 0;
-  kCapCmdParmClass cmd(cmdTable, KCAPCMD_PARM_COUNT, &rc1);
-  xqpubParms server(srvTable, XQPUB_PARM_COUNT, &rc2);
-  ASSERT_EQ(rc1 | rc2, 0);
-  cmd.setServerParms(&server);
-  ASSERT_EQ(cmd.addChgParm(30, "1000") | cmd.addChgParm(16, "200"), 0);
-  klpParmClass* before = klpGetCurrentParms();
-  klpSetCurrentParms(&cmd);
+  useParms();
+  ASSERT_EQ(cmd_->addChgParm(30, "1000") | cmd_->addChgParm(16, "200"), 0);
   std::string stale = replyPath("S1.KLP.KCAP");
   HSVResID id;
   HSVHIPCQueue old;
@@ -422,16 +409,15 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
   });
   for (const auto& r : rows) {
     EXPECT_EQ(cmdAPIFunc("S1.KLP.KCAP", r.func, nullptr, nullptr, nullptr), r.rc) << r.func;
-    EXPECT_RECORDS(log_, r.records);
+    EXPECT_TRUE(logged(log_, r.records));
   }
   EXPECT_EQ(srv.finish(), 0);
-  klpSetCurrentParms(before);
   EXPECT_FALSE(klptest::queueExists(stale));
 
   // A name cut to fit would address some other server.
   EXPECT_EQ(KLPMonFunc(std::string(220, 'S').c_str(), "KLP.MON", nullptr), 2009);
-  EXPECT_RECORDS(log_, "589 KLPMonFunc 1 KLPMonFunc|2009|server name\n8999 KLPMonFunc 1 the server "
-                       "name and its suffix do not fit a server name*");
+  EXPECT_TRUE(logged(log_, "589 KLPMonFunc 1 KLPMonFunc|2009|server name\n8999 KLPMonFunc 1 the server "
+                           "name and its suffix do not fit a server name*"));
   // Queues made by hand: a server queue open to others is refused at the
   // first attempt (it will not become ours by waiting; retrying would take
   // four pauses); one that takes no request of ours refuses the put; a
@@ -455,18 +441,19 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
   for (const auto& c : queues) {
     std::string path = tmp_.path() + c.server + c.suffix + (c.rc == 804 ? pid : "");
     HSVHIPCQueue server;
-    if (c.rc == 804) { ASSERT_EQ(server.create(serverId(c.server), HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK); }
+    if (c.rc == 804) {
+      ASSERT_EQ(hsvIPCGetQueResID((tmp_.path() + c.server + ".IPC").c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
+      ASSERT_EQ(server.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION), ECF_OK);
+    }
     ASSERT_EQ(hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
-    mq_attr attr{};
-    attr.mq_maxmsg = HSV_QUEUE_DEPTH;
-    attr.mq_msgsize = c.msgSize;
+    mq_attr attr{0, HSV_QUEUE_DEPTH, c.msgSize, 0, {}};
     mqd_t raw = mq_open(id.posixName(), O_RDWR | O_CREAT | O_EXCL, 0600, &attr);
     ASSERT_NE(raw, static_cast<mqd_t>(-1));
     ASSERT_EQ(fchmod(raw, c.mode), 0);
     auto start = std::chrono::steady_clock::now();
     EXPECT_EQ(cmdAPIFunc(c.server, 14, nullptr, nullptr, nullptr), c.rc);
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(4));
-    EXPECT_RECORDS(log_, c.records);
+    EXPECT_TRUE(logged(log_, c.records));
     mq_close(raw);
     mq_unlink(id.posixName());
     if (server.isOpen()) server.destroy();
@@ -476,9 +463,7 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
 // Replies whose pieces disagree, cannot carry their total or have the wrong
 // version are refused, and nothing is handed to the caller. A reply whose
 // function code is not the request's is the late answer to an earlier call
-// that gave up waiting: it is dropped and the wait goes on; but a peer that
-// keeps answering some other request cannot hold the exchange past its
-// budget (the flood of the last row).
+// that gave up waiting: it is dropped and the wait goes on.
 TEST_F(CmdApiExchange, BrokenRepliesAreRefusedAndLateOnesDropped) {
   std::vector<char> first(4052, 'a'), rest(100, 'b');
   const struct {
@@ -493,7 +478,6 @@ TEST_F(CmdApiExchange, BrokenRepliesAreRefusedAndLateOnesDropped) {
       {14, {rawMsg(14, {}, 1, 0, 0, 2)}, 825, {}, ""},
       {60, {rawMsg(14, {}, 1, 0, 0)}, 0, kcapPayload(), ""},
       {15, {rawMsg(61, first, 2, 1, 4152), rawMsg(61, rest, 2, 2, 4152)}, 0, statusPayload({}), ""},
-      {14, std::vector<std::vector<char>>(2000, rawMsg(15, {}, 1, 0, 0)), 824, {}, "KLP0510"},
   };
   FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
   size_t n = 0;
@@ -501,7 +485,6 @@ TEST_F(CmdApiExchange, BrokenRepliesAreRefusedAndLateOnesDropped) {
     const auto& c = cases[n++];
     int rc = 0;
     for (size_t i = 0; i < c.put.size() && rc == 0; ++i) rc = srv.putRaw(req.header.senderPid, c.put[i]);
-    if (c.rc == 824) return rc != 0 ? 0 : 1;  // the flood outlasted the call
     return c.rc == 0 ? rc | FakeServer::reply(req, c.answer) : rc;
   });
   for (const auto& c : cases) {
@@ -661,20 +644,44 @@ TEST_F(CmdApiExchange, ASignalAnywhereInTheExchangeLeavesNoQueue) {
     std::string path = tmp_.path() + "S1.KLP.KCAP.IPC.CMD" + std::to_string(child);
     if (c.raiseAt == 0) {
       // The request is put after both queues are registered for recovery.
-      ASSERT_TRUE(eventually([&] { return srv.hasRequest(); }));
+      ASSERT_TRUE(klptest::waitFor([&] { return srv.hasRequest(); }, 10000));
       EXPECT_TRUE(klptest::queueExists(path));
       kill(child, SIGINT);
     }
     int status = 0;
-    bool ended = eventually([&] { return waitpid(child, &status, WNOHANG) == child; });
-    if (!ended && kill(child, SIGKILL) == 0) waitpid(child, &status, 0);
+    siginfo_t info{};  // looked at, not reaped, until it has ended
+    bool ended = klptest::waitFor(
+        [&] { return waitid(P_PID, child, &info, WEXITED | WNOHANG | WNOWAIT) == 0 && info.si_pid == child; }, 10000);
+    if (!ended) kill(child, SIGKILL);
+    waitpid(child, &status, 0);
     ASSERT_TRUE(ended) << c.when;
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << c.when;
     EXPECT_FALSE(klptest::queueExists(path)) << "reply queue left behind: " << c.when;
+    HSVResID id;
     HSVHIPCQueue left;
-    if (hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id_) == ECF_OK && left.attach(id_) == ECF_OK)
+    if (hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id) == ECF_OK && left.attach(id) == ECF_OK)
       left.destroy();
   }
+}
+
+// STATUS SHOW DETAILS against a server that keeps answering some other
+// request: past its budget the client gives up, the not-available report is
+// printed and the failed step follows.
+TEST_F(CmdApiExchange, DispatchPrintsTheNotAvailableReportWhenNoReplyComes) {
+  useParms();
+  cmd_->setParm(PARM_IDX_SERVER, "S1", PARM_SRC_COMMANDLINE);
+  FakeServer srv(tmp_.path(), "S1.KLP.KCAP");
+  srv.start(1, [&](const IpcMsgView& req) {
+    for (int i = 0; i < 2000; ++i)
+      if (srv.putRaw(req.header.senderPid, rawMsg(14, {}, 1, 0, 0))) return 0;
+    return 1;  // the flood outlasted the call
+  });
+  std::string out = klptest::stdoutOf([] { EXPECT_EQ(klpCmdDispatch(1), KLP_API_NO_REPLY); });
+  EXPECT_EQ(srv.finish(), 0);
+  EXPECT_NE(out.find("  Schema name   (SCHEMA) = KLP\n  Not available (STATUS) = Not available\n"),
+            std::string::npos) << out;
+  EXPECT_TRUE(logged(log_, "*510 cmdAPIFunc 1 \\*\n589 klpkccmd 1 klpkccmd|1000|KLPCmdFunc"));
+  EXPECT_FALSE(klptest::queueExists(replyPath("S1.KLP.KCAP")));
 }
 
 }  // namespace
