@@ -19,8 +19,6 @@ TEST(Klpkccmd, RefusalsEndWithTheFailedStepAndExitCode12) {
       // The program level, then the usage text whole, then the help code.
       {{"?"}, std::string("\n") + kCapCmdUsageText, "\"416\": \"processCommandLine\""},
       {{}, "required parameter \"CAPTURE_SERVER\"", "\"2002\": \"processCommandLine\""},
-      {{"CAPTURE_SCHEMA=S", "STOP"}, "KLP0524E", "\"2003\": \"processCommandLine\""},
-      {{"X", "CHGPARMS", "COMMIT_INTERVAL=50"}, "KLP0519E", "\"2002\": \"processCommandLine\""},
       // The three words are found in any case, and only as three arguments
       // of 6, 4 and 7 characters; the parser then sees STATUS alone.
       {{"X", "status", "show", "details", "EXTRA"}, "argument \"EXTRA\"", "\"2002\""},
