@@ -1,5 +1,4 @@
-// The real klpkccmd: the usage text, STATUS SHOW DETAILS found (or not) before
-// the parser runs, every refusal reported as a failed step with exit code 12.
+// The real klpkccmd: usage text, STATUS SHOW DETAILS found before parsing, refusals end as a failed step, exit 12.
 #include <gtest/gtest.h>
 
 #include <cstdlib>
@@ -19,8 +18,7 @@ TEST(Klpkccmd, RefusalsEndWithTheFailedStepAndExitCode12) {
       // The program level, then the usage text whole, then the help code.
       {{"?"}, std::string("\n") + kCapCmdUsageText, "\"416\": \"processCommandLine\""},
       {{}, "required parameter \"CAPTURE_SERVER\"", "\"2002\": \"processCommandLine\""},
-      // The three words are found in any case, and only as three arguments
-      // of 6, 4 and 7 characters; the parser then sees STATUS alone.
+      // The three words in any case, only as three whole arguments; else the parser sees them.
       {{"X", "status", "show", "details", "EXTRA"}, "argument \"EXTRA\"", "\"2002\""},
       {{"X", "STATUS", "SHOW"}, "argument \"SHOW\"", "\"2002\""},
       {{"X", "STATUS", "SHOWS", "DETAILS"}, "argument \"SHOWS\"", "\"2002\""},
