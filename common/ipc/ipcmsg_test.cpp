@@ -17,11 +17,7 @@ namespace {
 
 using Words = std::vector<int32_t>;
 using Bytes = std::vector<char>;
-int32_t wordAt(const void* base, size_t offset) {
-  int32_t v;
-  memcpy(&v, static_cast<const char*>(base) + offset, 4);
-  return v;
-}
+int32_t wordAt(const void* p, size_t off) { int32_t v; memcpy(&v, static_cast<const char*>(p) + off, 4); return v; }
 void setWord(Bytes& raw, size_t offset, int32_t v) { memcpy(raw.data() + offset, &v, 4); }
 // The nine header words after the eye-catcher.
 Words headerWords(const void* msg) {
@@ -41,7 +37,7 @@ Bytes rawMsg(const Words& words, const std::string& payload) {
 Bytes request(int32_t func, int32_t pid, const std::string& payload) {
   return rawMsg({1, static_cast<int32_t>(44 + payload.size()), func, 0, pid, 0, 0, 0, 0}, payload);
 }
-std::string pattern(size_t n) {
+std::string pattern(size_t n) {  // differs from piece to piece
   std::string s(n, '\0');
   for (size_t i = 0; i < n; ++i) s[i] = static_cast<char>('a' + (i * 7 + i / 4052) % 26);
   return s;
@@ -180,8 +176,7 @@ TEST(IpcMsg, QueueNamesResIdTextAndProgramWords) {
   char *known = ipcNewResIDText(&id), *unknown = ipcNewResIDText(nullptr);
   EXPECT_STREQ("(mqueue, /klpq.0499de10088ac99c, 48)", known);  // the documented example
   EXPECT_STREQ("UNKNOWN", unknown);
-  free(known);
-  free(unknown);
+  free(known), free(unknown);
   const char* words[][3] = {
       {"S.A.CAP", "Capture", "Capture Commands"},       {"S.A.APP", "Apply", "Apply Commands"},
       {"S.A.KCAP", "K Capture", "K Capture Commands"},  {"S.A.KAPP", "K Apply", "K Apply Commands"},
