@@ -69,7 +69,6 @@ TEST_F(ParmSetTest, BothTablesTheQueryOfTheDefaultsAndTheUsageMatchTheGoldenFile
   for (const std::string& r : log_.take()) got += r + "\n";
   got += kCapCmdUsageText;
   EXPECT_EQ(cmd_->getQueryMsgSize(), 10u);  // the command set sends nothing of its own
-
   EXPECT_EQ(got, klptest::readFile(KLP_SOURCE_DIR "/xqpub/parmtables.golden"));
 }
 

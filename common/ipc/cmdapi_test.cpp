@@ -59,7 +59,6 @@ TEST(CmdApi, ThreadKindsServerNamesAndMappedCodes) {
       {"BR", 3},            {"Admin", 0},        {"BehinderWorker", 2}, {"BehinderWorke", 0},
       {"BehinderWorkerThread", 2},               {"BehinderWorkeX", 0}};
   for (const auto& [name, kind] : kinds) EXPECT_EQ(klpThreadKind(name), kind) << name;
-
   char out[KLP_UNIQUE_NAME_SIZE], out2[KLP_UNIQUE_NAME_SIZE];
   ASSERT_EQ(klpBuildServerName(KLP_KIND_KCAP, "mydb", "klp.", out, sizeof(out)) |
                 klpBuildServerName(KLP_KIND_APP, "db1 junk", "qrs\0junk", out2, sizeof(out2)), 0);
@@ -69,7 +68,6 @@ TEST(CmdApi, ThreadKindsServerNamesAndMappedCodes) {
   EXPECT_EQ(klpBuildServerName(6, "x", "s", out, sizeof(out)), KLP_API_BAD_KIND);
   std::string a(128, 'a'), b(128, 'b');  // 128 characters without terminator are read to 128
   EXPECT_EQ(klpBuildServerName(KLP_KIND_CAP, a.data(), b.data(), out, sizeof(out)), KLP_API_BAD_NAME);
-
   const int mapped[][2] = {{824, 1000}, {815, 2013}, {804, 2014}, {805, 2015},
                            {816, 2016}, {825, 2017}, {817, 817},  {1003, 1003}};
   for (const auto& m : mapped) EXPECT_EQ(klpMapCmdRc(m[0]), m[1]) << m[0];
@@ -94,7 +92,6 @@ TEST(CmdApiStatusData, Format1FromThreadRecords) {
   EXPECT_EQ(std::vector<char>(out.begin() + 56, out.end()), std::vector<char>(32, 0x55));
   ASSERT_EQ(conv(statusPayload({}), 32, 32), 0);
   EXPECT_EQ((Ints{required, get32(out.data(), 4)}), (Ints{32, 0}));
-
   // Counts beyond the records carried, truncated and unterminated payloads.
   auto claims3 = statusPayload({{"AdminThread", 4}}, 3), negative = statusPayload({});
   put32(negative, 8, -1);
@@ -210,7 +207,6 @@ TEST(CmdApiStatusData, Format2RecordsCopiedWidenedAndCut) {
                   r->value260, r->value264}), (Ints{52, 240, 244, -5, 256, 264, 272, 280}));
   EXPECT_EQ(std::strlen(r->text3269), 3000u);
   EXPECT_STREQ(r->text9271, "fourth");
-
   // Room for one record: that one is filled, still rc 0; below 13320 nothing is written.
   ASSERT_EQ(klpStatusFromKapp(p.data(), p.size(), out.data(), 13320, &required), 0);
   EXPECT_EQ(get32(out.data(), 4), 1);
@@ -362,7 +358,6 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
   auto junk = rawMsg(15, statusPayload({{"OldThread", 1}}), 1, 0, 0);
   ASSERT_EQ(old.put(junk.data(), junk.size()), ECF_OK);
   old.detach();
-
   const std::string q = "(mqueue, /klpq.*, 48)", held = "592 cmdAPIFunc 1 " + q + "\n594 cmdAPIFunc 1 " + q;
   const struct {
     int func, rc;
@@ -391,7 +386,6 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
   }
   EXPECT_EQ(srv.finish(), 0);
   EXPECT_FALSE(klptest::queueExists(stale));
-
   // A name cut to fit would address some other server.
   EXPECT_EQ(KLPMonFunc(std::string(220, 'S').c_str(), "KLP.MON", nullptr), 2009);
   EXPECT_TRUE(logged(log_, "589 KLPMonFunc 1 KLPMonFunc|2009|server name\n8999 KLPMonFunc 1 the server "

@@ -49,7 +49,6 @@ int main(void) {
   char buf[64];
   strcpy(req.serverName, "S1");
   strcpy(req.schema, "KLP");
-
   check(klpStartProgram() == 0, "klpStartProgram answers 0");
   check(klpStopProgram(1, "S", "K", 0, NULL) == 2001, "stop without result block");
   check(klpStopProgram(0, "S", "K", 0, &res) == 2006 && res.rc == 2006, "stop with kind 0 stores 2006");
@@ -57,7 +56,6 @@ int main(void) {
   check(klpStopProgram(1, "", "K", -1, &res) == 2007, "stop without server");
   check(klpStopProgram(5, "S", " ", -1, &res) == 2008, "stop without schema");
   check(klpStopProgram(1, "S", "K", -1, &res) == 2005, "stop with a negative option");
-
   check(klpGetStatusSize(&rel, &req, NULL) == 2001, "size without result block");
   memset(&res, 0x7f, sizeof(res));
   check(klpGetStatusSize(NULL, &req, &res) == 2001 && !strcmp(res.text, "klpReleaseInfo"), "size names the release");
@@ -67,7 +65,6 @@ int main(void) {
   check(klpGetStatusSize(&kcap, &none, &res) == 0 && none.statusSize == 2224 && res.rc == 0, "KCAP size, no server");
   strcpy(none.serverName, "S1");
   check(klpGetStatusSize(&rel, &none, &res) == 2008, "size without schema");
-
   check(klpGetStatus(&rel, &req, NULL) == 2001, "status without result block");
   check(klpGetStatus(NULL, &req, &res) == 2001 && !strcmp(res.text, "klpReleaseInfo"), "status names the release");
   check(klpGetStatus(&rel, NULL, &res) == 2001 && !strcmp(res.text, "klpGetStatusData"), "status names the request");
@@ -82,7 +79,6 @@ int main(void) {
   check(klpGetStatus(&bad, &req, &res) == 2006, "status of kind 6");
   strcpy(req.serverName, " ");
   check(klpGetStatus(&rel, &req, &res) == 2007 && res.rc == 2007, "status without server name");
-
   /* No server runs: refused, with the texts that say why. */
   char path[64];
   snprintf(path, sizeof(path), "%s/NONE.KLP.KCAP.IPC", dir);
