@@ -72,16 +72,14 @@ TEST_F(ParmSetTest, BothTablesTheQueryOfTheDefaultsAndTheUsageMatchTheGoldenFile
   EXPECT_EQ(got, klptest::readFile(KLP_SOURCE_DIR "/xqpub/parmtables.golden"));
 }
 
-// Each set's processCommandLine: CHGPARMS pairs and what ends them, the server word, one command
-// (command set); queue names refused, STARTMODE checked, short forms (server set).
+// Command set: CHGPARMS pairs and their end, the server, one command; server set: queues, STARTMODE, short forms.
 TEST_F(ParmSetTest, CommandLineRulesAndTheirRecords) {
   const std::string w = "<kCapCmdParmClass::processComma> ", d1039(1039, '1'), d1040(1040, '1'),
                     bad = "519 " + w + "35: ", odd = "504 " + w + "1: ", k33 = std::string(33, 'K') + "=1",
                     failed = "589 " + w + "1: kCapCmdParmClass::processCommandLine|",
                     parse = failed + "2002|parseCmdLine", sw = "<xqpubParms::processCommandLine> 1: ",
                     sfailed = "589 " + sw + "xqpubParms::processCommandLine|";
-  // after, command set: "changed pairs;server schema command:text"; server set: STARTMODE and
-  // the short and long forms with their sources; "" when not looked at.
+  // after: "pairs;server schema command:text", or STARTMODE and short/long forms with their sources.
   struct { bool server; std::vector<std::string> args; int rc; Records logged; std::string after; } cases[] = {
       {0, {"CAPTURE_SERVER=x", "CHGPARMS", "COMMIT_INTERVAL=1000", "SLEEP_INTERVAL=200",
         "qfull_numbers=5", "COMMIT_INTERVAL=2000", "LOGSTDOUT=y"}, 0, {}, "30=2000 16=200 37=5 4=y;X KLP 20:"},
@@ -90,8 +88,7 @@ TEST_F(ParmSetTest, CommandLineRulesAndTheirRecords) {
       {0, {"X", "CHGPARMS", "TERM=maybe"}, 2002, {bad + "maybe|TERM"}, ";"},
       {0, {"X", "CHGPARMS", "TERM"}, 2002, {bad + "|TERM"}, ";"},
       {0, {"X", "CHGPARMS", "QFULL_RETRY_DELAY=" + d1039}, 2002, {bad + d1039 + "|QFULL_RETRY_DELAY"}, ";"},
-      // What ends the group is an ordinary argument again: the command's own
-      // schema, a second command, or no parameter of the command set at all.
+      // Ends of the group: the command's own schema, a second command, a word of no set.
       {0, {"X", "CHGPARMS", "CAPTURE_SCHEMA=KLP1"}, 2002, {"527 " + w + "35:"}, ";X KLP1 20:"},
       {0, {"X", "CHGPARMS", "COMMIT_INTERVAL=1000", "STOP"}, 2002,
        {"518 <klpParmClass::parseCmdLine> 1:", parse}, "30=1000;"},

@@ -1,5 +1,4 @@
-// Command client and control interface: status data conversion, and
-// exchanges with a fake server in a forked process over the real queues.
+// Command client and control interface: status conversions, exchanges with a forked fake server.
 #include "common/ipc/cmdapi.h"
 
 #include <gtest/gtest.h>
@@ -220,9 +219,7 @@ TEST(CmdApiStatusData, Format2RecordsCopiedWidenedAndCut) {
   EXPECT_EQ(klpStatusFromKapp(p.data(), p.size(), out.data(), out.size(), &required), 2017);
 }
 
-// The calls' messages recorded, the main thread known to the recovery
-// manager, the IPC directory the test's own; useParms() makes a command's
-// parameter sets the current ones.
+// Messages recorded, the main thread known to recovery, a private IPC directory; useParms() for CHGPARMS.
 class CmdApiExchange : public ::testing::Test {
  protected:
   static void SetUpTestSuite() { klpEnsureMainThread(); }
@@ -288,7 +285,6 @@ class FakeServer {
     return reaped && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   }
   bool hasRequest() { return queue_.hasMessage(); }
-  // Puts raw bytes on the requester's reply queue.
   int putRaw(int32_t pid, const std::vector<char>& bytes) {
     char path[2048];
     ipcReplyQueuePath(path, sizeof(path), dir_.c_str(), name_.c_str(), pid);
@@ -300,7 +296,6 @@ class FakeServer {
     q.detach();
     return rc;
   }
-  // Answers through the library's reply sender.
   static int reply(const IpcMsgView& req, const std::vector<char>& payload) {
     IpcMsg* msg = nullptr;
     if (createReplyMsg(&msg, IPC_HEADER_SIZE + payload.size(), req.header.func, getpid())) return 70;
@@ -317,7 +312,6 @@ class FakeServer {
   pid_t child_ = -1;
 };
 
-// A hand-made reply message: header fields as given, payload bytes.
 std::vector<char> rawMsg(int32_t func, const std::vector<char>& payload, int32_t pieceCount,
                          int32_t pieceNo, int32_t total, int32_t version = 1) {
   std::vector<char> m(IPC_HEADER_SIZE, 0);
@@ -390,8 +384,7 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
   EXPECT_EQ(KLPMonFunc(std::string(220, 'S').c_str(), "KLP.MON", nullptr), 2009);
   EXPECT_TRUE(logged(log_, "589 KLPMonFunc 1 KLPMonFunc|2009|server name\n8999 KLPMonFunc 1 the server "
                            "name and its suffix do not fit a server name*"));
-  // Queues made by hand: a server queue open to others refused at once (no retry pauses); one
-  // taking no request of ours refuses the put; a foreign queue under the reply's name is not taken.
+  // Hand-made queues: open to others refused at once; too small refuses the put; a foreign reply queue kept.
   const std::string pid = std::to_string(getpid());
   const struct {
     const char *server, *suffix;

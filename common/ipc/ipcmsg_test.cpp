@@ -1,5 +1,4 @@
-// The command-channel message: header bytes, checked decoding, the
-// in-process element, queue names, multi-piece replies cut and gathered.
+// The command-channel message: header, checked decoding, element, queue names, pieces cut and gathered.
 #include "common/ipc/ipcmsg.h"
 
 #include <gtest/gtest.h>
@@ -33,7 +32,6 @@ Bytes rawMsg(const Words& words, const std::string& payload) {
   b.insert(b.end(), payload.begin(), payload.end());
   return b;
 }
-// A request of code `func` from process `pid` with the payload.
 Bytes request(int32_t func, int32_t pid, const std::string& payload) {
   return rawMsg({1, static_cast<int32_t>(44 + payload.size()), func, 0, pid, 0, 0, 0, 0}, payload);
 }
@@ -215,8 +213,7 @@ TEST(IpcPieces, SplitAtTheMessageBoundAndGatheredAgain) {
     EXPECT_EQ(payload + '\0', std::string(buf + 8, n + 1));
     free(buf);
   }
-  // CHGPARMS with two changed parameters: two single replies, one buffer
-  // headed by the first one's sender.
+  // CHGPARMS of two parameters: two single replies, one buffer headed by the first one's sender.
   IpcGather g;
   int32_t left = -1;
   ASSERT_EQ(0, addRaw(g, rawMsg({1, 47, 20, 0, 100, 0, 1, 0, 0}, std::string("ab\0", 3)), &left));
@@ -265,8 +262,7 @@ TEST(IpcPieces, DamagedPieceHeadersSpoilTheGather) {
   }
 }
 
-// A first piece may claim only what its code can need; a forged one costs
-// what it brought, not what it claims.
+// A first piece claims only what its code can need; a forged one costs what it brought, not what it claims.
 TEST(IpcPieces, ATotalBeyondWhatItsCodeCanNeedIsRefused) {
   const struct {
     int32_t func, total;
