@@ -25,11 +25,6 @@ TEST(Klpkccmd, RefusalsEndWithTheFailedStepAndExitCode12) {
       {{"X", "STATUS", "SHOW", "DETAIL!"}, "argument \"SHOW\"", "\"2002\""},
       {{"X", "STATUS SHOW DETAILS"}, "argument \"STATUS SHOW DETAILS\"", "\"2002\""},
       {{"X", "STOP", "STATUS", "SHOW", "DETAILS"}, "KLP0518E", "\"2002\""},
-      // A server name the status call refuses: the short report, the call's rc.
-      {{"CAPTURE_SERVER=" + std::string(129, 'N'), "STATUS", "SHOW", "DETAILS"},
-       "Detailed status of the K Capture program\n  Server name    (SERVER) = " +
-           std::string(129, 'N') + "\n  Schema name    (SCHEMA) = KLP\n  Program status (STATUS) = "
-           "Unknown: the detailed status could not be obtained\n", "\"2009\": \"KLPCmdFunc\""},
       // A name prefix too long for its field.
       {{"CAPTURE_SERVER=" + std::string(1039, 'N'), "STOP"}, "KLP0600I", "\"6005\": \"setEnvNamePrefix\""},
   };

@@ -605,7 +605,7 @@ TEST_F(CmdApiExchange, ASignalAnywhereInTheExchangeLeavesNoQueue) {
   }
 }
 
-// A server that keeps answering another request: the client gives up, the not-available report and failed step follow.
+// A server that keeps answering another request: the not-available report, the failed step; a bad name: the short one.
 TEST_F(CmdApiExchange, DispatchPrintsTheNotAvailableReportWhenNoReplyComes) {
   useParms();
   cmd_->setParm(PARM_IDX_SERVER, "S1", PARM_SRC_COMMANDLINE);
@@ -621,6 +621,9 @@ TEST_F(CmdApiExchange, DispatchPrintsTheNotAvailableReportWhenNoReplyComes) {
             std::string::npos) << out;
   EXPECT_TRUE(logged(log_, "*510 cmdAPIFunc 1 \\*\n589 klpkccmd 1 klpkccmd|1000|KLPCmdFunc"));
   EXPECT_FALSE(klptest::queueExists(replyPath("S1.KLP.KCAP")));
+  cmd_->setParm(PARM_IDX_SERVER, std::string(129, 'N').c_str(), PARM_SRC_COMMANDLINE);  // cut, it would name another
+  out = klptest::stdoutOf([] { EXPECT_EQ(klpCmdDispatch(1), KLP_API_BAD_NAME); });
+  EXPECT_NE(out.find("(STATUS) = Unknown: the detailed status could not be obtained\n"), std::string::npos) << out;
 }
 
 }  // namespace
