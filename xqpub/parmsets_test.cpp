@@ -107,6 +107,7 @@ TEST_F(ParmSetTest, CommandLineRulesAndTheirRecords) {
       {0, {"x", "reinitq=Q.One", "DEBUG"}, 0, {}, ";X KLP 23:Q.One"},
       {0, {"x", "RESUME", "LOGSTDOUT"}, 0, {}, ";X KLP 18:"},
       {0, {"x", "FOO=1", "STOP"}, 2002, {odd + "FOO=1"}, ";"},
+      {0, {"x", std::string(32, 'K') + "=1"}, 2002, {odd + std::string(32, 'K') + "=1"}, ";"},  // a keyword's longest
       {0, {"x", "?"}, 2002, {odd + "?"}, ";"},
       {0, {"x", "LOGSTDOUT"}, 2002, {"526 " + w + "35:"}, ";"},
       {1, {"x", "STARTMODE=cold", "RN=5", "RD=20", "TRANSID=abc"}, 0, {}, "COLD 5@2 20@2 abc@2"},

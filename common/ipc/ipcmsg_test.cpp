@@ -85,7 +85,8 @@ TEST(IpcMsg, HeaderBytesOfRequestsAndReplies) {
             std::string(reinterpret_cast<char*>(m), 8) + std::string(m->payload(), 16));
   EXPECT_EQ((Words{1, 60, 59, 0, 321, 0, 1, 0, 0}), headerWords(m));
   freeIpcMsg(m);
-  EXPECT_EQ(KLP_RC_BAD_PARM, createReplyMsg(&m, 43, 14, 1));
+  EXPECT_EQ((Words{KLP_RC_BAD_PARM, KLP_RC_BAD_PARM}), (Words{createReplyMsg(&m, 43, 14, 1),
+                                                              createRequestMsg(nullptr, 14, 0, nullptr)}));
   EXPECT_EQ(nullptr, m);
   std::string words;  // by code, in the order of the code table
   for (int32_t f = 9; f <= 26; ++f) words += std::string(ipcFuncWord(f)) + ",";
@@ -101,7 +102,8 @@ TEST(IpcMsg, DecodingRefusesWhatCannotBeTrusted) {
   char text[3];
   EXPECT_EQ(2u, ipcPayloadText(v, text, sizeof text));
   EXPECT_EQ(KLP_RC_GET_FAILED, ipcDecodeMsg(good.data(), 43, &v));
-  EXPECT_EQ(KLP_RC_GET_FAILED, ipcDecodeMsg(nullptr, 0, &v));
+  EXPECT_EQ((Words{KLP_RC_GET_FAILED, KLP_RC_GET_FAILED}), (Words{ipcDecodeMsg(nullptr, 0, &v),
+                                                                  ipcDecodeMsg(nullptr, 100, &v)}));
   auto v2 = rawMsg({2, 47, 15, 0, 1, 0, 0, 0, 0}, "abc");
   EXPECT_EQ(KLP_RC_BAD_VERSION, ipcDecodeMsg(v2.data(), v2.size(), &v));
   EXPECT_EQ(2, v.header.msgVersion);
