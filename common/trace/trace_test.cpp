@@ -1,6 +1,6 @@
-// The trace writer, its reader and the attachment of a process to a block:
-// damaged images first, then what the writer keeps and drops; last, the
-// trace command called inside the server and short of memory.
+// The trace writer, its reader and attaching to a block: damaged images,
+// what the writer keeps and drops, the trace command in the server and
+// short of memory.
 #include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -23,34 +23,14 @@
 #include "include/klptrc.h"
 #include "tests/testing/klptest.h"
 
-// A process short of memory gets null from malloc, as it does without the
-// address sanitizer, whose default is to end the process instead.
+// Short of memory, malloc answers null here as it does without the sanitizer.
 extern "C" const char* __asan_default_options() { return "allocator_may_return_null=1"; }
 
 namespace {
 
+using klptest::stdoutOf;
 constexpr uint32_t kArea = TRC_MIN_SIZE - TRC_HEADER_SIZE;  // 35808 bytes of records
 const char* const kKey = "TDB.KLP.KCAP";
-
-// What the trace messages said while an object lived.
-class Said {
- public:
-  Said() : file_(tmpfile()) { g_trcAnchorStorage.out = file_; }
-  ~Said() {
-    g_trcAnchorStorage.out = nullptr;
-    fclose(file_);
-  }
-  std::string text() {
-    fflush(file_);
-    std::string s(static_cast<size_t>(ftell(file_)), '\0');
-    rewind(file_);
-    s.resize(fread(s.data(), 1, s.size(), file_));
-    return s;
-  }
-
- private:
-  FILE* file_;
-};
 
 struct Rec {
   int type, component, function, level;
@@ -73,39 +53,50 @@ struct Walk {
 
 Walk walk(const trcBlockHeader* h, size_t size, bool fromFile) {
   Walk w;
-  Said said;
-  trcIter it;
-  trcIterInit(&it, h, size, fromFile);
-  while (trcNextRecord(&it)) {
-    const trcRecordHeader* r = it.record;
-    Rec rec{r->type, r->component, r->function, r->levelMask, r->threadId, r->pid,
-            std::string(r->name, 16), {}};
-    uint32_t off = 0;
-    int index = 0;
-    trcObject o;
-    while (trcNextObject(r, &off, &index, &o))
-      rec.objects.push_back({o.type, std::string(reinterpret_cast<const char*>(o.data), o.length)});
-    w.records.push_back(rec);
-  }
-  w.error = it.error;
-  w.said = said.text();
+  w.said = stdoutOf([&] {
+    trcIter it;
+    trcIterInit(&it, h, size, fromFile);
+    while (trcNextRecord(&it)) {
+      const trcRecordHeader* r = it.record;
+      Rec rec{r->type, r->component, r->function, r->levelMask, r->threadId, r->pid,
+              std::string(r->name, 16), {}};
+      uint32_t off = 0;
+      int index = 0;
+      trcObject o;
+      while (trcNextObject(r, &off, &index, &o))
+        rec.objects.push_back({o.type, std::string(reinterpret_cast<const char*>(o.data), o.length)});
+      w.records.push_back(rec);
+    }
+    w.error = it.error;
+  });
   return w;
+}
+
+Walk walkFile(const std::string& path) {
+  trcBlockHeader h;
+  if (trcReadFileHeader(path.c_str(), &h) != TRC_READ_OK) return Walk{};
+  return walk(&h, 0, true);
+}
+
+void save(const std::string& path, const std::string& bytes) {
+  FILE* f = fopen(path.c_str(), "wb");
+  fwrite(bytes.data(), 1, bytes.size(), f);
+  fclose(f);
 }
 
 // A trace block of this process, created as the trace command does, from
 // the keys the anchor already holds.
 struct Trace {
   klptest::TmpDir dir;
-  Trace(uint32_t size = TRC_MIN_SIZE, const std::string& file = "", uint32_t fileSize = TRC_MAX_SIZE,
-        uint16_t filter = 0x3F) {
+  explicit Trace(uint32_t size = TRC_MIN_SIZE, const std::string& file = "",
+                 uint32_t fileSize = TRC_MAX_SIZE) {
     trcInitAnchor();
     trcAnchor* a = trcGetAnchor();
     snprintf(a->keyPart1, TRC_KEY_SIZE, "%s", dir.path().c_str());
     snprintf(a->keyPart2, TRC_KEY_SIZE, "%s", kKey);
     EXPECT_EQ(0, trcCreate(size, a->keyPart1, a->keyPart2, file.empty() ? nullptr : file.c_str(),
-                           fileSize, filter, true));
-    EXPECT_EQ(dir.path(), a->keyPart1);
-    EXPECT_STREQ(kKey, a->keyPart2);
+                           fileSize, 0x3F, true));
+    EXPECT_EQ(dir.path() + kKey, std::string(a->keyPart1) + a->keyPart2);
   }
   ~Trace() {
     trcFree();
@@ -119,7 +110,7 @@ void put(int v) { trcData(5, 7, "value", TRC_LVL_BASIC, TRC_OBJ_SIGNED, 4, &v); 
 
 // A hand-made image: header and data area, records placed by offset.
 struct Image {
-  std::vector<uint8_t> bytes = std::vector<uint8_t>(TRC_MIN_SIZE, 0);
+  std::string bytes = std::string(TRC_MIN_SIZE, '\0');
   trcBlockHeader* h() { return reinterpret_cast<trcBlockHeader*>(bytes.data()); }
   Image(uint32_t write, uint32_t oldest, uint32_t high, uint32_t count) {
     h()->dataOffset = TRC_HEADER_SIZE;
@@ -128,6 +119,8 @@ struct Image {
     h()->highWaterOffset = high;
     h()->entryCount = count;
     h()->bufferSize = TRC_MIN_SIZE;
+    h()->maxFileSize = TRC_MAX_SIZE;
+    strcpy(h()->platform, "Linux");
   }
   Image& rec(uint32_t off, uint32_t length, uint16_t function = 1, uint16_t objects = 0,
              uint16_t objectLength = 0) {
@@ -150,6 +143,7 @@ TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
     size_t records;
     int error, fileError;
     const char* said;
+    size_t fileBytes = 0;  // the file cut after these many bytes of records
   };
   std::vector<Row> rows = {
       {"length below 40", Image(80, 0, 80, 1).rec(0, 36), 0, TRC_WALK_BAD_RECORD,
@@ -182,6 +176,14 @@ TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
        TRC_WALK_OK, ""},
       {"stale bytes beyond the write offset", Image(40, 0, 120, 1).rec(0, 40).rec(40, 40), 1,
        TRC_WALK_OK, TRC_WALK_OK, ""},
+      // Files claiming more than they hold: refused before memory is sized by them.
+      {"2 GB counters and length over 48 bytes",
+       Image(0x7FFFFFF0, 0, 0x7FFFFFF0, 1).rec(0, 0x7FFFFFF0), 0, TRC_WALK_BAD_HEADER,
+       TRC_WALK_BAD_RECORD, "", 48},
+      {"file cut after the record header", Image(80, 0, 80, 1).rec(0, 80), 1, TRC_WALK_OK,
+       TRC_WALK_BAD_RECORD, "", 40},
+      {"file cut inside the record header", Image(80, 0, 80, 1).rec(0, 80), 1, TRC_WALK_OK,
+       TRC_WALK_IO, "", 20},
   };
   klptest::TmpDir dir;
   for (Row& row : rows) {
@@ -190,22 +192,20 @@ TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
     EXPECT_EQ(row.records, mem.records.size());
     EXPECT_EQ(row.error, mem.error);
     EXPECT_NE(std::string::npos, mem.said.find(row.said)) << mem.said;
-
-    // The same bytes as a trace file.
-    std::string path = dir.path() + "image.trc";
-    snprintf(row.image.h()->fileName, TRC_KEY_SIZE, "%s", path.c_str());
-    FILE* f = fopen(path.c_str(), "wb");
-    fwrite(row.image.bytes.data(), 1, row.image.bytes.size(), f);
-    fclose(f);
-    trcBlockHeader header;
-    ASSERT_EQ(TRC_READ_OK, trcReadFileHeader(path.c_str(), &header));
-    Walk file = walk(&header, 0, true);
-    EXPECT_EQ(row.records, file.records.size());
-    EXPECT_EQ(row.fileError, file.error);
     if (row.error == TRC_WALK_OK && row.records == 2) {
       EXPECT_EQ(1, mem.records[0].function);  // the oldest first
       EXPECT_EQ(2, mem.records[1].function);
     }
+
+    // The same bytes as a trace file.
+    std::string path = dir.path() + "image.trc";
+    snprintf(row.image.h()->fileName, TRC_KEY_SIZE, "%s", path.c_str());
+    save(path, row.fileBytes ? row.image.bytes.substr(0, TRC_HEADER_SIZE + row.fileBytes)
+                             : row.image.bytes);
+    Walk file = walkFile(path);
+    EXPECT_EQ(row.fileError, file.error);
+    bool whole = row.fileError == TRC_WALK_OK || row.fileError == TRC_WALK_SHORT;
+    EXPECT_EQ(whole ? row.records : 0u, file.records.size());
   }
 }
 
@@ -278,12 +278,8 @@ TEST(TraceWriter, WhatARecordHolds) {
     EXPECT_EQ(row.type, r.type);
     EXPECT_EQ(row.objects, r.objects);
     EXPECT_EQ(hsvProcessID(), r.pid);
-    if (row.name != nullptr) {
-      EXPECT_EQ(std::string(row.name) + '\0', r.name);
-    }
-    if (row.function != nullptr) {
-      EXPECT_STREQ(row.function, trcFunctionName(r.component, r.function));
-    }
+    if (row.name != nullptr) { EXPECT_EQ(std::string(row.name) + '\0', r.name); }
+    if (row.function != nullptr) { EXPECT_STREQ(row.function, trcFunctionName(r.component, r.function)); }
   }
 
   // The common body takes 32 objects of 33.
@@ -295,6 +291,7 @@ TEST(TraceWriter, WhatARecordHolds) {
   trcDataN(5, 7, "many", 2, 33, types, lengths, pointers);
   EXPECT_EQ(32u, t.read().records.at(0).objects.size());
 }
+
 
 TEST(TraceWriter, WrapKeepsTheNewestRecords) {
   Trace t;
@@ -312,10 +309,8 @@ TEST(TraceWriter, DirectToFileLosesNothingUntilItsLimit) {
     int written, kept;
     bool said;  // the file was reported full (once)
   };
-  // Each wrap appends one full lap of 746 records (35808 bytes); three laps
-  // fit 131072, and 23648 bytes are left. The last lap (turning the trace
-  // off) holds the rest: 500 records (24000 bytes) do not fit what is left,
-  // 100 would, but after the laps refused before them.
+  // Each wrap appends a lap of 746 records (35808 bytes): three fit 131072;
+  // the last lap (at turning off) does not fit the 23648 bytes left.
   for (const Row& row : std::vector<Row>{
            {TRC_MAX_SIZE, 5000, 5000, false},
            {TRC_MIN_SIZE, 4230, 2238, true},
@@ -325,17 +320,16 @@ TEST(TraceWriter, DirectToFileLosesNothingUntilItsLimit) {
     std::string path = files.path() + "direct.trc";
     {
       Trace t(TRC_MIN_SIZE, path, row.fileSize);
-      Said said;
-      for (int v = 0; v < row.written; ++v) put(v);
-      trcFlushLastLap(t.b());
+      std::string said = stdoutOf([&] {
+        for (int v = 0; v < row.written; ++v) put(v);
+        trcFlushLastLap(t.b());
+      });
       EXPECT_EQ(row.said ? "Trace file \"" + path + "\" has reached its maximum size of 131072 "
                            "bytes, no more records are written to it.\n"
                          : "",
-                said.text());
+                said);
     }
-    trcBlockHeader header;
-    ASSERT_EQ(TRC_READ_OK, trcReadFileHeader(path.c_str(), &header));
-    Walk w = walk(&header, 0, true);
+    Walk w = walkFile(path);
     ASSERT_EQ(static_cast<size_t>(row.kept), w.records.size());
     for (int i = 0; i < row.kept; ++i) ASSERT_EQ(i, w.records[i].value());
   }
@@ -343,12 +337,12 @@ TEST(TraceWriter, DirectToFileLosesNothingUntilItsLimit) {
 
 TEST(TraceWriter, RecordsFromTwoThreads) {
   Trace t;
-  auto writer = [](int base, uint32_t* tid) {
-    *tid = static_cast<uint32_t>(hsvThreadID());
-    for (int i = 0; i < 300; ++i) put(base + i);
-  };
   uint32_t tids[2];
-  std::thread a(writer, 0, &tids[0]), b(writer, 1000, &tids[1]);
+  auto writer = [&](int k) {
+    tids[k] = static_cast<uint32_t>(hsvThreadID());
+    for (int i = 0; i < 300; ++i) put(1000 * k + i);
+  };
+  std::thread a(writer, 0), b(writer, 1);
   a.join();
   b.join();
   int next[2] = {0, 1000};
@@ -361,8 +355,7 @@ TEST(TraceWriter, RecordsFromTwoThreads) {
   EXPECT_EQ(1300, next[1]);
 }
 
-// Letting go of the block while another thread writes: the block is unmapped
-// only once the writer is out of it.
+// The block is unmapped only once a writing thread is out of it.
 TEST(TraceWriter, DetachWhileAnotherThreadWrites) {
   Trace t;
   std::atomic<bool> done{false};
@@ -381,71 +374,49 @@ TEST(TraceWriter, DetachWhileAnotherThreadWrites) {
 TEST(TraceFile, FlushFaults) {
   struct Row {
     const char* what;
-    std::function<void(const std::string&)> existing;  // file before the flush
-    int entries;                                        // in the image
-    size_t records;                                     // in the file afterwards
-    const char* said;
+    std::string existing;  // the file's bytes before the flush ("" none)
+    int entries, stale;    // records in the image, and stale ones after its write offset
+    bool ok;
+    size_t records;        // in the file afterwards
+    const char* said;      // %s: the file's path
+    const char* file = "f.trc";
   };
-  auto write = [](const std::string& path, const std::string& bytes) {
-    FILE* f = fopen(path.c_str(), "wb");
-    fwrite(bytes.data(), 1, bytes.size(), f);
-    fclose(f);
-  };
-  auto header = [&](const char* platform, uint32_t dataOffset) {
-    return [=](const std::string& path) {
-      std::vector<char> h(TRC_HEADER_SIZE, 0);
-      auto* b = reinterpret_cast<trcBlockHeader*>(h.data());
-      strcpy(b->platform, platform);
-      strcpy(b->structVersion, "0012");
-      b->dataOffset = dataOffset;
-      write(path, std::string(h.data(), h.size()));
-    };
+  auto header = [](const char* platform, uint32_t dataOffset) {
+    std::string h(TRC_HEADER_SIZE, '\0');
+    auto* b = reinterpret_cast<trcBlockHeader*>(h.data());
+    strcpy(b->platform, platform);
+    strcpy(b->structVersion, "0012");
+    b->dataOffset = dataOffset;
+    return h;
   };
   std::vector<Row> rows = {
-      {"a header cut short is written afresh", [&](auto& p) { write(p, "short"); }, 3, 3, ""},
-      {"another platform's file is refused", header("Windows", TRC_HEADER_SIZE), 3, 0,
+      {"a header cut short is written afresh", "short", 3, 0, true, 3, ""},
+      {"another platform's file is refused", header("Windows", TRC_HEADER_SIZE), 3, 0, false, 0,
        "File %s was generated by an incompatible Trace version."},
-      {"a damaged header is refused", header("Linux", 8), 3, 0, "is damaged"},
-      {"an empty image appends nothing", header("Linux", TRC_HEADER_SIZE), 0, 0,
+      {"a damaged header is refused", header("Linux", 8), 3, 0, false, 0, "is damaged"},
+      {"an empty image appends nothing", header("Linux", TRC_HEADER_SIZE), 0, 0, true, 0,
        "Trace buffer is empty"},
+      {"a new file holds the records, not the stale bytes", "", 1, 1, true, 1, ""},
+      {"a file that cannot be created", "", 1, 0, false, 0, "Unable to create file \"%s\"",
+       "none/f.trc"},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.what);
     klptest::TmpDir files;
-    std::string path = files.path() + "f.trc";
-    row.existing(path);
-    Image img(48 * row.entries, 0, 48 * row.entries, row.entries);
-    for (int i = 0; i < row.entries; ++i) img.rec(48 * i, 48, 1, 1, 4);
+    std::string path = files.path() + row.file;
+    if (!row.existing.empty()) save(path, row.existing);
+    int n = row.entries + row.stale;
+    Image img(48 * row.entries, 0, 48 * n, row.entries);
+    for (int i = 0; i < n; ++i) img.rec(48 * i, 48, 1, 1, 4);
     snprintf(img.h()->fileName, TRC_KEY_SIZE, "%s", path.c_str());
-    strcpy(img.h()->platform, "Linux");
-    img.h()->maxFileSize = TRC_MAX_SIZE;
-    Said said;
-    trcFlushToFile(img.h(), true);
+    int rc = -1;
+    std::string said = stdoutOf([&] { rc = trcFlushToFile(img.h(), true); });
     std::string expected = row.said;
     if (expected.find("%s") != std::string::npos) expected.replace(expected.find("%s"), 2, path);
-    EXPECT_NE(std::string::npos, said.text().find(expected)) << said.text();
-    trcBlockHeader h;
-    if (trcReadFileHeader(path.c_str(), &h) == TRC_READ_OK && h.dataOffset == TRC_HEADER_SIZE) {
-      EXPECT_EQ(row.records, walk(&h, 0, true).records.size());
-    }
+    EXPECT_NE(std::string::npos, said.find(expected)) << said;
+    EXPECT_EQ(row.ok, rc == 0);
+    EXPECT_EQ(row.records, walkFile(path).records.size());
   }
-
-  // A file that cannot be created is not left behind half written.
-  Image img(48, 0, 48, 1);
-  img.rec(0, 48, 1, 1, 4);
-  strcpy(img.h()->fileName, "/nonexistent-dir/f.trc");
-  Said said;
-  EXPECT_NE(0, trcFlushToFile(img.h(), true));
-  EXPECT_NE(std::string::npos, said.text().find("Unable to create file \"/nonexistent-dir/f.trc\""));
-
-  // Bytes beyond the write offset of an unwrapped image are stale: a new
-  // file holds the records only.
-  klptest::TmpDir files;
-  Image stale(48, 0, 96, 1);
-  stale.rec(0, 48, 1, 1, 4).rec(48, 48, 2, 1, 4);
-  snprintf(stale.h()->fileName, TRC_KEY_SIZE, "%sstale.trc", files.path().c_str());
-  ASSERT_EQ(0, trcFlushToFile(stale.h(), true));
-  EXPECT_EQ(TRC_HEADER_SIZE + 48u, klptest::readFile(stale.h()->fileName).size());
 }
 
 TEST(TraceVersion, IncompatibleHeadersAreRefused) {
@@ -476,9 +447,9 @@ TEST(TraceVersion, IncompatibleHeadersAreRefused) {
     strcpy(h.symbolVersion, row.symbols);
     h.componentCount = row.components;
     h.functionsPerComponent = row.functions;
-    Said said;
-    EXPECT_EQ(row.compatible, trcCheckVersion(&h, nullptr, true));
-    std::string text = said.text();
+    bool compatible = false;
+    std::string text = stdoutOf([&] { compatible = trcCheckVersion(&h, nullptr, true); });
+    EXPECT_EQ(row.compatible, compatible);
     EXPECT_TRUE(*row.said ? text.find(row.said) != std::string::npos : text.empty()) << text;
   }
 }
@@ -496,26 +467,20 @@ TEST(TraceThreads, HashedSlotsOverflowAndLookups) {
   // Overflow entries 1..148, then entry 149 taken in turn by each new id.
   for (uint32_t k = 2; k <= 151; ++k) set(0x1234 + 150 * k, "more");
   set(0x1234 + 150 * 152, "last");
-
-  struct Row {
-    uint32_t id;
-    const char* name;
-  };
-  for (const Row& row : std::vector<Row>{{0x1234, "first"},
-                                         {0x1234 + 150, "collides"},
-                                         {0x1234 + 150 * 149, "more"},
-                                         {0x1234 + 150 * 150, "UNKNOWN THREAD2"},
-                                         {0x1234 + 150 * 151, "UNKNOWN THREAD2"},
-                                         {0x1234 + 150 * 152, "last"},
-                                         {11, "UNKNOWN THREAD1"},
-                                         {0xFFFFFFFF, "UNKNOWN THREAD1"}}) {
-    EXPECT_STREQ(row.name, trcGetThreadData(row.id)->threadName) << row.id;
-  }
+  for (const auto& [id, name] : std::vector<std::pair<uint32_t, const char*>>{
+           {0x1234, "first"},
+           {0x1234 + 150, "collides"},
+           {0x1234 + 150 * 149, "more"},
+           {0x1234 + 150 * 150, "UNKNOWN THREAD2"},
+           {0x1234 + 150 * 151, "UNKNOWN THREAD2"},
+           {0x1234 + 150 * 152, "last"},
+           {11, "UNKNOWN THREAD1"},
+           {0xFFFFFFFF, "UNKNOWN THREAD1"}})
+    EXPECT_STREQ(name, trcGetThreadData(id)->threadName) << id;
   EXPECT_STREQ("tid = 0x34120000", trcGetThreadData(0x1234)->threadIdText);
   EXPECT_STREQ("first", t.b()->threadTable[10].threadName);
   EXPECT_STREQ("last", t.b()->threadOverflow[149].threadName);
 }
-
 // A process attaching to a block the trace command created: the server
 // (declared the traced application) or another one, such as the command
 // program, which must leave the server's hold on the block alone.
