@@ -1,6 +1,5 @@
-// The formatter against trace images built here byte by byte: every object
-// formatter (damaged objects first), the three styles and their filters,
-// and fields that fill their whole width.
+// The formatter over images built here byte by byte: every object formatter
+// (damaged first), the three styles and their filters, full-width fields.
 #include <gtest/gtest.h>
 
 #include <cstdio>
@@ -14,36 +13,22 @@
 #include "common/trace/trcformat.h"
 #include "common/trace/trcobjfmt.h"
 #include "common/trace/trcopts.h"
+#include "tests/testing/klptest.h"
 
 namespace {
 
 using Bytes = std::string;
 
-// Text written to a stream while the object lives.
-class Captured {
- public:
-  Captured() : file_(open_memstream(&buf_, &size_)) {}
-  ~Captured() {
-    fclose(file_);
-    free(buf_);
-  }
-  FILE* file() { return file_; }
-  std::string text() {
-    fflush(file_);
-    return std::string(buf_, size_);
-  }
-
- private:
-  char* buf_ = nullptr;
-  size_t size_ = 0;
-  FILE* file_;
-};
-
 std::string object(unsigned type, const Bytes& data, bool hex = false) {
-  Captured c;
-  trcFormatObject(c.file(), type, static_cast<uint32_t>(data.size()),
-                  reinterpret_cast<const uint8_t*>(data.data()), hex);
-  return c.text();
+  return klptest::stdoutOf([&] {
+    trcFormatObject(stdout, type, static_cast<uint32_t>(data.size()),
+                    reinterpret_cast<const uint8_t*>(data.data()), hex);
+  });
+}
+Bytes times(const Bytes& b, int n) {
+  Bytes all;
+  while (n-- > 0) all += b;
+  return all;
 }
 
 Bytes le16(uint16_t v) { return Bytes(reinterpret_cast<const char*>(&v), 2); }
@@ -132,11 +117,11 @@ std::string format(Image& im, Style style, uint16_t level = 0x7FFF,
   h->globalFilter = level;
   trcApplyFilters(h, filters.data(), static_cast<int>(filters.size()));
   trcLoadThreadTables(h);
-  Captured c;
-  if (style == FLW) trcFormatFlow(c.file(), im.image());
-  if (style == FMT) trcFormatFull(c.file(), im.image(), false);
-  if (style == V7) trcFormatV7(c.file(), im.image());
-  return c.text();
+  return klptest::stdoutOf([&] {
+    if (style == FLW) trcFormatFlow(stdout, im.image());
+    if (style == FMT) trcFormatFull(stdout, im.image(), false);
+    if (style == V7) trcFormatV7(stdout, im.image());
+  });
 }
 
 class Formatter : public ::testing::Test {
@@ -212,22 +197,12 @@ TEST_F(Formatter, ObjectsDamagedOrWhole) {
 
 TEST_F(Formatter, StatementAndDescriptorListingsStopWhenFull) {
   const std::string in = "\n         ";
-  Bytes tokens;
-  for (int i = 0; i < 8; ++i) tokens += "AAAAAAAAA ";
-  tokens.pop_back();
-  std::string six;
-  for (int i = 0; i < 6; ++i) six += "AAAAAAAAA ";
-  EXPECT_EQ(object(6, tokens), in + six + in + "AAAAAAAAA AAAAAAAAA\n");
-
-  std::string many;
-  for (int i = 0; i < 500; ++i) many += "AAAAAAAAAA ";  // lines of 76 characters
-  std::string listed = object(6, many);
+  EXPECT_EQ(object(6, times("AAAAAAAAA ", 7) + "AAAAAAAAA"),
+            in + times("AAAAAAAAA ", 6) + in + "AAAAAAAAA AAAAAAAAA\n");
+  std::string listed = object(6, times("AAAAAAAAAA ", 500));  // lines of 76 characters
   EXPECT_LT(listed.size(), 4000u);
   EXPECT_EQ(listed.substr(listed.size() - 15), "...buffer full\n");
-
-  Bytes columns;
-  for (int i = 0; i < 400; ++i) columns += column(452, 10, std::string(30, 'N'), 30);
-  std::string cols = object(5, sqlda(400, columns));
+  std::string cols = object(5, sqlda(400, times(column(452, 10, std::string(30, 'N'), 30), 400)));
   EXPECT_LT(cols.size(), 20000u);
   EXPECT_EQ(cols.substr(cols.size() - 24), "         ...buffer full\n");
 }
@@ -295,9 +270,8 @@ TEST_F(Formatter, FullWidthFieldsStayWithinTheirFields) {
   memset(h->threadTable[0x11].data, 'D', sizeof h->threadTable[0x11].data);
   memset(h->threadTable[0x11].threadIdText, 'T', sizeof h->threadTable[0x11].threadIdText);
   im.add(1, 11, 2, 0x11, 1, timeValue(1, 1));
-  Captured c;
-  trcFormatStyles(c.file(), im.image(), false, true, false, false);
-  std::string text = c.text();
+  std::string text =
+      klptest::stdoutOf([&] { trcFormatStyles(stdout, im.image(), false, true, false, false); });
   for (const std::string& line :
        {"  Unique Name:       " + std::string(161, 'U') + "\n  Arch Level:",
         "  Job Name(Orl):     " + std::string(9, 'J') + "\n  Program",

@@ -2,13 +2,12 @@
 // values become, and the filters they set.
 #include <gtest/gtest.h>
 
-#include <cstdio>
-#include <cstdlib>
 #include <string>
 #include <vector>
 
 #include "common/trace/trace.h"
 #include "common/trace/trcopts.h"
+#include "tests/testing/klptest.h"
 
 namespace {
 
@@ -24,14 +23,7 @@ Parsed parse(std::vector<std::string> args) {
   p.args.insert(p.args.begin(), "klptrc");
   std::vector<char*> argv;
   for (std::string& a : p.args) argv.push_back(a.data());
-  char* buf = nullptr;
-  size_t size = 0;
-  g_trcAnchorStorage.out = open_memstream(&buf, &size);
-  trcParseArgs(static_cast<int>(argv.size()), argv.data(), &p.o);
-  fclose(g_trcAnchorStorage.out);
-  g_trcAnchorStorage.out = nullptr;
-  p.said.assign(buf, size);
-  free(buf);
+  p.said = klptest::stdoutOf([&] { trcParseArgs(static_cast<int>(argv.size()), argv.data(), &p.o); });
   trcFreeOptions(&p.o);  // filters are looked at through the block only
   return p;
 }
