@@ -145,45 +145,36 @@ TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
     const char* said;
     size_t fileBytes = 0;  // the file cut after these many bytes of records
   };
+  const int OK = TRC_WALK_OK, HEADER = TRC_WALK_BAD_HEADER, RECORD = TRC_WALK_BAD_RECORD;
   std::vector<Row> rows = {
-      {"length below 40", Image(80, 0, 80, 1).rec(0, 36), 0, TRC_WALK_BAD_RECORD,
-       TRC_WALK_BAD_RECORD, "impossible length 36"},
-      {"length not a multiple of 4", Image(80, 0, 80, 1).rec(0, 42), 0, TRC_WALK_BAD_RECORD,
-       TRC_WALK_BAD_RECORD, "impossible length 42"},
-      {"length 0 never loops", Image(80, 0, 80, 2).rec(0, 0), 0, TRC_WALK_BAD_RECORD,
-       TRC_WALK_BAD_RECORD, "impossible length 0"},
-      {"length past the high-water offset", Image(40, 0, 40, 1).rec(0, 80), 0,
-       TRC_WALK_BAD_RECORD, TRC_WALK_BAD_RECORD, "impossible length 80"},
+      {"length below 40", Image(80, 0, 80, 1).rec(0, 36), 0, RECORD, RECORD, "impossible length 36"},
+      {"length not a multiple of 4", Image(80, 0, 80, 1).rec(0, 42), 0, RECORD, RECORD,
+       "impossible length 42"},
+      {"length 0 never loops", Image(80, 0, 80, 2).rec(0, 0), 0, RECORD, RECORD, "impossible length 0"},
+      {"length past the high-water offset", Image(40, 0, 40, 1).rec(0, 80), 0, RECORD, RECORD,
+       "impossible length 80"},
       {"entry count above the records held", Image(160, 0, 160, 3).rec(0, 80).rec(80, 80), 2,
        TRC_WALK_SHORT, TRC_WALK_SHORT, "counts 3 records but only 2"},
       {"data-area offset inside the header",
-       [] { Image i(40, 0, 40, 1); i.h()->dataOffset = 95260; return i; }(), 0,
-       TRC_WALK_BAD_HEADER, TRC_WALK_BAD_HEADER, "data-area offset"},
-      {"offsets not multiples of 4", Image(42, 0, 42, 1), 0, TRC_WALK_BAD_HEADER,
-       TRC_WALK_BAD_HEADER, "multiples of 4"},
-      {"oldest beyond the high-water offset", Image(40, 80, 40, 1), 0, TRC_WALK_BAD_HEADER,
-       TRC_WALK_BAD_HEADER, "beyond the high-water"},
-      {"more entries than bytes", Image(40, 0, 40, 2).rec(0, 40), 0, TRC_WALK_BAD_HEADER,
-       TRC_WALK_BAD_HEADER, "more entries"},
-      {"high-water offset beyond the buffer", Image(kArea + 40, 0, kArea + 40, 1), 0,
-       TRC_WALK_BAD_HEADER, TRC_WALK_BAD_RECORD, ""},
-      {"object runs past its record", Image(48, 0, 48, 1).rec(0, 48, 1, 1, 20), 1, TRC_WALK_OK,
-       TRC_WALK_OK, "Object 1 of length 20 runs past"},
-      {"more objects counted than fit", Image(48, 0, 48, 1).rec(0, 48, 1, 2, 4), 1, TRC_WALK_OK,
-       TRC_WALK_OK, "Object 2 lies beyond"},
+       [] { Image i(40, 0, 40, 1); i.h()->dataOffset = 95260; return i; }(), 0, HEADER, HEADER,
+       "data-area offset"},
+      {"offsets not multiples of 4", Image(42, 0, 42, 1), 0, HEADER, HEADER, "multiples of 4"},
+      {"oldest beyond the high-water offset", Image(40, 80, 40, 1), 0, HEADER, HEADER,
+       "beyond the high-water"},
+      {"more entries than bytes", Image(40, 0, 40, 2).rec(0, 40), 0, HEADER, HEADER, "more entries"},
+      {"high-water offset beyond the buffer", Image(kArea + 40, 0, kArea + 40, 1), 0, HEADER, RECORD, ""},
+      {"object runs past its record", Image(48, 0, 48, 1).rec(0, 48, 1, 1, 20), 1, OK, OK,
+       "Object 1 of length 20 runs past"},
+      {"more objects counted than fit", Image(48, 0, 48, 1).rec(0, 48, 1, 2, 4), 1, OK, OK,
+       "Object 2 lies beyond"},
       {"wrapped: oldest to high water, then from 0",
-       Image(40, 80, 120, 2).rec(0, 40, 2).rec(40, 40, 9).rec(80, 40, 1), 2, TRC_WALK_OK,
-       TRC_WALK_OK, ""},
-      {"stale bytes beyond the write offset", Image(40, 0, 120, 1).rec(0, 40).rec(40, 40), 1,
-       TRC_WALK_OK, TRC_WALK_OK, ""},
+       Image(40, 80, 120, 2).rec(0, 40, 2).rec(40, 40, 9).rec(80, 40, 1), 2, OK, OK, ""},
+      {"stale bytes beyond the write offset", Image(40, 0, 120, 1).rec(0, 40).rec(40, 40), 1, OK, OK, ""},
       // Files claiming more than they hold: refused before memory is sized by them.
       {"2 GB counters and length over 48 bytes",
-       Image(0x7FFFFFF0, 0, 0x7FFFFFF0, 1).rec(0, 0x7FFFFFF0), 0, TRC_WALK_BAD_HEADER,
-       TRC_WALK_BAD_RECORD, "", 48},
-      {"file cut after the record header", Image(80, 0, 80, 1).rec(0, 80), 1, TRC_WALK_OK,
-       TRC_WALK_BAD_RECORD, "", 40},
-      {"file cut inside the record header", Image(80, 0, 80, 1).rec(0, 80), 1, TRC_WALK_OK,
-       TRC_WALK_IO, "", 20},
+       Image(0x7FFFFFF0, 0, 0x7FFFFFF0, 1).rec(0, 0x7FFFFFF0), 0, HEADER, RECORD, "", 48},
+      {"file cut after the record header", Image(80, 0, 80, 1).rec(0, 80), 1, OK, RECORD, "", 40},
+      {"file cut inside the record header", Image(80, 0, 80, 1).rec(0, 80), 1, OK, TRC_WALK_IO, "", 20},
   };
   klptest::TmpDir dir;
   for (Row& row : rows) {
@@ -192,7 +183,7 @@ TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
     EXPECT_EQ(row.records, mem.records.size());
     EXPECT_EQ(row.error, mem.error);
     EXPECT_NE(std::string::npos, mem.said.find(row.said)) << mem.said;
-    if (row.error == TRC_WALK_OK && row.records == 2) {
+    if (row.error == OK && row.records == 2) {
       EXPECT_EQ(1, mem.records[0].function);  // the oldest first
       EXPECT_EQ(2, mem.records[1].function);
     }
@@ -204,7 +195,7 @@ TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
                              : row.image.bytes);
     Walk file = walkFile(path);
     EXPECT_EQ(row.fileError, file.error);
-    bool whole = row.fileError == TRC_WALK_OK || row.fileError == TRC_WALK_SHORT;
+    bool whole = row.fileError == OK || row.fileError == TRC_WALK_SHORT;
     EXPECT_EQ(whole ? row.records : 0u, file.records.size());
   }
 }
@@ -261,6 +252,14 @@ TEST(TraceWriter, WhatARecordHolds) {
       {"a library routine's points name its own row", none,
        [] { return static_cast<uint32_t>(compareIgnTransCriteria("A%C", "ABBC")); }, 1, 2,
        TRC_REC_ENTRY, {}, nullptr, "compareIgnTransCriteria"},
+      {"the common body takes 32 objects of 33", none,
+       [] {
+         int types[33];
+         uint32_t lengths[33];
+         const void* pointers[33];
+         for (int i = 0; i < 33; ++i) types[i] = str, lengths[i] = 1, pointers[i] = "z";
+         return trcDataN(5, 7, "many", 2, 33, types, lengths, pointers);
+       }, 0x3F, 1, TRC_REC_DATA, std::vector<std::pair<int, std::string>>(32, {str, "z"}), "many           "},
       {"one byte more is never written", none,
        [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 43, big.data()); }, 0x3F, 0,
        0, {}, ""},
@@ -282,16 +281,7 @@ TEST(TraceWriter, WhatARecordHolds) {
     if (row.function != nullptr) { EXPECT_STREQ(row.function, trcFunctionName(r.component, r.function)); }
   }
 
-  // The common body takes 32 objects of 33.
-  Trace t;
-  int types[33];
-  uint32_t lengths[33];
-  const void* pointers[33];
-  for (int i = 0; i < 33; ++i) types[i] = TRC_OBJ_STRING, lengths[i] = 1, pointers[i] = "z";
-  trcDataN(5, 7, "many", 2, 33, types, lengths, pointers);
-  EXPECT_EQ(32u, t.read().records.at(0).objects.size());
 }
-
 
 TEST(TraceWriter, WrapKeepsTheNewestRecords) {
   Trace t;
@@ -481,51 +471,46 @@ TEST(TraceThreads, HashedSlotsOverflowAndLookups) {
   EXPECT_STREQ("first", t.b()->threadTable[10].threadName);
   EXPECT_STREQ("last", t.b()->threadOverflow[149].threadName);
 }
+
 // A process attaching to a block the trace command created: the server
 // (declared the traced application) or another one, such as the command
 // program, which must leave the server's hold on the block alone.
 TEST(TraceAttach, OnlyTheServerHoldsTheBlock) {
   struct Row {
     const char* what;
-    bool application;
-    std::function<void(trcBlockHeader*, const std::string&)> spoil;
+    bool application, held;  // attaching as the server; the server holds the block already
+    uint32_t status;         // put in the block first (0: left running)
+    const char* platform;
+    mode_t mode;       // given to the block first (0: left as made)
     const char* seen;  // trcAttach's answer, attached or not, the flag while attached
     uint16_t flagAfter;
-    bool kept;         // the block's name still exists afterwards
+    bool kept;  // the block's name still exists afterwards
   };
   auto shmPath = [](const std::string& dir) {
     HSVResID id;
     hsvIPCGetResID((dir + kKey + ".TRC").c_str(), HSV_MEMORY_RESID_OPTION, &id);
     return std::string("/dev/shm") + id.posixName();
   };
-  auto held = [](trcBlockHeader* b, const std::string&) { b->appAttached = TRC_APP_ATTACHED; };
-  auto heldStopped = [](trcBlockHeader* b, const std::string&) {
-    b->appAttached = TRC_APP_ATTACHED;
-    b->status = TRC_STATE_STOP;
-  };
+  const uint32_t stop = TRC_STATE_STOP;
   std::vector<Row> rows = {
-      {"the server", true, [](trcBlockHeader*, const std::string&) {}, "0 1 ffff", 0, true},
-      {"another process while the server holds it", false, held, "0 1 ffff", 0xFFFF, true},
-      {"another process finds it turned off, the server still holding it", false, heldStopped,
-       "0 0 ffff", 0xFFFF, true},
-      {"the server finds it turned off", true,
-       [](trcBlockHeader* b, const std::string&) { b->status = TRC_STATE_STOP; }, "0 0 0", 0,
-       false},
-      {"readable by others", true,
-       [&](trcBlockHeader*, const std::string& dir) { chmod(shmPath(dir).c_str(), 0644); },
-       "1000 0 0", 0, true},
-      {"another platform", true,
-       [](trcBlockHeader* b, const std::string&) { strcpy(b->platform, "Windows"); },
-       "1004 0 0", 0, true},
-      {"still being built", true,
-       [](trcBlockHeader* b, const std::string&) { b->status = TRC_STATE_STARTING; }, "0 0 0",
-       0, true},
+      {"the server", true, false, 0, "Linux", 0, "0 1 ffff", 0, true},
+      {"another process while the server holds it", false, true, 0, "Linux", 0, "0 1 ffff", 0xFFFF,
+       true},
+      {"another process finds it turned off, the server still holding it", false, true, stop,
+       "Linux", 0, "0 0 ffff", 0xFFFF, true},
+      {"the server finds it turned off", true, false, stop, "Linux", 0, "0 0 0", 0, false},
+      {"readable by others", true, false, 0, "Linux", 0644, "1000 0 0", 0, true},
+      {"another platform", true, false, 0, "Windows", 0, "1004 0 0", 0, true},
+      {"still being built", true, false, TRC_STATE_STARTING, "Linux", 0, "0 0 0", 0, true},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.what);
     Trace t;
     trcBlockHeader* shared = t.b();  // the child inherits this mapping
-    row.spoil(shared, t.dir.path());
+    if (row.held) shared->appAttached = TRC_APP_ATTACHED;
+    if (row.status != 0) shared->status = row.status;
+    if (row.mode != 0) chmod(shmPath(t.dir.path()).c_str(), row.mode);
+    strcpy(shared->platform, row.platform);
     klptest::Child c = klptest::inChild(t.dir.path(), [&] {
       trcInitAnchor();
       if (row.application) trcDeclareApplication();
@@ -543,9 +528,7 @@ TEST(TraceAttach, OnlyTheServerHoldsTheBlock) {
     strcpy(t.b()->platform, "Linux");
     Walk w = t.read();
     ASSERT_EQ(row.seen[2] == '1' ? 1u : 0u, w.records.size());
-    if (!w.records.empty()) {
-      EXPECT_NE(hsvProcessID(), w.records[0].pid);
-    }
+    if (!w.records.empty()) { EXPECT_NE(hsvProcessID(), w.records[0].pid); }
   }
 }
 
