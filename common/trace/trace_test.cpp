@@ -121,6 +121,7 @@ struct Image {
     h()->bufferSize = TRC_MIN_SIZE;
     h()->maxFileSize = TRC_MAX_SIZE;
     strcpy(h()->platform, "Linux");
+    strcpy(h()->structVersion, "0012");
   }
   Image& rec(uint32_t off, uint32_t length, uint16_t function = 1, uint16_t objects = 0,
              uint16_t objectLength = 0) {
@@ -211,7 +212,7 @@ TEST(TraceWriter, WhatARecordHolds) {
     const char* name;
     const char* function = nullptr;  // the symbol row the first record names
   };
-  const int str = TRC_OBJ_STRING;
+  const int str = TRC_OBJ_STRING, exitValue = TRC_REC_EXIT_VALUE;
   auto none = [](trcBlockHeader*) {};
   std::string big(kArea - 44, 'x');
   std::vector<Row> rows = {
@@ -229,15 +230,12 @@ TEST(TraceWriter, WhatARecordHolds) {
       {"component override of level 2: no entry record",
        [](trcBlockHeader* b) { b->componentFilters[5] = 0x8002; },
        [] { return trcEntry(5, 7); }, 2, 0, 0, {}, ""},
-      {"exit with a return code", none,
-       [] { trcExit(5, 7, TRC_RET_RC, 12); return 1u; }, 1, 1, TRC_REC_EXIT_VALUE,
-       {{TRC_OBJ_RC, std::string("\14\0", 2)}}, nullptr},
-      {"exit with a boolean", none,
-       [] { trcExit(5, 7, TRC_RET_BOOL, 0, 1); return 1u; }, 1, 1, TRC_REC_EXIT_VALUE,
-       {{TRC_OBJ_BOOL, std::string("\1\0\0\0", 4)}}, nullptr},
-      {"exit with a pointer", none,
-       [] { trcExit(5, 7, TRC_RET_PTR, 0, 0, 0x0102); return 1u; }, 1, 1, TRC_REC_EXIT_VALUE,
-       {{TRC_OBJ_POINTER, std::string("\2\1\0\0\0\0\0\0", 8)}}, nullptr},
+      {"exit with a return code", none, [] { trcExit(5, 7, TRC_RET_RC, 12); return 1u; }, 1, 1,
+       exitValue, {{TRC_OBJ_RC, std::string("\14\0", 2)}}, nullptr},
+      {"exit with a boolean", none, [] { trcExit(5, 7, TRC_RET_BOOL, 0, 1); return 1u; }, 1, 1,
+       exitValue, {{TRC_OBJ_BOOL, std::string("\1\0\0\0", 4)}}, nullptr},
+      {"exit with a pointer", none, [] { trcExit(5, 7, TRC_RET_PTR, 0, 0, 0x0102); return 1u; }, 1,
+       1, exitValue, {{TRC_OBJ_POINTER, std::string("\2\1\0\0\0\0\0\0", 8)}}, nullptr},
       {"exit of another kind has no object", none,
        [] { trcExit(5, 7, 9, 12); return 1u; }, 1, 1, TRC_REC_EXIT, {}, nullptr},
       {"a damaged area is started afresh, not stepped through forever",
@@ -372,12 +370,10 @@ TEST(TraceFile, FlushFaults) {
     const char* file = "f.trc";
   };
   auto header = [](const char* platform, uint32_t dataOffset) {
-    std::string h(TRC_HEADER_SIZE, '\0');
-    auto* b = reinterpret_cast<trcBlockHeader*>(h.data());
-    strcpy(b->platform, platform);
-    strcpy(b->structVersion, "0012");
-    b->dataOffset = dataOffset;
-    return h;
+    Image i(0, 0, 0, 0);
+    strcpy(i.h()->platform, platform);
+    i.h()->dataOffset = dataOffset;
+    return i.bytes.substr(0, TRC_HEADER_SIZE);
   };
   std::vector<Row> rows = {
       {"a header cut short is written afresh", "short", 3, 0, true, 3, ""},
@@ -458,14 +454,9 @@ TEST(TraceThreads, HashedSlotsOverflowAndLookups) {
   for (uint32_t k = 2; k <= 151; ++k) set(0x1234 + 150 * k, "more");
   set(0x1234 + 150 * 152, "last");
   for (const auto& [id, name] : std::vector<std::pair<uint32_t, const char*>>{
-           {0x1234, "first"},
-           {0x1234 + 150, "collides"},
-           {0x1234 + 150 * 149, "more"},
-           {0x1234 + 150 * 150, "UNKNOWN THREAD2"},
-           {0x1234 + 150 * 151, "UNKNOWN THREAD2"},
-           {0x1234 + 150 * 152, "last"},
-           {11, "UNKNOWN THREAD1"},
-           {0xFFFFFFFF, "UNKNOWN THREAD1"}})
+           {0x1234, "first"}, {0x1234 + 150, "collides"}, {0x1234 + 150 * 149, "more"},
+           {0x1234 + 150 * 150, "UNKNOWN THREAD2"}, {0x1234 + 150 * 151, "UNKNOWN THREAD2"},
+           {0x1234 + 150 * 152, "last"}, {11, "UNKNOWN THREAD1"}, {0xFFFFFFFF, "UNKNOWN THREAD1"}})
     EXPECT_STREQ(name, trcGetThreadData(id)->threadName) << id;
   EXPECT_STREQ("tid = 0x34120000", trcGetThreadData(0x1234)->threadIdText);
   EXPECT_STREQ("first", t.b()->threadTable[10].threadName);
