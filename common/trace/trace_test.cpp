@@ -292,17 +292,16 @@ TEST(TraceWriter, WrapKeepsTheNewestRecords) {
 }
 
 TEST(TraceWriter, DirectToFileLosesNothingUntilItsLimit) {
+  // Each wrap appends a lap of 746 records (35808 bytes): three fit 131072;
+  // the last lap (at turning off) does not fit the 23648 bytes left.
   struct Row {
     uint32_t fileSize;
     int written, kept;
     bool said;  // the file was reported full (once)
   };
-  // Each wrap appends a lap of 746 records (35808 bytes): three fit 131072;
-  // the last lap (at turning off) does not fit the 23648 bytes left.
-  for (const Row& row : std::vector<Row>{
-           {TRC_MAX_SIZE, 5000, 5000, false},
-           {TRC_MIN_SIZE, 4230, 2238, true},
-           {TRC_MIN_SIZE, 3830, 2238, true}}) {
+  for (const Row& row : std::vector<Row>{{TRC_MAX_SIZE, 5000, 5000, false},
+                                         {TRC_MIN_SIZE, 4230, 2238, true},
+                                         {TRC_MIN_SIZE, 3830, 2238, true}}) {
     SCOPED_TRACE(row.written);
     klptest::TmpDir files;
     std::string path = files.path() + "direct.trc";

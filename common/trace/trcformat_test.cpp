@@ -8,6 +8,7 @@
 #include <cstring>
 #include <ctime>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "common/trace/trace.h"
@@ -93,11 +94,7 @@ class Image {
   Bytes bytes_;
 };
 
-Bytes name16(const std::string& n) {
-  Bytes b = n;
-  b.resize(15, ' ');
-  return b + Bytes(1, '\0');
-}
+Bytes name16(const std::string& n) { return n + Bytes(15 - n.size(), ' ') + Bytes(1, '\0'); }
 
 // Two threads of process 7: 0x11 named "worker one", 0x22 not named.
 Image twoThreads() {
@@ -149,10 +146,7 @@ Parsed parse(std::vector<std::string> args) {
 
 class Formatter : public ::testing::Test {
  protected:
-  void SetUp() override {
-    setenv("TZ", "UTC", 1);
-    tzset();
-  }
+  void SetUp() override { setenv("TZ", "UTC", 1), tzset(); }
 };
 
 }  // namespace
@@ -247,17 +241,13 @@ TEST(TraceOptions, ValuesAndLevels) {
   EXPECT_EQ(p.o.logLevel, 0x7FFF);
   EXPECT_FALSE(p.o.levelGiven);
 
-  struct Level {
-    const char* list;
-    uint16_t mask;
-    const char* text;
-  } levels[] = {{"1,3", 5, "1,3"}, {"7", 0, "0"}, {"", 0, "0"}, {"2,4x6", 10, "2,4"},
-                {"654321", 63, "1,2,3,4,5,6"}};
-  for (const Level& l : levels) {
-    EXPECT_EQ(trcParseLevels(l.list), l.mask) << l.list;
+  for (auto [list, mask, said] : std::vector<std::tuple<const char*, uint16_t, const char*>>{
+           {"1,3", 5, "1,3"}, {"7", 0, "0"}, {"", 0, "0"}, {"2,4x6", 10, "2,4"},
+           {"654321", 63, "1,2,3,4,5,6"}}) {  // level list, mask, mask as text
+    EXPECT_EQ(trcParseLevels(list), mask) << list;
     char text[16];
-    trcLevelText(l.mask, text);
-    EXPECT_STREQ(text, l.text);
+    trcLevelText(mask, text);
+    EXPECT_STREQ(text, said);
   }
 }
 
