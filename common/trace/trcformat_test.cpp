@@ -14,6 +14,7 @@
 #include "common/trace/trace.h"
 #include "common/trace/trace_anchor.h"
 #include "common/trace/trcformat.h"
+#include "common/trace/trcjson.h"
 #include "common/trace/trcobjfmt.h"
 #include "common/trace/trcopts.h"
 #include "tests/testing/klptest.h"
@@ -109,7 +110,7 @@ Image twoThreads() {
   return im;
 }
 
-enum Style { FLW, FMT, V7 };
+enum Style { FLW, FMT, V7, JSON };
 std::string format(Image& im, Style style, uint16_t level = 0x7FFF,
                    std::vector<trcFilter> filters = {}) {
   trcBlockHeader* h = im.header();
@@ -120,6 +121,7 @@ std::string format(Image& im, Style style, uint16_t level = 0x7FFF,
     if (style == FLW) trcFormatFlow(stdout, im.image());
     if (style == FMT) trcFormatFull(stdout, im.image(), false);
     if (style == V7) trcFormatV7(stdout, im.image());
+    if (style == JSON) trcFormatJson(stdout, im.image());
   });
 }
 
@@ -182,7 +184,7 @@ TEST_F(Formatter, StatementAndDescriptorListingsStopWhenFull) {
   EXPECT_EQ(cols.substr(cols.size() - 24), "         ...buffer full\n");
 }
 
-// The three styles of two threads; then what filters let through: level 2
+// The three styles and json of two threads; then what filters let through: level 2
 // alone, a function override turning level 1 back on, and exits whose
 // entries were overwritten (the flow indents from the smallest depth).
 TEST_F(Formatter, StylesAndFilters) {
@@ -192,8 +194,9 @@ TEST_F(Formatter, StylesAndFilters) {
   wrapped.add(1, 11, 4, 0x11, 1, timeValue(2, 3));
   wrapped.add(3, 11, 4, 0x11, 8, name16("timed"), {{19, timeValue(2, 4)}});  // level 4 shows its time
   std::string name = "CMDSHANDLEMESSAGE", got = format(im, FMT);
-  for (const std::string& part : {format(im, FLW), format(im, V7), format(im, FLW, 2),
-                                  format(im, FLW, 2, {{name.c_str(), 1}}), format(wrapped, FLW)})
+  for (const std::string& part : {format(im, FLW), format(im, V7), format(im, JSON),
+                                  format(im, FLW, 2), format(im, FLW, 2, {{name.c_str(), 1}}),
+                                  format(wrapped, FLW)})
     got += "--\n" + part;  // a braced list is formatted in order
   expectGolden("trcformat_styles", got);
 }
