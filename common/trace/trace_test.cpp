@@ -38,17 +38,13 @@ struct Rec {
   int32_t pid;
   std::string name;
   std::vector<std::pair<int, std::string>> objects;  // type, data bytes
-  int value() const {
-    int v = 0;
-    memcpy(&v, objects.at(0).second.data(), sizeof v);
-    return v;
-  }
+  int value() const { int v; memcpy(&v, objects.at(0).second.data(), sizeof v); return v; }
 };
 
 struct Walk {
   std::vector<Rec> records;
   int error = -1;
-  std::string said;
+  std::string said;  // what the reader printed
 };
 
 Walk walk(const trcBlockHeader* h, size_t size, bool fromFile) {
@@ -592,9 +588,8 @@ TEST(TraceCommand, InsideTheServerOrShortOfMemory) {
         trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr);
       }
       if (row.short_) leaveOnly(8 << 20);
-      std::vector<std::string> args = row.args;
-      args.insert(args.begin(), "klptrc");
-      args.insert(args.end(), {"-db", "TDB", "-kcap"});
+      std::vector<std::string> args = {"klptrc", "-db", "TDB", "-kcap"};
+      args.insert(args.begin() + 1, row.args.begin(), row.args.end());
       std::vector<char*> argv;
       for (std::string& a : args) argv.push_back(a.data());
       return _klpTrace(static_cast<int>(argv.size()), argv.data());

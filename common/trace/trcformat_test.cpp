@@ -29,11 +29,7 @@ std::string object(unsigned type, const Bytes& data, bool hex = false) {
                     reinterpret_cast<const uint8_t*>(data.data()), hex);
   });
 }
-Bytes times(const Bytes& b, int n) {
-  Bytes all;
-  while (n-- > 0) all += b;
-  return all;
-}
+Bytes times(const Bytes& b, int n) { Bytes all; while (n-- > 0) all += b; return all; }
 
 Bytes le16(uint16_t v) { return Bytes(reinterpret_cast<const char*>(&v), 2); }
 Bytes le32(uint32_t v) { return Bytes(reinterpret_cast<const char*>(&v), 4); }

@@ -19,9 +19,7 @@ namespace {
 
 constexpr int kStatus = 15, kStop = 14;
 
-bool has(const std::string& text, const std::string& what) {
-  return text.find(what) != std::string::npos;
-}
+bool has(const std::string& text, const std::string& what) { return text.find(what) != std::string::npos; }
 
 class Klptrc : public ::testing::Test {
  protected:
@@ -29,9 +27,7 @@ class Klptrc : public ::testing::Test {
   const std::string srv = "TR1", block = dir.path() + "TR1.KLP.KCAP.TRC";
 
   // A trace a failed test left on is killed: no block or keeper outlives it.
-  ~Klptrc() override {
-    if (klptest::memoryExists(block)) trc({"kill"});
-  }
+  ~Klptrc() override { if (klptest::memoryExists(block)) trc({"kill"}); }
   // klptrc with args, then the keys of the test's server unless bare.
   klptest::ProcessResult trc(std::vector<std::string> args, bool bare = false) {
     args.insert(args.begin(), klptest::binPath("klptrc"));
