@@ -188,11 +188,12 @@ TEST_F(Formatter, StylesAndFilters) {
   wrapped.add(2, 11, 3, 0x11, 1, timeValue(2, 1));
   wrapped.add(2, 11, 2, 0x11, 1, timeValue(2, 2));
   wrapped.add(1, 11, 4, 0x11, 1, timeValue(2, 3));
-  wrapped.add(3, 11, 4, 0x11, 8, name16("timed"), {{19, timeValue(2, 4)}});  // level 4 shows its time
+  // Level 4 shows its time; json keeps UTF-8 and takes other bytes as Latin-1.
+  wrapped.add(3, 11, 4, 0x11, 8, name16("timed"), {{19, timeValue(2, 4)}, {3, Bytes("\xc3\xa9\xe9", 4)}});
   std::string name = "CMDSHANDLEMESSAGE", got = format(im, FMT);
   for (const std::string& part : {format(im, FLW), format(im, V7), format(im, JSON),
                                   format(im, FLW, 2), format(im, FLW, 2, {{name.c_str(), 1}}),
-                                  format(wrapped, FLW)})
+                                  format(wrapped, FLW), format(wrapped, JSON)})
     got += "--\n" + part;  // a braced list is formatted in order
   expectGolden("trcformat_styles", got);
 }
