@@ -1,6 +1,6 @@
-// The formatter against trace images built here byte by byte: every object
-// formatter (damaged objects first), the three styles and their filters,
-// and fields that fill their whole width.
+// The formatter over images built here byte by byte: every object formatter
+// (damaged first), the three styles and their filters, full-width fields;
+// then the trace command's argument parser.
 #include <gtest/gtest.h>
 
 #include <cstdio>
@@ -8,43 +8,28 @@
 #include <cstring>
 #include <ctime>
 #include <string>
+#include <tuple>
 #include <vector>
 
+#include "common/trace/trace.h"
 #include "common/trace/trace_anchor.h"
 #include "common/trace/trcformat.h"
+#include "common/trace/trcjson.h"
 #include "common/trace/trcobjfmt.h"
 #include "common/trace/trcopts.h"
+#include "tests/testing/klptest.h"
 
 namespace {
 
 using Bytes = std::string;
 
-// Text written to a stream while the object lives.
-class Captured {
- public:
-  Captured() : file_(open_memstream(&buf_, &size_)) {}
-  ~Captured() {
-    fclose(file_);
-    free(buf_);
-  }
-  FILE* file() { return file_; }
-  std::string text() {
-    fflush(file_);
-    return std::string(buf_, size_);
-  }
-
- private:
-  char* buf_ = nullptr;
-  size_t size_ = 0;
-  FILE* file_;
-};
-
 std::string object(unsigned type, const Bytes& data, bool hex = false) {
-  Captured c;
-  trcFormatObject(c.file(), type, static_cast<uint32_t>(data.size()),
-                  reinterpret_cast<const uint8_t*>(data.data()), hex);
-  return c.text();
+  return klptest::stdoutOf([&] {
+    trcFormatObject(stdout, type, static_cast<uint32_t>(data.size()),
+                    reinterpret_cast<const uint8_t*>(data.data()), hex);
+  });
 }
+Bytes times(const Bytes& b, int n) { Bytes all; while (n-- > 0) all += b; return all; }
 
 Bytes le16(uint16_t v) { return Bytes(reinterpret_cast<const char*>(&v), 2); }
 Bytes le32(uint32_t v) { return Bytes(reinterpret_cast<const char*>(&v), 4); }
@@ -106,11 +91,7 @@ class Image {
   Bytes bytes_;
 };
 
-Bytes name16(const std::string& n) {
-  Bytes b = n;
-  b.resize(15, ' ');
-  return b + Bytes(1, '\0');
-}
+Bytes name16(const std::string& n) { return n + Bytes(15 - n.size(), ' ') + Bytes(1, '\0'); }
 
 // Two threads of process 7: 0x11 named "worker one", 0x22 not named.
 Image twoThreads() {
@@ -125,165 +106,96 @@ Image twoThreads() {
   return im;
 }
 
-enum Style { FLW, FMT, V7 };
+enum Style { FLW, FMT, V7, JSON };
 std::string format(Image& im, Style style, uint16_t level = 0x7FFF,
                    std::vector<trcFilter> filters = {}) {
   trcBlockHeader* h = im.header();
   h->globalFilter = level;
   trcApplyFilters(h, filters.data(), static_cast<int>(filters.size()));
   trcLoadThreadTables(h);
-  Captured c;
-  if (style == FLW) trcFormatFlow(c.file(), im.image());
-  if (style == FMT) trcFormatFull(c.file(), im.image(), false);
-  if (style == V7) trcFormatV7(c.file(), im.image());
-  return c.text();
+  return klptest::stdoutOf([&] {
+    if (style == FLW) trcFormatFlow(stdout, im.image());
+    if (style == FMT) trcFormatFull(stdout, im.image(), false);
+    if (style == V7) trcFormatV7(stdout, im.image());
+    if (style == JSON) trcFormatJson(stdout, im.image());
+  });
+}
+
+void expectGolden(const std::string& name, const std::string& got) {
+  EXPECT_EQ(got, klptest::readFile(KLP_SOURCE_DIR "/common/trace/" + name + ".golden"));
+}
+
+struct Parsed {
+  std::vector<std::string> args;  // the options point into them
+  trcOptions o;
+  std::string said;
+};
+
+Parsed parse(std::vector<std::string> args) {
+  Parsed p;
+  p.args = args;
+  p.args.insert(p.args.begin(), "klptrc");
+  std::vector<char*> argv;
+  for (std::string& a : p.args) argv.push_back(a.data());
+  p.said = klptest::stdoutOf([&] { trcParseArgs(static_cast<int>(argv.size()), argv.data(), &p.o); });
+  trcFreeOptions(&p.o);  // filters are looked at through the block only
+  return p;
 }
 
 class Formatter : public ::testing::Test {
  protected:
-  void SetUp() override {
-    setenv("TZ", "UTC", 1);
-    tzset();
-  }
+  void SetUp() override { setenv("TZ", "UTC", 1), tzset(); }
 };
 
 }  // namespace
 
+// Damaged objects first (a note and the bytes), then whole ones; last -hex,
+// which dumps every object, strings included.
 TEST_F(Formatter, ObjectsDamagedOrWhole) {
-  const std::string in = "\n         ";
-  struct Case {
-    unsigned type;
-    Bytes data;
-    std::string expected;
-  } cases[] = {
-      // Too short for what the type reads: a note and the bytes.
-      {1, Bytes("\x01\x02\x03", 3),
-       "(damaged: 3 bytes are too few for its type) (hex dump)" + in +
-           "010203                               |...             |\n"},
-      {19, le64(5), "(damaged: 8 bytes are too few for its type) (hex dump)" + in +
-                        "05000000 00000000                    |........        |\n"},
-      {18, Bytes(9, '\1'), "(damaged: 9 bytes are too few for its type) (hex dump)" + in +
-                               "01010101 01010101 01                 |.........       |\n"},
-      {15, Bytes(1, '\3'), "(damaged: 1 bytes are too few for its type) (hex dump)" + in +
-                               "03                                   |.               |\n"},
-      {5, sqlda(3, column(452, 10, "A", 1)),
-       "(damaged: SQLDA of 3 columns needs 184 bytes, it holds 72) (hex dump)"},
-      {5, sqlda(1, column(452, 10, "A", 31)),
-       "(damaged: SQLDA column 1 has a name of 31 bytes, at most 30 fit) (hex dump)"},
-      {19, timeValue(INT64_MAX, 0), in + "9223372036854775807 seconds 0 microseconds (no calendar time)\n"},
-      // Whole objects.
-      {1, Bytes("\xff", 1), in + "255\n"},
-      {1, le16(0xFFFE), in + "-2\n"},
-      {21, le32(16) + "\xaa", in + "16\n"},
-      {13, le16(0xFFFE), in + "65534\n"},
-      {16, le32(0xFFFFFFFF), in + "-1\n"},
-      {3, Bytes("a\nb", 4), in + "\"a" + in + "b\"\n"},
-      {2, "xyz", in + "\"xyz\"\n"},
-      {17, Bytes(4, '\0'), in + "FALSE\n"},
-      {17, Bytes("\0\1", 2), in + "TRUE\n"},
-      {18, le64(0x1234), in + "0x0000000000001234\n"},
-      {15, le16(3), in + "NULL pointer for object of type \"String\"\n"},
-      {15, le16(99), in + "NULL pointer for object of type \"UNKNOWN\"\n"},
-      {22, Bytes("\3", 1), in + "\"3\" equals KLPXQ_TODO_LOADDONE\n"},
-      {22, le32(9), in + "\"9\" equals KLPXQ_TODO_UNKNOWN\n"},
-      {19, timeValue(0, 5), in + "1970-01-01 00:00:00.000005\n"},
-      {4, Bytes(12, '\0') + le32(static_cast<uint32_t>(-204)),
-       "(hex dump)" + in + "00000000 00000000 00000000 34ffffff  |............4...|\n" + in +
-           "sqlcode: -204\n"},
-      {5, sqlda(2, column(485, 0x0207, "AMOUNT", 6) + column(452, 10, "NAME", 4)),
-       in + "SQLDA: numCols= 2\n                type  length  colname\n"
-            "                ----  ------  -------\n"
-            "                485   7 ,2    AMOUNT\n                452   10      NAME\n"},
-      {6, "", "\n"},
-      {6, "SELECT A FROM T", in + "SELECT A FROM T\n"},
-      {6, std::string(75, 'X') + " B", in + std::string(75, 'X') + " " + in + "B\n"},
-      {0, Bytes("AB\0\xff" "C", 5), "(hex dump)" + in + "414200ff 43                          |AB..C           |\n"},
-      {0, "", "(hex dump)\n"},
-      {30, "A", "(hex dump)" + in + "41                                   |A               |\n"},
-  };
-  for (const Case& c : cases) {
-    std::string got = object(c.type, c.data);
-    EXPECT_EQ(got.substr(0, c.expected.size()), c.expected) << "type " << c.type;
-  }
-  // -hex dumps every object, strings included.
-  EXPECT_EQ(object(3, "hi", true),
-            "(hex dump)" + in + "6869                                 |hi              |\n");
+  const std::pair<unsigned, Bytes> cases[] = {
+      {1, Bytes("\x01\x02\x03", 3)}, {19, le64(5)}, {18, Bytes(9, '\1')}, {15, Bytes(1, '\3')},
+      {5, sqlda(3, column(452, 10, "A", 1))}, {5, sqlda(1, column(452, 10, "A", 31))},
+      {19, timeValue(INT64_MAX, 0)}, {1, Bytes("\xff", 1)}, {1, le16(0xFFFE)},
+      {21, le32(16) + "\xaa"}, {13, le16(0xFFFE)}, {16, le32(0xFFFFFFFF)}, {3, Bytes("a\nb", 4)},
+      {2, "xyz"}, {17, Bytes(4, '\0')}, {17, Bytes("\0\1", 2)}, {18, le64(0x1234)},
+      {15, le16(3)}, {15, le16(99)}, {22, Bytes("\3", 1)}, {22, le32(9)}, {19, timeValue(0, 5)},
+      {4, Bytes(12, '\0') + le32(static_cast<uint32_t>(-204))},
+      {5, sqlda(2, column(485, 0x0207, "AMOUNT", 6) + column(452, 10, "NAME", 4))},
+      {6, ""}, {6, "SELECT A FROM T"}, {6, std::string(75, 'X') + " B"},
+      {0, Bytes("AB\0\xff" "C", 5)}, {0, ""}, {30, "A"}};
+  std::string got;
+  for (const auto& [type, data] : cases) got += std::to_string(type) + ": " + object(type, data);
+  expectGolden("trcformat_objects", got + "hex 3: " + object(3, "hi", true));
 }
 
 TEST_F(Formatter, StatementAndDescriptorListingsStopWhenFull) {
   const std::string in = "\n         ";
-  Bytes tokens;
-  for (int i = 0; i < 8; ++i) tokens += "AAAAAAAAA ";
-  tokens.pop_back();
-  std::string six;
-  for (int i = 0; i < 6; ++i) six += "AAAAAAAAA ";
-  EXPECT_EQ(object(6, tokens), in + six + in + "AAAAAAAAA AAAAAAAAA\n");
-
-  std::string many;
-  for (int i = 0; i < 500; ++i) many += "AAAAAAAAAA ";  // lines of 76 characters
-  std::string listed = object(6, many);
+  EXPECT_EQ(object(6, times("AAAAAAAAA ", 7) + "AAAAAAAAA"),
+            in + times("AAAAAAAAA ", 6) + in + "AAAAAAAAA AAAAAAAAA\n");
+  std::string listed = object(6, times("AAAAAAAAAA ", 500));  // lines of 76 characters
   EXPECT_LT(listed.size(), 4000u);
   EXPECT_EQ(listed.substr(listed.size() - 15), "...buffer full\n");
-
-  Bytes columns;
-  for (int i = 0; i < 400; ++i) columns += column(452, 10, std::string(30, 'N'), 30);
-  std::string cols = object(5, sqlda(400, columns));
+  std::string cols = object(5, sqlda(400, times(column(452, 10, std::string(30, 'N'), 30), 400)));
   EXPECT_LT(cols.size(), 20000u);
   EXPECT_EQ(cols.substr(cols.size() - 24), "         ...buffer full\n");
 }
 
-TEST_F(Formatter, ThreeStylesOfTwoThreads) {
-  Image im = twoThreads();
-  EXPECT_EQ(format(im, FMT),
-            "1        pid = 7, tid = 0x11000000 thr = worker one\n"
-            "         OrdList::putHead fnc_entry at time 1.000001\n\n"
-            "2        pid = 7, tid = 0x11000000 thr = worker one\n"
-            "         OrdList::putHead fnc_data \"first data     \" lvl 2\n"
-            "         Object 1 of type \"String\": \n         \"hello\"\n\n"
-            "3        pid = 7, tid = 0x22000000 thr = UNKNOWN THREAD1\n"
-            "         cmdsHandleMessage fnc_entry at time 1.000003\n\n"
-            "4        pid = 7, tid = 0x11000000 thr = worker one\n"
-            "         OrdList::putHead fnc_exit  at time 1.000004 with return code 5\n\n"
-            "5        pid = 7, tid = 0x22000000 thr = UNKNOWN THREAD1\n"
-            "         cmdsHandleMessage fnc_exit  at time 1.000005 \n\n"
-            "6        pid = 7, tid = 0x22000000 thr = UNKNOWN THREAD1\n"
-            "         UNKNOWN FUNCTION fnc_data \"x              \" lvl 3\n"
-            "         Object 1 of type \"Signed Integer\": \n         42\n\n");
-  EXPECT_EQ(format(im, FLW),
-            "pid = 7, tid = 0x11000000 thr = worker one\n"
-            "1        OrdList::putHead fnc_entry at time 1.000001\n"
-            "2        | OrdList::putHead fnc_data \"first data     \" lvl 2\n"
-            "4        OrdList::putHead fnc_exit  at time 1.000004 with return code 5\n\n"
-            "pid = 7, tid = 0x22000000 thr = UNKNOWN THREAD1\n"
-            "3        cmdsHandleMessage fnc_entry at time 1.000003\n"
-            "5        cmdsHandleMessage fnc_exit  at time 1.000005 \n"
-            "6        UNKNOWN FUNCTION fnc_data \"x              \" lvl 3\n\n");
-  EXPECT_EQ(format(im, V7), " hello\nx              \n");
-}
-
-TEST_F(Formatter, FiltersSelectRecords) {
-  Image im = twoThreads();
-  // Level 2 only: data of level 2; entries and exits need level 1.
-  EXPECT_EQ(format(im, FLW, 2),
-            "pid = 7, tid = 0x11000000 thr = worker one\n"
-            "2        OrdList::putHead fnc_data \"first data     \" lvl 2\n\n");
-  // A function override turns level 1 back on for that function alone.
-  std::string name = "CMDSHANDLEMESSAGE";
-  std::string flow = format(im, FLW, 2, {{name.c_str(), 1}});
-  EXPECT_NE(flow.find("3        cmdsHandleMessage fnc_entry"), std::string::npos) << flow;
-  EXPECT_EQ(flow.find("1        OrdList::putHead fnc_entry"), std::string::npos) << flow;
-
-  // Exits whose entries were overwritten: the flow indents from the
-  // smallest depth, so the first line has no indentation.
-  Image wrapped;
+// The three styles and json of two threads; then what filters let through: level 2
+// alone, a function override turning level 1 back on, and exits whose
+// entries were overwritten (the flow indents from the smallest depth).
+TEST_F(Formatter, StylesAndFilters) {
+  Image im = twoThreads(), wrapped;
   wrapped.add(2, 11, 3, 0x11, 1, timeValue(2, 1));
   wrapped.add(2, 11, 2, 0x11, 1, timeValue(2, 2));
   wrapped.add(1, 11, 4, 0x11, 1, timeValue(2, 3));
-  EXPECT_EQ(format(wrapped, FLW),
-            "pid = 7, tid = 0x11000000 thr = UNKNOWN THREAD1\n"
-            "1        | OrdList::putTail fnc_exit  at time 2.000001\n"
-            "2        OrdList::putHead fnc_exit  at time 2.000002\n"
-            "3        OrdList::getHead fnc_entry at time 2.000003\n\n");
+  // Level 4 shows its time; json keeps UTF-8 and takes other bytes as Latin-1.
+  wrapped.add(3, 11, 4, 0x11, 8, name16("timed"), {{19, timeValue(2, 4)}, {3, Bytes("\xc3\xa9\xe9", 4)}});
+  std::string name = "CMDSHANDLEMESSAGE", got = format(im, FMT);
+  for (const std::string& part : {format(im, FLW), format(im, V7), format(im, JSON),
+                                  format(im, FLW, 2), format(im, FLW, 2, {{name.c_str(), 1}}),
+                                  format(wrapped, FLW), format(wrapped, JSON)})
+    got += "--\n" + part;  // a braced list is formatted in order
+  expectGolden("trcformat_styles", got);
 }
 
 TEST_F(Formatter, FullWidthFieldsStayWithinTheirFields) {
@@ -295,15 +207,61 @@ TEST_F(Formatter, FullWidthFieldsStayWithinTheirFields) {
   memset(h->threadTable[0x11].data, 'D', sizeof h->threadTable[0x11].data);
   memset(h->threadTable[0x11].threadIdText, 'T', sizeof h->threadTable[0x11].threadIdText);
   im.add(1, 11, 2, 0x11, 1, timeValue(1, 1));
-  Captured c;
-  trcFormatStyles(c.file(), im.image(), false, true, false, false);
-  std::string text = c.text();
-  for (const std::string& line :
-       {"  Unique Name:       " + std::string(161, 'U') + "\n  Arch Level:",
-        "  Job Name(Orl):     " + std::string(9, 'J') + "\n  Program",
-        std::string(64, 'T') + ", THREAD NAME:" + std::string(64, 'N') + "\nDATA:" +
-            std::string(80, 'D') + "\n-----------",
-        "thr = " + std::string(64, 'N') + "\n",
-        std::string("Application attached at: Thu Jan 01 1970 00:00:00 UTC\n")})
-    EXPECT_NE(text.find(line), std::string::npos) << line.substr(0, 30) << "\n" << text;
+  expectGolden("trcformat_fullwidth", klptest::stdoutOf([&] {
+                 trcFormatStyles(stdout, im.image(), false, true, false, false);
+               }));
+}
+
+TEST(TraceOptions, ComplaintsEndParsingOrGoOn) {
+  std::string said;
+  for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
+           {"-ofn"}, {"dmp"}, {"-fn"}, {"-fs"}, {"-b"}, {"-d"}, {"-o"}, {"-SUBsystem"},
+           {"-qualifier"}, {"-df"}, {"-df", "main"}, {"onx", "-b", "64K", "-fs", "4G"}}) {
+    Parsed p = parse(args);
+    EXPECT_TRUE(p.o.error) << args[0];
+    said += "$";
+    for (const std::string& a : args) said += " " + a;
+    said += "\n" + p.said;
+  }
+  expectGolden("trcopts_complaints", said);
+}
+
+TEST(TraceOptions, ValuesAndLevels) {
+  Parsed p = parse({"ON", "Fmt", "-Db", "sample", "-kcap", "-b", "3m", "-fs", "3000000000", "-o",
+                    "1,3", "-schema", "qa", "dmp", "/tmp/x"});
+  EXPECT_FALSE(p.o.error) << p.said;
+  EXPECT_EQ(p.said, "File size adjusted to 2147483647\n");
+  EXPECT_TRUE(p.o.on && p.o.fmt && p.o.dmp);
+  EXPECT_EQ(std::string(p.o.dbName), "sample");
+  EXPECT_EQ(std::string(p.o.kind), "KCAP");
+  EXPECT_EQ(std::string(p.o.schema), "qa");
+  EXPECT_EQ(std::string(p.o.fileName), "/tmp/x");
+  EXPECT_EQ(p.o.bufferSize, 3145728u);
+  EXPECT_EQ(p.o.outLevel, 5);
+  EXPECT_EQ(p.o.logLevel, 0x7FFF);
+  EXPECT_FALSE(p.o.levelGiven);
+
+  for (auto [list, mask, said] : std::vector<std::tuple<const char*, uint16_t, const char*>>{
+           {"1,3", 5, "1,3"}, {"7", 0, "0"}, {"", 0, "0"}, {"2,4x6", 10, "2,4"},
+           {"654321", 63, "1,2,3,4,5,6"}}) {  // level list, mask, mask as text
+    EXPECT_EQ(trcParseLevels(list), mask) << list;
+    char text[16];
+    trcLevelText(mask, text);
+    EXPECT_STREQ(text, said);
+  }
+}
+
+TEST(TraceOptions, FiltersSetOverrideWords) {
+  static trcBlockHeader h;
+  const trcFilter filters[] = {{"capture/apply common function", 1},
+                               {"OrdList::putHead", 2},
+                               {"ORDLIST::PUTHEAD", 6}};  // the later one wins
+  trcApplyFilters(&h, filters, 3);
+  EXPECT_EQ(h.componentFilters[11], 0x8001);
+  EXPECT_EQ(h.functionFilters[11][2], 0x8006);
+  int overrides = 0;
+  for (auto& row : h.functionFilters)
+    for (uint16_t w : row) overrides += (w & 0x8000) != 0;
+  for (uint16_t w : h.componentFilters) overrides += (w & 0x8000) != 0;
+  EXPECT_EQ(overrides, 2);
 }

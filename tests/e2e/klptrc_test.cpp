@@ -1,9 +1,10 @@
-// The trace utility against real processes: refusals first, then the sample
-// server traced from its start and from the middle of its run, a lock left
-// by a holder that died, and the exported entry point.
+// The trace utility against real processes: refusals, the sample server
+// traced from its start and from the middle of its run, a lock left by a
+// holder that died, and the exported entry point.
 #include <dirent.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <fstream>
@@ -14,157 +15,116 @@
 #include "common/trace/trace_anchor.h"
 #include "tests/e2e/e2e_support.h"
 
-using e2e::RawClient;
-using e2e::Reply;
-using e2e::Server;
-
 namespace {
 
-constexpr int kStatus = 15;
+constexpr int kStatus = 15, kStop = 14;
 
-klptest::ProcessResult trc(std::vector<std::string> args) {
-  args.insert(args.begin(), klptest::binPath("klptrc"));
-  return klptest::run(args, {}, 30000);
-}
+bool has(const std::string& text, const std::string& what) { return text.find(what) != std::string::npos; }
 
-std::vector<std::string> keys(const std::string& server) {
-  return {"-db", server, "-kcap"};
-}
-std::vector<std::string> operator+(std::vector<std::string> a, const std::vector<std::string>& b) {
-  a.insert(a.end(), b.begin(), b.end());
-  return a;
-}
+class Klptrc : public ::testing::Test {
+ protected:
+  klptest::TmpDir dir;
+  const std::string srv = "TR1", block = dir.path() + "TR1.KLP.KCAP.TRC";
 
-bool has(const std::string& text, const std::string& what) {
-  return text.find(what) != std::string::npos;
-}
-
-// A keeper process holding a block of this directory.
-bool keeperRunning(const klptest::TmpDir& dir) {
-  DIR* d = opendir("/proc");
-  bool found = false;
-  while (dirent* e = d != nullptr ? readdir(d) : nullptr) {
-    std::string cmd = klptest::readFile(std::string("/proc/") + e->d_name + "/cmdline");
-    for (char& c : cmd)
-      if (c == '\0') c = ' ';
-    if (has(cmd, "klptrcbp") && has(cmd, dir.path())) found = true;
+  // A trace a failed test left on is killed: no block or keeper outlives it.
+  ~Klptrc() override { if (klptest::memoryExists(block)) trc({"kill"}); }
+  // klptrc with args, then the keys of the test's server unless bare.
+  klptest::ProcessResult trc(std::vector<std::string> args, bool bare = false) {
+    args.insert(args.begin(), klptest::binPath("klptrc"));
+    if (!bare) args.insert(args.end(), {"-db", srv, "-kcap"});
+    return klptest::run(args, {}, 30000);
   }
-  if (d != nullptr) closedir(d);
-  return found;
-}
-
-std::string blockPath(const klptest::TmpDir& dir, const std::string& server) {
-  return dir.path() + server + ".KLP.KCAP.TRC";
-}
-
-// Kills a trace a failed test left on, so that no block or keeper outlives
-// the test.
-struct KillLeftTrace {
-  const klptest::TmpDir& dir;
-  std::string server;
-  ~KillLeftTrace() {
-    if (klptest::memoryExists(blockPath(dir, server)))
-      trc(std::vector<std::string>{"kill"} + keys(server));
+  // A keeper process holding a block of this directory.
+  bool keeperRunning() {
+    bool found = false;
+    if (DIR* d = opendir("/proc")) {
+      while (dirent* e = readdir(d)) {
+        std::string cmd = klptest::readFile(std::string("/proc/") + e->d_name + "/cmdline");
+        std::replace(cmd.begin(), cmd.end(), '\0', ' ');
+        found = found || (has(cmd, "klptrcbp") && has(cmd, dir.path()));
+      }
+      closedir(d);
+    }
+    return found;
   }
 };
 
-}  // namespace
-
-TEST(Klptrc, RefusalsWithoutATrace) {
-  klptest::TmpDir dir;
-  std::string missing = dir.path() + "missing.trc";
-  std::string foreign = dir.path() + "foreign.trc";
-  {
-    std::vector<char> header(95264, 0);
-    memcpy(header.data(), "Windows", 7);
-    memcpy(header.data() + 16, "0012", 4);
-    memcpy(header.data() + 24, "0024", 4);
-    header[32] = 54;
-    header[34] = static_cast<char>(250);
-    std::ofstream(foreign, std::ios::binary).write(header.data(), header.size());
-  }
-  const std::string hint = "Try 'klptrc -help' for usage instructions\n";
-  struct Case {
-    std::vector<std::string> args;
-    std::string said;
-  } cases[] = {
-      {{"onx", "-db", "A", "-kcap"}, "Unknown option \"onx\", ignored...\n" + hint},
-      {{"on"}, "database name and application specifier are required.\n" + hint},
-      {{"stat"}, "either database name and application specifier\nor filename are required.\n" + hint},
-      {{"json", "fmt", "-fn", missing},
-       "Error: \"json\" cannot be combined with \"flw\", \"fmt\" or \"v7fmt\".\n" + hint},
-      {{"stat", "-db", "A", "-kcap"}, "Trace is not on.\n"},
-      {{"resetlock", "-db", "A", "-kcap"}, "Trace is not on.\n"},
-      {{"off", "-db", "A", "-kcap"}, "Trace is already off, no action taken.\n"},
-      {{"kill", "-db", "A", "-kcap"}, "Trace is already off, no action taken.\n"},
-      {{"stat", "-fn", missing},
-       "Trace status from file '" + missing + "'\nUnable to open file \"" + missing + "\"\n"},
-      {{"FMT", "-fn", missing}, "Unable to open file \"" + missing + "\".\n"},
-      {{"stat", "-fn", foreign},
-       "Trace status from file '" + foreign + "'\nFile " + foreign +
-           " was generated by an incompatible Trace version.\nIt uses: platform Windows, trace "
-           "structure 0012, and symbol table 0024 (54x250)\nThis is: platform Linux, trace "
-           "structure 0012, and symbol table 0024 (54x250)\n"},
-  };
-  for (const Case& c : cases) {
-    klptest::ProcessResult r = trc(c.args);
+TEST_F(Klptrc, RefusalsWithoutATrace) {
+  std::string missing = dir.path() + "missing.trc", foreign = dir.path() + "foreign.trc";
+  std::string header(TRC_HEADER_SIZE, '\0');
+  header.replace(0, 7, "Windows").replace(16, 4, "0012").replace(24, 4, "0024");
+  header[32] = 54, header[34] = static_cast<char>(250);
+  std::ofstream(foreign, std::ios::binary) << header;
+  const std::vector<std::vector<std::string>> cases = {
+      {"onx", "-db", "A", "-kcap"}, {"on"}, {"stat"}, {"json", "fmt", "-fn", missing},
+      {"stat", "-db", "A", "-kcap"}, {"resetlock", "-db", "A", "-kcap"},
+      {"off", "-db", "A", "-kcap"}, {"kill", "-db", "A", "-kcap"}, {"stat", "-fn", missing},
+      {"FMT", "-fn", missing}, {"stat", "-fn", foreign}};
+  std::string said;
+  for (const std::vector<std::string>& args : cases) {
+    klptest::ProcessResult r = trc(args, true);
     EXPECT_EQ(r.exitCode, 0);
-    EXPECT_EQ(r.out, c.said) << c.args[0];
+    said += "$";
+    for (const std::string& a : args) said += " " + a;
+    said += "\n" + r.out;
   }
+  for (size_t at; (at = said.find(dir.path())) != std::string::npos;)
+    said.replace(at, dir.path().size(), "DIR/");
+  EXPECT_EQ(said, klptest::readFile(KLP_SOURCE_DIR "/tests/e2e/klptrc_refusals.golden"));
 
-  std::string help = trc({"-help"}).out;
+  std::string help = trc({"-help"}, true).out;
   EXPECT_EQ(help.substr(0, help.find('\n') + 1),
             "klptrc  8.1.0 (platform: Linux; format: 0012/0024)\n");
   EXPECT_TRUE(has(klptest::lines(help).back(), "klptrc json [-fn file | <keys>] [-ofn outfile]"));
-  std::string symbols = trc({"-listsymbols"}).out;
+  std::string symbols = trc({"-listsymbols"}, true).out;
   EXPECT_EQ(e2e::countOf(symbols, "\nComponent: \""), 54u);
   EXPECT_FALSE(has(symbols, "ZERO_PLACE_HOLDER"));
   EXPECT_TRUE(has(symbols, "Component: \"Sample Trace\"\n  Functions:\n  \"main\"\n  \"printcb\"\n"));
   // -ofn appends to its file.
   std::string outFile = dir.path() + "out.txt";
   std::ofstream(outFile) << "before\n";
-  EXPECT_EQ(trc({"-help", "-ofn", outFile}).out, "");
+  EXPECT_EQ(trc({"-help", "-ofn", outFile}, true).out, "");
   EXPECT_EQ(klptest::readFile(outFile), "before\n" + help);
+
+  HSVSharedLib lib;  // the entry point is exported with C linkage
+  ASSERT_EQ(lib.load((std::string(KLP_BIN_DIR) + "/../lib/libklp.so").c_str(), 0), ECF_OK)
+      << lib.lastError();
+  EXPECT_NE(lib.getFuncAddress("_klpTrace"), nullptr);
 }
 
-TEST(Klptrc, ServerTracedFromItsStart) {
-  klptest::TmpDir dir;
-  const std::string srv = "TR1";
-  KillLeftTrace guard{dir, srv};
-  klptest::ProcessResult on = trc(std::vector<std::string>{"on", "-d", "1,2,3"} + keys(srv));
+TEST_F(Klptrc, ServerTracedFromItsStart) {
+  klptest::ProcessResult on = trc({"on", "-d", "1,2,3"});
   ASSERT_TRUE(has(on.out, "Trace is turned on, with IPC key '(shm, /klpm.")) << on.out;
-  EXPECT_TRUE(has(trc(std::vector<std::string>{"on"} + keys(srv)).out,
-                  "Trace is already on, no action taken.\n"));
-  EXPECT_TRUE(keeperRunning(dir));
-  Server s(dir, srv);
+  EXPECT_TRUE(has(trc({"on"}).out, "Trace is already on, no action taken.\n"));
+  EXPECT_TRUE(keeperRunning());
+  e2e::Server s(dir, srv);
   ASSERT_TRUE(s.ready());
-  RawClient c(s.queue());
+  e2e::RawClient c(s.queue());
   ASSERT_TRUE(c.ok());
-  Reply r;
+  e2e::Reply r;
   ASSERT_TRUE(c.ask(kStatus, &r));
 
-  std::string stat = trc(std::vector<std::string>{"statlong"} + keys(srv)).out;
+  std::string stat = trc({"statlong"}).out;
   EXPECT_TRUE(has(stat, "Trace status from buffer with IPC key '(shm, /klpm.")) << stat;
   EXPECT_TRUE(has(stat, "LogDiagLvl : 1,2,3\nStatus:      Running\n")) << stat;
   EXPECT_TRUE(has(stat, "  Unique Name:       TR1.KLP.KCAP\n")) << stat;
   EXPECT_TRUE(has(stat, "Module-level version information:\n  name           apar      compiled\n"));
-  std::string flow = trc(std::vector<std::string>{"flw"} + keys(srv)).out;
+  std::string flow = trc({"flw"}).out;
   EXPECT_GE(e2e::countOf(flow, "\npid = "), 2u) << flow;  // records of two threads at least
   EXPECT_TRUE(has(flow, " thr = AdminThread\n")) << flow;   // the threads are named
   EXPECT_TRUE(has(flow, " thr = Initial\n")) << flow;
   EXPECT_TRUE(has(flow, "| cmdsHandleMessage fnc_data \"Got IPC Message\" lvl 3\n")) << flow;
 
-  std::string dump = dir.path() + "dump.trc";
-  EXPECT_EQ(trc(std::vector<std::string>{"dmp", dump} + keys(srv)).out, "");
   // A trace file is read under the name it is given, not the one it was
   // written under.
-  std::string moved = dir.path() + "moved.trc";
+  std::string dump = dir.path() + "dump.trc", moved = dir.path() + "moved.trc";
+  EXPECT_EQ(trc({"dmp", dump}).out, "");
   ASSERT_EQ(rename(dump.c_str(), moved.c_str()), 0);
-  std::string full = trc({"fmt", "-fn", moved}).out;
+  std::string full = trc({"fmt", "-fn", moved}, true).out;
   EXPECT_TRUE(has(full, "cmdsHandleMessage fnc_data \"Got IPC Message\" lvl 3\n"
                         "         Object 1 of type \"Raw binary data\": (hex dump)\n")) << full;
-  EXPECT_TRUE(has(trc({"stat", "-fn", moved}).out, "LogDiagLvl : N/A\nStatus:      N/A\n"));
-  std::string json = trc({"json", "-fn", moved, "-d", "1"}).out;
+  EXPECT_TRUE(has(trc({"stat", "-fn", moved}, true).out, "LogDiagLvl : N/A\nStatus:      N/A\n"));
+  std::string json = trc({"json", "-fn", moved, "-d", "1"}, true).out;
   EXPECT_EQ(json.substr(0, 39), "{\"displayTimeUnit\":\"ms\",\"traceEvents\":[");
   EXPECT_EQ(json.substr(json.size() - 4), "\n]}\n");
   EXPECT_TRUE(has(json, "{\"name\":\"cmdsHandleMessage\",\"cat\":\"Capture/Apply Common Function\","
@@ -172,91 +132,108 @@ TEST(Klptrc, ServerTracedFromItsStart) {
   EXPECT_FALSE(has(json, "\"ph\":\"i\""));  // level 1 only: no data records
 
   // Filters change while the trace runs; diag shows them.
-  trc(std::vector<std::string>{"-d", "2", "-df", "cmdsEngine", "1", "-df", "Capture Prune", "4"} +
-      keys(srv));
-  EXPECT_EQ(trc(std::vector<std::string>{"diag"} + keys(srv)).out,
+  trc({"-d", "2", "-df", "cmdsEngine", "1", "-df", "Capture Prune", "4"});
+  EXPECT_EQ(trc({"diag"}).out,
             "\nDiag Settings\n=============\nGlobal filter = 2\n"
             "Component: \"Capture Prune\" = 4\n"
             "Component: \"Capture/Apply Common Function\"\n Function: \"cmdsEngine\" = 1\n\n");
-  EXPECT_TRUE(has(trc(std::vector<std::string>{"clr", "stat"} + keys(srv)).out, ""));
-  EXPECT_TRUE(has(trc(std::vector<std::string>{"stat"} + keys(srv)).out, "Num Entries: 0\n"));
+  EXPECT_EQ(trc({"clr"}).exitCode, 0);
+  EXPECT_TRUE(has(trc({"stat"}).out, "Num Entries: 0\n"));
 
-  // The command program traces into the block while it runs and leaves the
-  // server's hold on it, and its description, alone.
+  // The command program traces into the block and leaves the server's hold
+  // on it, and its description, alone.
   auto status = [&] {
     return klptest::run({klptest::binPath("klpkccmd"), "CAPTURE_SERVER=" + srv, "STATUS"});
   };
   ASSERT_EQ(status().exitCode, 0);
-  EXPECT_TRUE(has(trc(std::vector<std::string>{"stat"} + keys(srv)).out,
-                  "Replication version info:\n  klpkcap 9.7.8\n"));
+  EXPECT_TRUE(has(trc({"stat"}).out, "Replication version info:\n  klpkcap 9.7.8\n"));
 
   // Off while the server holds the block leaves the freeing to it.
-  std::string off = trc(std::vector<std::string>{"off"} + keys(srv)).out;
-  EXPECT_EQ(off,
+  EXPECT_EQ(trc({"off"}).out,
             "Trace is turned off.\nUnable to free the trace buffer at this time.\nThe \"KCAP\" "
             "application will free the trace buffer while it is running or when it is "
             "restarted.\nUse the klptrc \"kill\" option to free the trace buffer, if the \"KCAP\" "
             "application is stopped.\n");
   ASSERT_EQ(status().exitCode, 0);  // finds the block turned off
-  EXPECT_TRUE(klptest::memoryExists(blockPath(dir, srv)));
-  EXPECT_TRUE(e2e::waitFor([&] { return !keeperRunning(dir); }, 10000));
-  ASSERT_TRUE(c.ask(14, &r));
+  EXPECT_TRUE(klptest::memoryExists(block));
+  EXPECT_TRUE(e2e::waitFor([&] { return !keeperRunning(); }, 10000));
+  ASSERT_TRUE(c.ask(kStop, &r));
   EXPECT_EQ(s.proc().wait(30000).exitCode, 0);
-  EXPECT_FALSE(klptest::memoryExists(blockPath(dir, srv)));
+  EXPECT_FALSE(klptest::memoryExists(block));
 }
 
-TEST(Klptrc, TurnedOnForARunningServerThenKilled) {
-  klptest::TmpDir dir;
-  const std::string srv = "TR2";
-  KillLeftTrace guard{dir, srv};
-  Server s(dir, srv);
+TEST_F(Klptrc, TurnedOnForARunningServerThenKilled) {
+  e2e::Server s(dir, srv);
   ASSERT_TRUE(s.ready());
-  ASSERT_TRUE(has(trc(std::vector<std::string>{"on"} + keys(srv)).out, "Trace is turned on"));
+  ASSERT_TRUE(has(trc({"on"}).out, "Trace is turned on"));
   // The notice reaches the server before the command does.
-  RawClient c(s.queue());
+  e2e::RawClient c(s.queue());
   ASSERT_TRUE(c.ok());
-  Reply r;
+  e2e::Reply r;
   ASSERT_TRUE(c.ask(kStatus, &r));
-  EXPECT_TRUE(has(trc(std::vector<std::string>{"fmt"} + keys(srv)).out,
-                  "cmdsHandleMessage fnc_entry at time"));
-
-  EXPECT_EQ(trc(std::vector<std::string>{"kill"} + keys(srv)).out, "Forcing trace off...\n");
-  EXPECT_FALSE(klptest::memoryExists(blockPath(dir, srv)));
-  EXPECT_TRUE(e2e::waitFor([&] { return !keeperRunning(dir); }, 10000));
-  ASSERT_TRUE(c.ask(14, &r));
+  EXPECT_TRUE(has(trc({"fmt"}).out, "cmdsHandleMessage fnc_entry at time"));
+  EXPECT_EQ(trc({"kill"}).out, "Forcing trace off...\n");
+  EXPECT_FALSE(klptest::memoryExists(block));
+  EXPECT_TRUE(e2e::waitFor([&] { return !keeperRunning(); }, 10000));
+  ASSERT_TRUE(c.ask(kStop, &r));
   EXPECT_EQ(s.proc().wait(30000).exitCode, 0);
 }
 
-TEST(Klptrc, ResetlockFreesALockItsHolderLeft) {
-  klptest::TmpDir dir;
-  const std::string srv = "TR3";
-  KillLeftTrace guard{dir, srv};
-  ASSERT_TRUE(has(trc(std::vector<std::string>{"on"} + keys(srv)).out, "Trace is turned on"));
+TEST_F(Klptrc, ResetlockFreesALockItsHolderLeft) {
+  ASSERT_TRUE(has(trc({"on"}).out, "Trace is turned on"));
+  HSVHIPCMemory* m = nullptr;
+  trcBlockHeader* b = nullptr;
   klptest::Child holder = klptest::inChild(dir.path(), [&] {
-    HSVHIPCMemory* m = nullptr;
-    trcBlockHeader* b = nullptr;
     if (trcOpenBlock(dir.path().c_str(), (srv + ".KLP.KCAP").c_str(), &m, &b) != ECF_OK) return 1;
     trcLockBuffer(b);
     return 0;  // ends holding the lock
   });
   ASSERT_EQ(holder.exitCode, 0);
-  HSVHIPCMemory* m = nullptr;
-  trcBlockHeader* b = nullptr;
   ASSERT_EQ(trcOpenBlock(dir.path().c_str(), (srv + ".KLP.KCAP").c_str(), &m, &b), ECF_OK);
   EXPECT_EQ(b->bufferLock, 1);
-  EXPECT_EQ(trc(std::vector<std::string>{"resetlock"} + keys(srv)).out, "");
+  EXPECT_EQ(trc({"resetlock"}).out, "");
   EXPECT_EQ(b->bufferLock, 0);
-  EXPECT_EQ(trc(std::vector<std::string>{"clr"} + keys(srv)).exitCode, 0);  // does not wait
+  EXPECT_EQ(trc({"clr"}).exitCode, 0);  // does not wait
   m->detach();
   delete m;
-  EXPECT_EQ(trc(std::vector<std::string>{"off"} + keys(srv)).out, "Trace is turned off.\n");
-  EXPECT_FALSE(klptest::memoryExists(blockPath(dir, srv)));
-  EXPECT_TRUE(e2e::waitFor([&] { return !keeperRunning(dir); }, 10000));
+  EXPECT_EQ(trc({"off"}).out, "Trace is turned off.\n");
+  EXPECT_FALSE(klptest::memoryExists(block));
+  EXPECT_TRUE(e2e::waitFor([&] { return !keeperRunning(); }, 10000));
 }
 
-TEST(Klptrc, EntryPointIsExportedWithCLinkage) {
-  HSVSharedLib lib;
-  ASSERT_EQ(lib.load((std::string(KLP_BIN_DIR) + "/../lib/libklp.so").c_str(), 0), ECF_OK)
-      << lib.lastError();
-  EXPECT_NE(lib.getFuncAddress("_klpTrace"), nullptr);
+// Turned off (by this process's own block calls) while the server writes,
+// or off and on again before the server let go: it frees only its block.
+TEST_F(Klptrc, TurnedOffUnderTheServerOrOnAgain) {
+  const std::string key = srv + ".KLP.KCAP";
+  trcInitAnchor();
+  for (bool onAgain : {false, true}) {
+    SCOPED_TRACE(onAgain);
+    auto turnOn = [&] {
+      ASSERT_EQ(0, trcCreate(TRC_MIN_SIZE * 4, dir.path().c_str(), key.c_str(), nullptr,
+                             TRC_MAX_SIZE, 0x3F, true));
+    };
+    e2e::Server server(dir, srv);
+    ASSERT_TRUE(server.ready());
+    turnOn();
+    ASSERT_EQ(0, _trcSendIPCMsg(dir.path().c_str(), key.c_str(), 10));
+    trcBlockHeader* b = trcGetAnchor()->block;
+    ASSERT_TRUE(e2e::waitFor([&] { return b->appAttached == TRC_APP_ATTACHED; }, 20000));
+    EXPECT_STREQ("klpkcap", b->appVersion.rel.programName);
+    EXPECT_NE(0, b->moduleCount);
+    trcLockBuffer(b);
+    b->status = TRC_STATE_STOP;
+    trcUnlockBuffer(b);
+    if (onAgain) {
+      turnOn();  // removes the old block's name and makes a new block under it
+    } else {
+      trcDropBlock(false);  // the server is attached: freeing is its part
+      EXPECT_TRUE(klptest::memoryExists(block));
+    }
+    server.proc().kill(SIGTERM);
+    EXPECT_EQ(0, server.proc().wait(20000).exitCode);
+    EXPECT_EQ(onAgain, klptest::memoryExists(block));
+    if (onAgain) trcFree();
+  }
 }
+
+}  // namespace
