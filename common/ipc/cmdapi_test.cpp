@@ -530,6 +530,9 @@ TEST_F(CmdApiExchange, CollectorAndStatusSizeConvertWholeRepliesOnly) {
     EXPECT_EQ(has(res.text, "KLP0589") && has(res.text, "2017"), c.rc != 0) << res.text;
     if (c.bufferSize == 0) std::free(req.buffer);
   }
+  klpResultBlock res{};
+  EXPECT_EQ(klpCollectStatus(nullptr, nullptr, &res, nullptr), 2001);
+  EXPECT_EQ(res.rc, 2001);
 }
 
 // A logger that raises SIGINT once message `at` is composed.

@@ -184,6 +184,10 @@ TEST(IpcMsg, QueueNamesResIdTextAndProgramWords) {
       {"KCAP", "*", "*"},                               {"S1.A.kcap", "*", "*"}};
   for (const auto& w : words)
     EXPECT_EQ(std::string(w[1]) + "/" + w[2], std::string(ipcProgramWord(w[0])) + "/" + ipcProgramCmdWord(w[0]));
+  std::string known;  // the function codes a server answers
+  for (int32_t f = 0; f < 70; ++f)
+    if (ipcFuncKnown(f)) known += std::to_string(f) + " ";
+  EXPECT_EQ("10 14 15 16 17 18 19 20 21 22 23 24 25 59 60 61 62 ", known);
 }
 
 TEST(IpcPieces, SplitAtTheMessageBoundAndGatheredAgain) {
@@ -198,6 +202,7 @@ TEST(IpcPieces, SplitAtTheMessageBoundAndGatheredAgain) {
   size_t len = 1;
   EXPECT_EQ(KLP_RC_BAD_PARM, ipcBuildPiece(reply, 3, small, sizeof small, &len));
   EXPECT_EQ(KLP_RC_BAD_PARM, ipcBuildPiece(reply, 1, small, sizeof small, &len));  // too small
+  EXPECT_EQ(KLP_RC_BAD_PARM, ipcBuildPiece(nullptr, 0, small, sizeof small, &len));
   EXPECT_EQ(0u, len);
   freeIpcMsg(reply);
   for (size_t n : {size_t(0), size_t(4053), size_t(3 * 4052), size_t(20000)}) {
