@@ -184,10 +184,10 @@ TEST(IpcMsg, QueueNamesResIdTextAndProgramWords) {
       {"KCAP", "*", "*"},                               {"S1.A.kcap", "*", "*"}};
   for (const auto& w : words)
     EXPECT_EQ(std::string(w[1]) + "/" + w[2], std::string(ipcProgramWord(w[0])) + "/" + ipcProgramCmdWord(w[0]));
-  std::string known;  // the function codes a server answers
+  std::string codes;  // the function codes a server answers
   for (int32_t f = 0; f < 70; ++f)
-    if (ipcFuncKnown(f)) known += std::to_string(f) + " ";
-  EXPECT_EQ("10 14 15 16 17 18 19 20 21 22 23 24 25 59 60 61 62 ", known);
+    if (ipcFuncKnown(f)) codes += std::to_string(f) + " ";
+  EXPECT_EQ("10 14 15 16 17 18 19 20 21 22 23 24 25 59 60 61 62 ", codes);
 }
 
 TEST(IpcPieces, SplitAtTheMessageBoundAndGatheredAgain) {
