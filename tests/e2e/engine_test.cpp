@@ -1,22 +1,13 @@
-// The command engine inside this process: requests handed to its
-// per-message step and to the loop itself, with thread objects that run no
-// OS thread, so that what each thread received can be looked at directly,
-// and every message it logs is recorded.
+// The command engine in this process, with thread objects that run no OS
+// thread: what each received is looked at directly, what it logs recorded.
 #include <fnmatch.h>
-#include <signal.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <chrono>
-#include <cstring>
-#include <memory>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "common/env/klpenv.h"
 #include "common/ipc/cmdsengine.h"
-#include "common/ipc/ipcmsg.h"
 #include "common/parms/klpparm.h"
 #include "common/thread/klpthread.h"
 #include "common/thread/ordlist.h"
@@ -25,11 +16,11 @@
 
 namespace {
 
+using e2e::Ints;
 using e2e::RawClient;
 constexpr int kStop = 14, kStatus = 15, kChgparms = 20, kPrune = 22;
-// The parameters whose roles the engine knows: 5 ends a one-pass server
-// without critical threads, and in an "xqapply" program 18 (a flag) and 34
-// (a text) decide both that and whether 18 may be set.
+// Roles the engine knows: 5 ends a one-pass server without critical threads;
+// in an "xqapply" program flag 18 and text 34 decide that and whether 18 may be set.
 constexpr int kTerm = 5, kApplyFlag = 18, kApplyText = 34, kInterval = 30, kPath = 7;
 
 int g_dbRc = 0;
@@ -53,8 +44,7 @@ class Engine : public ::testing::Test {
  protected:
   void SetUp() override {
     if (klpMainThread()->getState() == KLP_THREAD_EXIST) klpThread::prologue(klpMainThread());
-    // The roles above, a server name and schema for the prefix, and one
-    // parameter that may not change while the server runs.
+    // The roles above, server name and schema, and one parameter fixed while the server runs.
     std::vector<ParmEntry> table;
     for (int i = 0; i <= kApplyText; ++i) {
       const char* text = i == 0 ? "ENG" : i == 2 ? "KLP" : i == kPath ? "/p" : i == kApplyText ? "" : nullptr;
@@ -98,8 +88,7 @@ class Engine : public ::testing::Test {
     snprintf(klpGetEnv()->programName, sizeof klpGetEnv()->programName, "%s", name);
   }
 
-  // A thread object with its own command list, on the engine's list, that
-  // runs nothing.
+  // A thread object with its own command list, on the engine's list, running nothing.
   klpThread* addThread(const char* name, int32_t state, std::vector<int> interests = {}, int critical = 1) {
     klpThread* t = new klpThread();
     t->setName(name);
@@ -142,9 +131,8 @@ std::vector<char> req(int32_t func, int32_t subFunc = 0, int32_t pid = getpid(),
   return m;
 }
 
-// What each request is answered with and what the engine logs on the way.
-// Codes 60 to 62 are answered by the interested thread, TRCSTART with
-// sub-function 1 (the trace-on notice) by nobody.
+// Each request's answer and log; codes 60 to 62 are the interested thread's
+// to answer, TRCSTART with sub-function 1 (the trace-on notice) nobody's.
 TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
   klpThread* pruner = addThread("PruneThread", KLP_THREAD_REST, {kPrune, kStop});
   addThread("BehinderWorkerThread", KLP_THREAD_DBWAIT);  // cut to 14 characters
@@ -179,29 +167,26 @@ TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
     e2e::Reply got;
     bool answered = receive(&got, 0);  // replies are put before the step returns
     EXPECT_EQ(answered ? (r.length == -2 ? -2 : got.header.msgLength) : -1, r.length) << func;
-    if (answered) { EXPECT_EQ((e2e::Ints{got.header.func, got.header.senderPid}), (e2e::Ints{func, getpid()})); }
+    if (answered) { EXPECT_EQ((Ints{got.header.func, got.header.senderPid}), (Ints{func, getpid()})); }
     if (func == 17) { EXPECT_EQ(std::string(got.payload.data() + 2, 8), "KLPQRYMG"); }
     if (func == 59) { EXPECT_EQ(std::string(got.payload.data(), 16), std::string("klpSISize: \0\3\0\0\0", 16)); }
     if (answered && func == kStatus) {  // one record per thread, in list order, and room for one more
-      EXPECT_EQ((e2e::Ints{e2e::rd32(got.payload, 0), e2e::rd32(got.payload, 4), e2e::rd32(got.payload, 8),
+      EXPECT_EQ((Ints{e2e::rd32(got.payload, 0), e2e::rd32(got.payload, 4), e2e::rd32(got.payload, 8),
                            e2e::rd32(got.payload, 28), e2e::rd32(got.payload, 48), e2e::rd32(got.payload, 68)}),
-                (e2e::Ints{0, 0, 3, KLP_THREAD_REST, KLP_THREAD_DBWAIT, KLP_THREAD_RUN}));
+                (Ints{0, 0, 3, KLP_THREAD_REST, KLP_THREAD_DBWAIT, KLP_THREAD_RUN}));
       EXPECT_EQ(std::string(got.payload.data() + 12) + "," + std::string(got.payload.data() + 32, 16),
                 "PruneThread," + std::string("BehinderWorker\0\0", 16));
     }
     EXPECT_RECORDS(r.records, func);
   }
-  // The code went to the interested thread only, without a requester when
-  // the request had none; STOP set the caller's flag once.
-  EXPECT_EQ((e2e::Ints{takeFunc(pruner), takeFunc(pruner), takeFunc(pruner), takeFunc(pruner)}),
-            (e2e::Ints{kPrune, kPrune, kStop, -1}));
-  EXPECT_EQ((e2e::Ints{stopFlag_, st_.stopping}), (e2e::Ints{1, 1}));
+  // The code went to the interested thread only; STOP set the caller's flag once.
+  EXPECT_EQ((Ints{takeFunc(pruner), takeFunc(pruner), takeFunc(pruner), takeFunc(pruner)}),
+            (Ints{kPrune, kPrune, kStop, -1}));
+  EXPECT_EQ((Ints{stopFlag_, st_.stopping}), (Ints{1, 1}));
 }
 
-// A value changes its parameter by the parameter's type, only when the
-// parameter may change while the server runs; the request is echoed either
-// way. In an "xqapply" program the flag 18 may not be set while the text 34
-// is set.
+// A value changes a changeable parameter by its type; the request is echoed
+// either way. An "xqapply" program may not set flag 18 while text 34 is set.
 TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
   const struct {
     const char* program;
@@ -231,8 +216,8 @@ TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
     e2e::Reply got;
     ASSERT_TRUE(receive(&got, 0)) << r.value;
     EXPECT_EQ(got.raw.size(), m.size());
-    EXPECT_EQ((e2e::Ints{got.header.subFunc, memcmp(got.raw.data() + 44, m.data() + 44, m.size() - 44)}),
-              (e2e::Ints{r.index, 0}));
+    EXPECT_EQ((Ints{got.header.subFunc, memcmp(got.raw.data() + 44, m.data() + 44, m.size() - 44)}),
+              (Ints{r.index, 0}));
     if (r.after) {
       const ParmEntry* p = parms_->peekSlot(r.index);
       std::string now = p->type == PARM_BOOLEAN   ? (p->boolValue ? "Y" : "N")
@@ -245,11 +230,9 @@ TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
   }
 }
 
-// One pass of the loop (mode 2): supervision, the stop sequence, the signal
-// record and the result from the threads' end codes and the database. 415
-// (threads alive, none critical) stops a server unless, in one-pass mode,
-// its flag 5 is not set; an "xqapply" program stops only when its flag 18
-// or text 34 says so.
+// One pass (mode 2): supervision, stop sequence, signal, result. 415 (threads
+// alive, none critical) stops a server unless, in one pass, flag 5 is not set;
+// an "xqapply" program stops only when its flag 18 or text 34 says so.
 TEST_F(Engine, OnePassOutcomes) {
   const std::string rrs = "590 klpThread::stop 1 *|952|Ended\n534 cmdsEngine 1 ENG|RRS NOT AVAILABLE";
   const struct {
@@ -307,8 +290,7 @@ TEST_F(Engine, OnePassOutcomes) {
   }
 }
 
-// Runs the loop in mode 0 on its own thread; the test thread plays the
-// threads' part.
+// The loop in mode 0 on its own thread; the test thread plays the threads' part.
 struct LoopRun {
   std::atomic<bool> done{false};
   int rc = -1;
@@ -322,9 +304,8 @@ struct LoopRun {
   ~LoopRun() { runner.join(); }
 };
 
-// A database that goes down ends the loop's normal work: 2006 starts the
-// stop sequence, and once the threads have stopped the result is 929 with
-// message 534; the server's queue goes with the environment.
+// A database gone down starts the stop sequence (2006); once the threads have
+// stopped the loop ends with 929 and 534, and the server's queue goes.
 TEST_F(Engine, ADatabaseThatGoesDownStopsTheServerWith929) {
   klpThread* a = addThread("A", KLP_THREAD_REST);
   ASSERT_EQ(setEnvIpcQRcvHdl(klpGetEnv()), 0);
@@ -336,16 +317,15 @@ TEST_F(Engine, ADatabaseThatGoesDownStopsTheServerWith929) {
     EXPECT_EQ(takeFunc(a), kStop);
     a->setState(KLP_THREAD_STOP);
     EXPECT_TRUE(e2e::waitFor([&] { return run.done.load(); }, 15000));
-    EXPECT_EQ((e2e::Ints{run.rc, run.flag}), (e2e::Ints{929, 0}));
+    EXPECT_EQ((Ints{run.rc, run.flag}), (Ints{929, 0}));
   }
   EXPECT_RECORDS("590 klpThread::stop 1 *|0|A\n534 cmdsEngine 1 ENG|DOWN\n595 Klpenv:delEnvIpcQRcvHdl 0 *",
                  "database down");
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
 }
 
-// After STOP the grace runs out only while an "apply" program's
-// WorkerThread rests: one still at work holds the loop past the 8 seconds,
-// and ends it as soon as it rests. Such a program checks no database.
+// An "apply" program's grace ends only while its WorkerThread rests: one at
+// work holds the loop past the 8 s. Such a program checks no database.
 TEST_F(Engine, TheGraceOfAnApplyProgramWaitsForItsWorkerToRest) {
   program("applyX");
   g_dbRc = 929;
@@ -359,19 +339,18 @@ TEST_F(Engine, TheGraceOfAnApplyProgramWaitsForItsWorkerToRest) {
     EXPECT_FALSE(run.done.load());
     worker->setState(KLP_THREAD_REST);
     EXPECT_TRUE(e2e::waitFor([&] { return run.done.load(); }, 5000));
-    EXPECT_EQ((e2e::Ints{run.rc, run.flag}), (e2e::Ints{0, 1}));
+    EXPECT_EQ((Ints{run.rc, run.flag}), (Ints{0, 1}));
   }
   EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(9));
   e2e::Reply r;
   ASSERT_TRUE(receive(&r));
   EXPECT_EQ(r.header.func, kStop);
-  EXPECT_EQ((e2e::Ints{takeFunc(worker), takeFunc(worker)}), (e2e::Ints{kStop, -1}));  // the request itself
+  EXPECT_EQ((Ints{takeFunc(worker), takeFunc(worker)}), (Ints{kStop, -1}));  // the request itself
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
 }
 
-// A requester whose reply queue is full is dropped, not waited for: the
-// first message goes only when there is room at once, and what is left of
-// a long reply gets little time.
+// A requester whose reply queue is full is dropped, not waited for: the first
+// piece goes only with room at once, the rest of a long reply gets little time.
 TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
   const struct {
     int waiting, threads;
@@ -402,8 +381,7 @@ TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
   freeIpcMsg(other);
 }
 
-// A thread that does not take its commands gets at most 100; the stop
-// sequence still reaches it.
+// A thread that takes no commands gets at most 100; the stop sequence still reaches it.
 TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
   klpThread* stuck = addThread("Stuck", KLP_THREAD_REST, {kPrune});
   klpThread* taking = addThread("Taking", KLP_THREAD_REST, {kPrune});
@@ -414,7 +392,7 @@ TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
   EXPECT_EQ(stuck->cmdList->count, 100);
   EXPECT_RECORDS("8054 cmdsEngine 1 Stuck|100|22\n8054 cmdsEngine 1 Stuck|100|22", "cap");
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
-  EXPECT_EQ((e2e::Ints{stuck->cmdList->count, taking->cmdList->count}), (e2e::Ints{101, 1}));
+  EXPECT_EQ((Ints{stuck->cmdList->count, taking->cmdList->count}), (Ints{101, 1}));
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);  // once stopping, nothing more is sent
   EXPECT_EQ(taking->cmdList->count, 1);
 }

@@ -1,22 +1,15 @@
 // The fault-injecting layer in one process: which uses its texts make fail,
 // the texts it refuses, its allocator, and the library loaders' failure
 // points, which no scenario of the walk reaches.
-#include <gtest/gtest.h>
-#include <signal.h>
-#include <unistd.h>
-
 #include <cerrno>
-#include <functional>
 #include <new>
 #include <sstream>
-#include <string>
-#include <vector>
 
 #include "common/db/klpdll.h"
 #include "common/db/oradl.h"
 #include "common/msg/msglogger.h"
 #include "common/platform/hsv_fault.h"
-#include "tests/testing/klptest.h"
+#include "tests/e2e/e2e_support.h"
 
 namespace {
 
@@ -49,23 +42,14 @@ TEST(FaultLayer, TextsChooseTheUsesThatFail) {
   const struct {
     std::string spec, seen;
   } cases[] = {
-      {"", "...."},
-      {"resid.queue:2", ".F.."},
-      {"resid.queue:2-3", ".FF."},
-      {"resid.queue:3+", "..FF"},
-      {"resid.queue:1,resid.queue:4=0x9000000C", "F..L"},
-      {"resid.memory:1", "...."},
-      {self + "/resid.queue:1", "F..."},
-      {"klpkcap/resid.queue:1,wait=3,klpkcap/log=/nonexistent/dir/x", "...."},
-      {"resid.queue", "refused"},
-      {"resid.queue:0", "refused"},
-      {"resid.queue:3-2", "refused"},
-      {"resid.queue:1=0", "refused"},
-      {"resid.queue:x", "refused"},
-      {"queue.putt:1", "refused"},
-      {"sleep=0", "refused"},
+      {"", "...."}, {"resid.queue:2", ".F.."}, {"resid.queue:2-3", ".FF."}, {"resid.queue:3+", "..FF"},
+      {"resid.queue:1,resid.queue:4=0x9000000C", "F..L"}, {"resid.memory:1", "...."}, {self + "/resid.queue:1", "F..."},
+      {"klpkcap/resid.queue:1,wait=3,klpkcap/log=/nonexistent/dir/x", "...."}, {"resid.queue", "refused"},
+      {"resid.queue:0", "refused"}, {"resid.queue:3-2", "refused"}, {"resid.queue:1=0", "refused"},
+      {"resid.queue:x", "refused"}, {"queue.putt:1", "refused"}, {"sleep=0", "refused"},
       {"log=/nonexistent/dir/x", "refused"},
   };
+
   for (const auto& c : cases) EXPECT_EQ(lookups(c.spec), c.seen) << c.spec;
 
   klptest::TmpDir dir;
@@ -137,19 +121,10 @@ TEST(FaultLayer, LibraryLoadersReportTheirFailures) {
 // looping, reporting once; it must pause between passes, not spin a core.
 TEST(FaultLayer, AServerWhoseGetsFailDoesNotSpin) {
   if (!hsvFaultCompiledIn()) GTEST_SKIP() << "built without KLP_FAULTS";
-  klptest::TmpDir tmp;
-  const std::string queuePath = tmp.path() + "GF.KLP.KCAP.IPC";
-  klptest::Background server({klptest::binPath("klpkcap"), "CAPTURE_SERVER=GF"},
-                             {"KLP_TEST_FAULTS=klpkcap/queue.get:1+"});
-  for (int i = 0; i < 500 && !klptest::queueExists(queuePath); ++i) usleep(10000);
-  ASSERT_TRUE(klptest::queueExists(queuePath));
-  HSVResID id;
-  HSVHIPCQueue q;
-  ASSERT_EQ(hsvIPCGetQueResID(queuePath.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
-  ASSERT_EQ(q.attach(id), ECF_OK);
-  const char request[44] = {'I', 'P', 'C', ':', 0, 0, 0, 0, 1, 0, 0, 0, 44, 0, 0, 0, 15};
-  ASSERT_EQ(q.put(request, sizeof request), ECF_OK);
-  q.detach();
+  klptest::TmpDir dir;
+  e2e::Server server(dir, "GF", {}, {"KLP_TEST_FAULTS=klpkcap/queue.get:1+"});
+  ASSERT_TRUE(server.ready());
+  ASSERT_TRUE(e2e::RawClient(server.queue(), false).sendBytes(e2e::RawClient::request(15)));
   auto cpuTicks = [&] {
     std::string stat = klptest::readFile("/proc/" + std::to_string(server.pid()) + "/stat");
     std::istringstream in(stat.substr(stat.rfind(')') + 2));
@@ -162,8 +137,5 @@ TEST(FaultLayer, AServerWhoseGetsFailDoesNotSpin) {
   long before = cpuTicks();
   sleep(2);
   long used = cpuTicks() - before;  // a spinning loop takes about 200 ticks here
-  server.kill(SIGKILL);
-  server.wait();
   EXPECT_LT(used, 50) << "ticks of CPU in 2 s";
-  if (q.attach(id) == ECF_OK) q.destroy();
 }

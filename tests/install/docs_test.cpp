@@ -47,26 +47,19 @@ TEST(Completion, OffersTheWordsOfTheRightSet) {
   const std::string dir = installtest::tmp().path();
   ASSERT_EQ(shell("touch " + dir + "trace.trc").exitCode, 0);
   const std::vector<Case> cases = {
-      {{"klpkccmd", "st"}, "STARTQ= STATUS STOP STOPQ="},
-      {{"klpkccmd", "capture_s"}, "CAPTURE_SCHEMA= CAPTURE_SERVER="},
-      {{"klpkccmd", "STOP", "s"}, ""},
-      {{"klpkccmd", "LOGSTDOUT", "="}, "N Y"},
-      {{"klpkccmd", "status", "s"}, "SHOW"},
+      {{"klpkccmd", "st"}, "STARTQ= STATUS STOP STOPQ="}, {{"klpkccmd", "capture_s"}, "CAPTURE_SCHEMA= CAPTURE_SERVER="},
+      {{"klpkccmd", "STOP", "s"}, ""}, {{"klpkccmd", "LOGSTDOUT", "="}, "N Y"}, {{"klpkccmd", "status", "s"}, "SHOW"},
       {{"klpkccmd", "STATUS", "SHOW", ""}, "DETAILS"},
       {{"klpkccmd", "CHGPARMS", "S"}, "SIGNAL_LIMIT= SLEEP_INTERVAL= STALE="},
-      {{"klpkccmd", "CHGPARMS", "C"}, "COMMIT_INTERVAL="},
-      {{"klpkccmd", "CHGPARMS", "COMMIT_INTERVAL", "=", "1000", "Q"},
-       "QFULL_NUM_RETRIES= QFULL_RETRY_DELAY="},
-      {{"klpkccmd", "CHGPARMS", "TERM", "=", "y"}, "Y"},
+      {{"klpkccmd", "CHGPARMS", "C"}, "COMMIT_INTERVAL="}, {{"klpkccmd", "CHGPARMS", "TERM", "=", "y"}, "Y"},
+      {{"klpkccmd", "CHGPARMS", "COMMIT_INTERVAL", "=", "1000", "Q"}, "QFULL_NUM_RETRIES= QFULL_RETRY_DELAY="},
       {{"klpkccmd", "CHGPARMS", "COMMIT_INTERVAL", "="}, ""},
       {{"klpkccmd", "CHGPARMS", "TERM", "=", "N", "CAPTURE_SERVER", "=", "X", ""},
        "CAPTURE_SCHEMA= CAPTURE_SERVER= DEBUG KLPTRC LOGSTDOUT"},
-      {{"klptrc", "st"}, "stat statg statlong"},
-      {{"klptrc", "-K"}, "-kapp -kcap"},
-      {{"klptrc", "on", "-db", ""}, ""},
-      {{"klptrc", "fmt", "-df", "main", ""}, ""},
-      {{"klptrc", "fmt", "-fn", dir + "tr"}, dir + "trace.trc"},
+      {{"klptrc", "st"}, "stat statg statlong"}, {{"klptrc", "-K"}, "-kapp -kcap"}, {{"klptrc", "on", "-db", ""}, ""},
+      {{"klptrc", "fmt", "-df", "main", ""}, ""}, {{"klptrc", "fmt", "-fn", dir + "tr"}, dir + "trace.trc"},
   };
+
   const std::string completions = prefix() + "/share/bash-completion/completions/";
   for (const Case& c : cases) {
     std::vector<std::string> argv = {
@@ -77,8 +70,6 @@ TEST(Completion, OffersTheWordsOfTheRightSet) {
     argv.insert(argv.end(), c.words.begin(), c.words.end());
     ProcessResult r = klptest::run(argv);
     std::string got = r.out.substr(0, r.out.find('\n'));
-    std::string line;
-    for (const std::string& w : c.words) line += w + " ";
-    EXPECT_EQ(got, c.want) << line << r.err;
+    EXPECT_EQ(got, c.want) << ::testing::PrintToString(c.words) << r.err;
   }
 }
