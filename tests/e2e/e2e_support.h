@@ -1,5 +1,5 @@
-// Helpers of the end-to-end tests: a sample server under the test's own
-// TMPDIR, and a raw client that can put any bytes on the server's queue.
+// End-to-end helpers: a sample server under the test's TMPDIR, and a raw
+// client that can put any bytes on the server's queue.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -73,7 +73,7 @@ class Server {
 
 struct Reply {
   IpcMsg header{};
-  std::vector<char> payload, raw;
+  std::vector<char> payload;
 };
 
 // Takes one message from q, waiting at most timeoutMs.
@@ -84,7 +84,6 @@ inline bool takeReply(HSVHIPCQueue& q, Reply* out, int timeoutMs) {
       got < IPC_HEADER_SIZE)
     return false;
   memcpy(&out->header, buf, IPC_HEADER_SIZE);
-  out->raw.assign(buf, buf + got);
   out->payload.assign(buf + IPC_HEADER_SIZE, buf + got);
   return true;
 }

@@ -1,12 +1,8 @@
 // The command program against the sample server: real processes, each test
 // under its own TMPDIR, nothing left behind.
-#include <signal.h>
 #include <sys/resource.h>
 
 #include <chrono>
-#include <memory>
-#include <string>
-#include <vector>
 
 #include "tests/e2e/e2e_support.h"
 

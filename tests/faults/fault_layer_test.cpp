@@ -3,7 +3,7 @@
 // points, which no scenario of the walk reaches.
 #include <cerrno>
 #include <new>
-#include <sstream>
+#include <cstdio>
 
 #include "common/db/klpdll.h"
 #include "common/db/oradl.h"
@@ -125,14 +125,12 @@ TEST(FaultLayer, AServerWhoseGetsFailDoesNotSpin) {
   e2e::Server server(dir, "GF", {}, {"KLP_TEST_FAULTS=klpkcap/queue.get:1+"});
   ASSERT_TRUE(server.ready());
   ASSERT_TRUE(e2e::RawClient(server.queue(), false).sendBytes(e2e::RawClient::request(15)));
-  auto cpuTicks = [&] {
+  auto cpuTicks = [&] {  // utime and stime, the 14th and 15th fields
     std::string stat = klptest::readFile("/proc/" + std::to_string(server.pid()) + "/stat");
-    std::istringstream in(stat.substr(stat.rfind(')') + 2));
-    std::string field;
-    long ticks = 0;
-    for (int f = 3; f <= 15 && in >> field; ++f)
-      if (f >= 14) ticks += std::stol(field);  // utime, stime
-    return ticks;
+    long utime = 0, stime = 0;
+    EXPECT_EQ(sscanf(stat.c_str() + stat.rfind(')') + 2, "%*s %*s %*s %*s %*s %*s %*s %*s %*s %*s %*s %ld %ld",
+                     &utime, &stime), 2) << stat;
+    return utime + stime;
   };
   long before = cpuTicks();
   sleep(2);

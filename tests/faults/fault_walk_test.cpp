@@ -1,18 +1,13 @@
-// Walks every failure point of the platform layer under real processes: a
-// STATUS, a CHGPARMS, klptrc on, fmt and off, and a server's start and stop.
-// A counting run of each scenario finds the points (every use of every
-// platform call); the table below holds, for each, what the failure must
-// show, the exit codes, and that nothing crashes, hangs or is left behind.
+// Walks every failure point of the platform layer (each use of each call, found
+// by a counting run) under real processes: STATUS, CHGPARMS, klptrc on, fmt and
+// off, a server's start and stop. Each must show its text and exit codes, and
+// nothing may crash, hang or be left behind.
 #include <sys/stat.h>
 
 #include <cstdio>
 #include <fstream>
-#include <memory>
-#include <regex>
 #include <set>
 #include <sstream>
-#include <string>
-#include <vector>
 
 #include "common/platform/hsv_fault.h"
 #include "tests/e2e/e2e_support.h"
@@ -62,125 +57,96 @@ const Row kRows[] = {
     // The command program needs not its logger's queue, its trace attach nor one attach
     // attempt of five; everything else ends it with 12 and 589 naming KLPCmdFunc.
     {"STATUS CHGPARMS", {"klpkccmd/waitpost.create:1", "klpkccmd/alloc:1"}, 0, 0,
-     {"unknown wait/post create error\n", kDone}},
+         {"unknown wait/post create error\n", kDone}},
     {"STATUS CHGPARMS", {"klpkccmd/resid.memory:1", "klpkccmd/alloc:2", "klpkccmd/memory.attach:1",
-                         "klpkccmd/resid.queue:1", "klpkccmd/queue.attach:1",
-                         "klpkccmd/queue.hasMessage:1", "klpkccmd/queue.waitForMessage:1"}, 0, 0,
-     {kDone}},
-    {"STATUS CHGPARMS", {"klpkccmd/queue.attach:1+"}, 12, 0,
-     {"KLP0506E", "KLP0597E", "\"815\": \"KLPCmdFunc\""}},
-    {"STATUS CHGPARMS", {"klpkccmd/alloc:3", "klpkccmd/alloc:4"}, 12, 0,
-     {"\"1003\": \"KLPCmdFunc\""}},
+         "klpkccmd/resid.queue:1", "klpkccmd/queue.attach:1", "klpkccmd/queue.hasMessage:1",
+         "klpkccmd/queue.waitForMessage:1"}, 0, 0, {kDone}},
+    {"STATUS CHGPARMS", {"klpkccmd/queue.attach:1+"}, 12, 0, {"KLP0506E", "KLP0597E", "\"815\": \"KLPCmdFunc\""}},
+    {"STATUS CHGPARMS", {"klpkccmd/alloc:3", "klpkccmd/alloc:4"}, 12, 0, {"\"1003\": \"KLPCmdFunc\""}},
     {"STATUS CHGPARMS", {"klpkccmd/resid.queue:2", "klpkccmd/queue.create:1"}, 12, 0,
-     {"KLP0596E", "KLP0507E", "\"804\": \"KLPCmdFunc\""}},
-    {"STATUS CHGPARMS", {"klpkccmd/queue.put:1"}, 12, 0,
-     {"KLP0508E", "KLP0601E", "\"805\": \"KLPCmdFunc\""}},
-    {"STATUS CHGPARMS", {"klpkccmd/queue.get:1"}, 12, 0,
-     {"KLP0510E", "KLP0602E", "\"824\": \"KLPCmdFunc\""}},
+         {"KLP0596E", "KLP0507E", "\"804\": \"KLPCmdFunc\""}},
+    {"STATUS CHGPARMS", {"klpkccmd/queue.put:1"}, 12, 0, {"KLP0508E", "KLP0601E", "\"805\": \"KLPCmdFunc\""}},
+    {"STATUS CHGPARMS", {"klpkccmd/queue.get:1"}, 12, 0, {"KLP0510E", "KLP0602E", "\"824\": \"KLPCmdFunc\""}},
     {"STATUS CHGPARMS", {"klpkccmd/queue.get:1=0x90000008"}, 12, 0,
-     {"KLP0525E", "KLP0602E", "\"816\": \"KLPCmdFunc\""}},
+         {"KLP0525E", "KLP0602E", "\"816\": \"KLPCmdFunc\""}},
     // The server reports a failed get and takes the request on the next pass; a reply it
     // cannot deliver is reported and dropped, and the command program gives up (824).
     {"STATUS CHGPARMS", {"klpkcap/queue.get:1"}, 0, 0,
-     {"KLP0525E", "\"816\": \"HSVHIPCQueue::get\"", "KLP0517I", kDone}},
-    {"STATUS CHGPARMS", {"klpkcap/resid.queue:2,klpkccmd/wait=40",
-                         "klpkcap/queue.attach:2,klpkccmd/wait=40"}, 12, 0,
-     {"KLP0597E", "KLP0506E", "KLP0510E", "\"824\": \"KLPCmdFunc\""}},
+         {"KLP0525E", "\"816\": \"HSVHIPCQueue::get\"", "KLP0517I", kDone}},
+    {"STATUS CHGPARMS", {"klpkcap/resid.queue:2,klpkccmd/wait=40", "klpkcap/queue.attach:2,klpkccmd/wait=40"}, 12, 0,
+         {"KLP0597E", "KLP0506E", "KLP0510E", "\"824\": \"KLPCmdFunc\""}},
     {"STATUS CHGPARMS", {"klpkcap/queue.put:1,klpkccmd/wait=40"}, 12, 0,
-     {"KLP0508E", "\"805\": \"HSVHIPCQueue::put\"", "KLP0510E"}},
-
+         {"KLP0508E", "\"805\": \"HSVHIPCQueue::put\"", "KLP0510E"}},
     // The trace command: a block it cannot look at ends it; the trace goes on when only
     // the keeper or the notice to the server fails.
-    {"TraceOn TraceFmt TraceOff", {"klptrc/resid.memory:1", "klptrc/alloc:1",
-                                   "klptrc/memory.attach:1"}, 0, 0,
-     {kAttach, "!Trace is "}},
+    {"TraceOn TraceFmt TraceOff", {"klptrc/resid.memory:1", "klptrc/alloc:1", "klptrc/memory.attach:1"}, 0, 0,
+         {kAttach, "!Trace is "}},
     {"TraceOn", {"klptrc/resid.memory:2"}, 0, 0,
-     {"Function 'hsvIPCGetResID' for path '/tmp/", "Trace failed to start with return code 3000.\n"}},
-    {"TraceOn", {"klptrc/alloc:2"}, 0, 0,
-     {"Function 'HSVHIPCMemory::create' with IPC key '(shm, /klpm.",
-      "Trace failed to start with return code 1003.\n"}},
-    {"TraceOn", {"klptrc/memory.create:1"}, 0, 0,
-     {"Function 'HSVHIPCMemory::create' with IPC key '(shm, /klpm.",
-      "Trace failed to start with return code 3000.\nKey token was 'FW.KLP.KCAP'\n"}},
-    {"TraceOn", {"klptrc/resid.memory:3"}, 0, 0,
-     {"Trace is turned on, but an error occurred retrieving IPC key.\n"}},
+         {"Function 'hsvIPCGetResID' for path '/tmp/", "Trace failed to start with return code 3000.\n"}},
+    {"TraceOn", {"klptrc/alloc:2"}, 0, 0, {"Function 'HSVHIPCMemory::create' with IPC key '(shm, /klpm.",
+         "Trace failed to start with return code 1003.\n"}},
+    {"TraceOn", {"klptrc/memory.create:1"}, 0, 0, {"Function 'HSVHIPCMemory::create' with IPC key '(shm, /klpm.",
+         "Trace failed to start with return code 3000.\nKey token was 'FW.KLP.KCAP'\n"}},
+    {"TraceOn", {"klptrc/resid.memory:3"}, 0, 0, {"Trace is turned on, but an error occurred retrieving IPC key.\n"}},
     {"TraceOn", {"klptrc/process.start:1", "klptrc/process.wait:1", "klptrcbp/process.start:1"}, 0, 0,
-     {kDone, "Create Process failed!!\n"}},
+         {kDone, "Create Process failed!!\n"}},
     {"TraceOn", {"klptrc/resid.queue:1", "klptrc/queue.attach:1"}, 0, 0, {kDone}},
     {"TraceOn", {"klptrc/queue.put:1"}, 0, 0,
-     {kDone, "Function '_trcSendIPCMsg' call to 'HSVHIPCQueue::put' for path '/tmp/"}},
+         {kDone, "Function '_trcSendIPCMsg' call to 'HSVHIPCQueue::put' for path '/tmp/"}},
     // The server told of the trace: untraced when it cannot attach.
     {"TraceOn", {"klpkcap/queue.get:1"}, 0, 0, {kDone, "KLP0525E", "KLP0517I"}},
-    {"TraceOn", {"klpkcap/resid.memory:2", "klpkcap/alloc:4", "klpkcap/memory.attach:2"}, 0, 0,
-     {kDone}},
-
+    {"TraceOn", {"klpkcap/resid.memory:2", "klpkcap/alloc:4", "klpkcap/memory.attach:2"}, 0, 0, {kDone}},
     // The server starts without its logger's queue, its trace attach or the look for an
     // earlier run's queue; without its own queue it ends with 12 and says why.
     {"ServerStartStop", {"klpkcap/waitpost.create:1", "klpkcap/alloc:1"}, 0, 0,
-     {"unknown wait/post create error\n", kDone}},
+         {"unknown wait/post create error\n", kDone}},
     {"ServerStartStop", {"klpkcap/resid.memory:1", "klpkcap/alloc:2", "klpkcap/memory.attach:1",
-                         "klpkcap/queue.attach:1", "klpkcap/queue.hasMessage:1",
-                         "klpkcap/queue.waitForMessage:1"}, 0, 0,
-     {kDone}},
-    {"ServerStartStop", {"klpkcap/alloc:3"}, kNotRun, 12,
-     {"\"1003\": \"setEnvIpcQRcvHdl\""}},
+         "klpkcap/queue.attach:1", "klpkcap/queue.hasMessage:1", "klpkcap/queue.waitForMessage:1"}, 0, 0, {kDone}},
+    {"ServerStartStop", {"klpkcap/alloc:3"}, kNotRun, 12, {"\"1003\": \"setEnvIpcQRcvHdl\""}},
     {"ServerStartStop", {"klpkcap/resid.queue:1", "klpkcap/queue.create:1"}, kNotRun, 12,
-     {"KLP0596E", "KLP0507E", "\"804\": \"setEnvIpcQRcvHdl\""}},
+         {"KLP0596E", "KLP0507E", "\"804\": \"setEnvIpcQRcvHdl\""}},
     // Its stop: the stop goes on when the answer cannot.
     {"ServerStartStop", {"klpkcap/queue.get:1"}, 0, 0, {"KLP0525E", "KLP0517I", kDone}},
-    {"ServerStartStop", {"klpkcap/resid.queue:2,klpkccmd/wait=40",
-                         "klpkcap/queue.attach:2,klpkccmd/wait=40"}, 12, 0,
-     {"KLP0597E", "KLP0506E", kDone}},
+    {"ServerStartStop", {"klpkcap/resid.queue:2,klpkccmd/wait=40", "klpkcap/queue.attach:2,klpkccmd/wait=40"}, 12, 0,
+         {"KLP0597E", "KLP0506E", kDone}},
     {"ServerStartStop", {"klpkcap/queue.put:1,klpkccmd/wait=40"}, 12, 0,
-     {"KLP0508E", "\"805\": \"HSVHIPCQueue::put\"", kDone}},
+         {"KLP0508E", "\"805\": \"HSVHIPCQueue::put\"", kDone}},
 };
 // clang-format on
 
-// Calls whose number of uses follows the clock, not the command: walked at
-// their first use, not required to be reached. The keeper's second process
-// holds the block on its own clock.
-bool timeDriven(const std::string& op) {
-  return op == "queue.hasMessage" || op == "queue.waitForMessage" || op == "waitpost.wait";
+// Uses that follow the clock, not the command, and the keeper's second process
+// (it holds the block on its own clock): walked at their first use, not required to be reached.
+bool counts(const std::string& program, const std::string& op) {
+  return program != "klptrcbp" && op != "queue.hasMessage" && op != "queue.waitForMessage" && op != "waitpost.wait";
 }
-bool counted(const std::string& program) { return program != "klptrcbp"; }
 
-struct Use {
-  std::string program, op;
-  int use = 0;
-  bool operator<(const Use& o) const { return std::tie(program, op, use) < std::tie(o.program, o.op, o.use); }
-};
-
-std::string text(const Use& u) { return u.program + "/" + u.op + ":" + std::to_string(u.use); }
-
-// The failure items of a point ("program/operation:use[=code]").
-std::vector<Use> failures(const std::string& point) {
-  static const std::regex item("([a-z]+)/([a-zA-Z.]+):([0-9]+)(-[0-9]+|\\+)?(=[0-9a-fA-Fx]+)?");
-  std::vector<Use> out;
+// The failure items of a point ("program/operation:use", knobs left out), and whether each counts.
+std::vector<std::pair<std::string, bool>> failures(const std::string& point) {
+  std::vector<std::pair<std::string, bool>> out;
   std::stringstream ss(point);
-  for (std::string it; std::getline(ss, it, ',');) {
-    std::smatch m;
-    if (std::regex_match(it, m, item)) out.push_back({m[1], m[2], std::stoi(m[3])});
-  }
+  char program[32], op[64];
+  int use = 0;
+  for (std::string it; std::getline(ss, it, ',');)
+    if (sscanf(it.c_str(), "%31[a-z]/%63[a-zA-Z.]:%d", program, op, &use) == 3)
+      out.emplace_back(std::string(program) + "/" + op + ":" + std::to_string(use), counts(program, op));
   return out;
 }
 
 // The uses of a log ("<program> <pid> <operation> <use>[ fails]"): with a
 // scenario, the points of its counting run (the step's processes between
 // the marks, the server's from the step or its own start); else those that failed.
-std::set<Use> usesIn(const std::string& log, const Scenario* counting) {
-  std::set<Use> out;
+std::set<std::string> usesIn(const std::string& log, const Scenario* counting) {
+  std::set<std::string> out;
   bool inStep = false;
   for (const std::string& line : klptest::lines(log)) {
     if (line.rfind("mark ", 0) == 0) inStep = line == "mark step";
     std::stringstream ss(line);
-    Use u;
-    std::string pid, tail;
-    if (!(ss >> u.program >> pid >> u.op >> u.use)) continue;
+    std::string program, pid, op, use, tail;
+    if (!(ss >> program >> pid >> op >> use)) continue;
     bool fails = static_cast<bool>(ss >> tail) && tail == "fails";
     if (!counting ? fails
-                  : counted(u.program) && !timeDriven(u.op) &&
-                        (counting->serverFromStart ? u.program == "klpkcap" : inStep))
-      out.insert(u);
+                  : counts(program, op) && (counting->serverFromStart ? program == "klpkcap" : inStep))
+      out.insert(program + "/" + op + ":" + use);
   }
   return out;
 }
@@ -276,7 +242,7 @@ class FaultWalk : public ::testing::TestWithParam<Scenario> {};
 TEST_P(FaultWalk, EveryFailurePointEndsCleanly) {
   if (!hsvFaultCompiledIn()) GTEST_SKIP() << "built without KLP_FAULTS";
   const Scenario& sc = GetParam();
-  std::set<Use> points;
+  std::set<std::string> points;
   {
     klptest::TmpDir dir;
     Outcome o = runPoint(sc, "", dir, nullptr);
@@ -284,16 +250,15 @@ TEST_P(FaultWalk, EveryFailurePointEndsCleanly) {
     ASSERT_EQ(o.stepExit, 0) << o.output;
     points = usesIn(o.log, &sc);
   }
-  std::set<Use> listed;
+  std::set<std::string> listed;
   klptest::TmpDir sharedDir;
   std::unique_ptr<e2e::Server> shared;
   for (const Row& row : kRows) {
     if ((" " + std::string(row.scenarios) + " ").find(" " + std::string(sc.name) + " ") == std::string::npos)
       continue;
     for (const char* point : row.points) {
-      std::vector<Use> fail = failures(point);
+      auto fail = failures(point);
       ASSERT_FALSE(fail.empty()) << point;
-      listed.insert(fail.begin(), fail.end());
       bool share = sc.before.empty() && sc.after.empty() && !sc.serverFromStart &&
                    std::string(point).find("klpkcap/") == std::string::npos;
       if (share && !shared) {
@@ -314,12 +279,14 @@ TEST_P(FaultWalk, EveryFailurePointEndsCleanly) {
         EXPECT_EQ(o.output.find(want) == std::string::npos, absent)
             << where << (absent ? ": says \"" : ": no \"") << want << "\"\n" << o.output;
       }
-      std::set<Use> fired = usesIn(o.log, nullptr);
-      for (const Use& u : fail)
-        EXPECT_TRUE(timeDriven(u.op) || !counted(u.program) || fired.count(u)) << where << ": " << text(u) << " unreached";
+      std::set<std::string> fired = usesIn(o.log, nullptr);
+      for (const auto& [use, walked] : fail) {
+        listed.insert(use);
+        EXPECT_TRUE(!walked || fired.count(use)) << where << ": " << use << " unreached";
+      }
     }
   }
-  for (const Use& u : points) EXPECT_TRUE(listed.count(u)) << sc.name << ": no row walks " << text(u);
+  for (const std::string& u : points) EXPECT_TRUE(listed.count(u)) << sc.name << ": no row walks " << u;
   if (shared) {
     Outcome o;
     std::vector<int> pids;

@@ -1,9 +1,5 @@
-// The installed man pages and bash completion: pages that render without a
-// warning and name the values operators need, and completion that offers
-// the words of the right set.
-#include <string>
-#include <vector>
-
+// The installed man pages render without a warning and name the values
+// operators need; bash completion offers the words of the right set.
 #include "tests/install/install_support.h"
 
 using installtest::prefix;

@@ -4,8 +4,6 @@
 #include <unistd.h>
 
 #include <fstream>
-#include <string>
-#include <vector>
 
 #include "tests/install/install_support.h"
 
