@@ -64,7 +64,6 @@ class Server {
   std::string log() const { return klptest::readFile(logPath(dir_, name_)); }
   klptest::Background& proc() { return *proc_; }
   int pid() const { return proc_->pid(); }
-
  private:
   const klptest::TmpDir& dir_;
   std::string name_;
@@ -115,7 +114,6 @@ class RawClient {
   }
   bool receive(Reply* out) { return takeReply(reply_, out, 10000); }
   bool ask(int32_t func, Reply* out) { return sendBytes(request(func)) && receive(out); }
-
  private:
   HSVHIPCQueue server_, reply_;
   bool ok_ = false;

@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <future>
 #include <thread>
 
 #include "common/env/klpenv.h"
@@ -29,17 +30,6 @@ int testDbCheck(char* text, size_t len) {
   return g_dbRc;
 }
 
-std::string records(klptest::LogCapture& log) {
-  std::string text;
-  for (const auto& r : log.take()) text += (text.empty() ? "" : "\n") + r;
-  return text;
-}
-#define EXPECT_RECORDS(pattern, what)                                                      \
-  do {                                                                                     \
-    std::string got_ = records(log_);                                                      \
-    EXPECT_EQ(fnmatch(std::string(pattern).c_str(), got_.c_str(), 0), 0) << what << "\n" << got_; \
-  } while (0)
-
 class Engine : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -57,9 +47,8 @@ class Engine : public ::testing::Test {
     parms_ = std::make_unique<klpParmClass>(table.data(), static_cast<int>(table.size()), &rc);
     ASSERT_EQ(rc, 0);
     klpSetCurrentParms(parms_.get());
-    klpEnv* env = klpGetEnv();
-    klpEnvClear(env);
-    ASSERT_EQ(setEnvNamePrefix(env, "KCAP"), 0);
+    klpEnvClear(klpGetEnv());
+    ASSERT_EQ(setEnvNamePrefix(klpGetEnv(), "KCAP"), 0);
     program("klpkcap");
     g_dbRc = 0;
     cmdsSetDbStatusCheck(testDbCheck);
@@ -83,6 +72,13 @@ class Engine : public ::testing::Test {
       delete t->cmdList;
       delete t;
     }
+  }
+  // The records since the last look, one a line, against a fnmatch pattern.
+  template <typename What>
+  void expectRecords(const std::string& pattern, const What& what) {
+    std::string got;
+    for (const auto& r : log_.take()) got += (got.empty() ? "" : "\n") + r;
+    EXPECT_EQ(fnmatch(pattern.c_str(), got.c_str(), 0), 0) << what << "\n" << got;
   }
   static void program(const char* name) {
     snprintf(klpGetEnv()->programName, sizeof klpGetEnv()->programName, "%s", name);
@@ -176,7 +172,7 @@ TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
       EXPECT_EQ(std::string(got.payload.data() + 12) + "," + std::string(got.payload.data() + 32, 16),
                 "PruneThread," + std::string("BehinderWorker\0\0", 16));
     }
-    EXPECT_RECORDS(r.records, func);
+    expectRecords(r.records, func);
   }
   // The code went to the interested thread only; STOP set the caller's flag once.
   EXPECT_EQ((Ints{takeFunc(pruner), takeFunc(pruner), takeFunc(pruner), takeFunc(pruner)}),
@@ -222,7 +218,7 @@ TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
       EXPECT_EQ(now, r.after) << r.program << " " << r.index << "=" << r.value;
       EXPECT_EQ(parms_->peekSlot(r.index)->source, r.source) << r.index << "=" << r.value;
     }
-    EXPECT_RECORDS(r.records, r.value);
+    expectRecords(r.records, r.value);
   }
 }
 
@@ -267,7 +263,7 @@ TEST_F(Engine, OnePassOutcomes) {
     int32_t flag = 0;
     EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_ONE_PASS, &flag), r.rc) << r.program << " " << r.state;
     EXPECT_EQ(r.state == KLP_THREAD_STOP ? -1 : takeFunc(t), r.stopped ? kStop : -1) << r.program;
-    EXPECT_RECORDS(r.records, r.program);
+    expectRecords(r.records, r.program);
     EXPECT_EQ(erGetGlobalSignal(), 0);
     EXPECT_TRUE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));  // kept in one-pass mode
     clearThreads();
@@ -275,7 +271,7 @@ TEST_F(Engine, OnePassOutcomes) {
   delEnvIpcQRcvHdl(klpGetEnv());
   log_.take();
   EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_NORMAL, nullptr), 804);
-  EXPECT_RECORDS("589 cmdsEngine 1 cmdsEngine|804|getEnvIpcQRcvHdl", "no queue");
+  expectRecords("589 cmdsEngine 1 cmdsEngine|804|getEnvIpcQRcvHdl", "no queue");
 
   // The stop sequence's grace, by program name.
   for (auto [name, grace] : {std::pair{"xqapply", 180}, {"xqapplyZ", 180}, {"xqappl", 8}, {"apply", 8}}) {
@@ -287,18 +283,10 @@ TEST_F(Engine, OnePassOutcomes) {
 }
 
 // The loop in mode 0 on its own thread; the test thread plays the threads' part.
-struct LoopRun {
-  std::atomic<bool> done{false};
-  int rc = -1;
-  int32_t flag = 0;
-  std::thread runner;
-  explicit LoopRun(OrdList* threads)
-      : runner([this, threads] {
-          rc = cmdsEngine(threads, CMDS_MODE_NORMAL, &flag);
-          done = true;
-        }) {}
-  ~LoopRun() { runner.join(); }
-};
+std::future<int> loop(OrdList* threads, int32_t* flag) {
+  return std::async(std::launch::async, [=] { return cmdsEngine(threads, CMDS_MODE_NORMAL, flag); });
+}
+bool ended(std::future<int>& run) { return run.wait_for(std::chrono::seconds(0)) == std::future_status::ready; }
 
 // A database gone down starts the stop sequence (2006); once the threads have
 // stopped the loop ends with 929 and 534, and the server's queue goes.
@@ -307,15 +295,16 @@ TEST_F(Engine, ADatabaseThatGoesDownStopsTheServerWith929) {
   ASSERT_EQ(setEnvIpcQRcvHdl(klpGetEnv()), 0);
   log_.take();
   g_dbRc = 929;  // the first check comes after more than 4 seconds
+  int32_t flag = 0;
   {
-    LoopRun run(&threads_);
+    std::future<int> run = loop(&threads_, &flag);
     ASSERT_TRUE(e2e::waitFor([&] { return a->cmdList->count > 0; }, 15000));
     EXPECT_EQ(takeFunc(a), kStop);
     a->setState(KLP_THREAD_STOP);
-    EXPECT_TRUE(e2e::waitFor([&] { return run.done.load(); }, 15000));
-    EXPECT_EQ((Ints{run.rc, run.flag}), (Ints{929, 0}));
+    EXPECT_TRUE(e2e::waitFor([&] { return ended(run); }, 15000));
+    EXPECT_EQ((Ints{run.get(), flag}), (Ints{929, 0}));
   }
-  EXPECT_RECORDS("590 klpThread::stop 1 *|0|A\n534 cmdsEngine 1 ENG|DOWN\n595 Klpenv:delEnvIpcQRcvHdl 0 *",
+  expectRecords("590 klpThread::stop 1 *|0|A\n534 cmdsEngine 1 ENG|DOWN\n595 Klpenv:delEnvIpcQRcvHdl 0 *",
                  "database down");
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
 }
@@ -328,14 +317,15 @@ TEST_F(Engine, TheGraceOfAnApplyProgramWaitsForItsWorkerToRest) {
   klpThread* worker = addThread("WorkerThread", KLP_THREAD_RUN, {kStop});
   serverQueueWith(req(kStop));
   auto start = std::chrono::steady_clock::now();
+  int32_t flag = 0;
   {
-    LoopRun run(&threads_);
+    std::future<int> run = loop(&threads_, &flag);
     // Past the grace, still running: without the rule it would have ended.
     std::this_thread::sleep_for(std::chrono::milliseconds(10500));
-    EXPECT_FALSE(run.done.load());
+    EXPECT_FALSE(ended(run));
     worker->setState(KLP_THREAD_REST);
-    EXPECT_TRUE(e2e::waitFor([&] { return run.done.load(); }, 5000));
-    EXPECT_EQ((Ints{run.rc, run.flag}), (Ints{0, 1}));
+    EXPECT_TRUE(e2e::waitFor([&] { return ended(run); }, 5000));
+    EXPECT_EQ((Ints{run.get(), flag}), (Ints{0, 1}));
   }
   EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(9));
   e2e::Reply r;
@@ -371,7 +361,7 @@ TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
     for (e2e::Reply r; receive(&r, 0);) left.emplace_back(r.header.func, r.header.pieceNo);
     if (c.firstPiece) want.emplace_back(kStatus, 1);
     EXPECT_EQ(left, want) << c.threads;
-    EXPECT_RECORDS("508 cmdsEngine 1 (mqueue, /klpq.*, 48)\n589 cmdsEngine 1 cmdsEngine|805|HSVHIPCQueue::put\n"
+    expectRecords("508 cmdsEngine 1 (mqueue, /klpq.*, 48)\n589 cmdsEngine 1 cmdsEngine|805|HSVHIPCQueue::put\n"
                    "8999 cmdsEngine 1 *", c.threads);
   }
   freeIpcMsg(other);
@@ -386,7 +376,7 @@ TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
     EXPECT_EQ(takeFunc(taking), kPrune);
   }
   EXPECT_EQ(stuck->cmdList->count, 100);
-  EXPECT_RECORDS("8054 cmdsEngine 1 Stuck|100|22\n8054 cmdsEngine 1 Stuck|100|22", "cap");
+  expectRecords("8054 cmdsEngine 1 Stuck|100|22\n8054 cmdsEngine 1 Stuck|100|22", "cap");
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
   EXPECT_EQ((Ints{stuck->cmdList->count, taking->cmdList->count}), (Ints{101, 1}));
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);  // once stopping, nothing more is sent

@@ -15,17 +15,14 @@ using e2e::Server;
 
 namespace {
 
-constexpr int kStop = 14, kStatus = 15, kResume = 18, kSuspend = 19, kChgparms = 20, kReinitq = 23;
+constexpr int kStatus = 15, kResume = 18, kSuspend = 19, kChgparms = 20, kReinitq = 23;
 
-// Stops the server by STOP over the channel, or by a signal: it must end with 0 and take its queue.
-void stopCleanly(Server& s, RawClient* c, int sig = 0) {
-  Reply r;
-  if (sig != 0) s.proc().kill(sig);
-  else if (c->ask(kStop, &r)) EXPECT_EQ((Ints{r.header.func, r.header.msgLength}), (Ints{kStop, 44}));
-  else ADD_FAILURE() << "STOP was not answered";
-  EXPECT_EQ(s.proc().wait(30000).exitCode, 0) << sig << "\n" << s.log();
+// A signal ends the server with 0, its queue taken, and says so in its log (when given).
+void endsBy(int sig, Server& s, const std::string& logFile = "") {
+  s.proc().kill(sig);
+  EXPECT_EQ(s.proc().wait(30000).exitCode, 0) << sig;
   EXPECT_FALSE(klptest::queueExists(s.queue())) << sig;
-  if (sig) { EXPECT_NE(s.log().find("A global signal was received"), std::string::npos) << s.log(); }
+  EXPECT_TRUE(logFile.empty() || klptest::readFile(logFile).find("A global signal was received") != std::string::npos);
 }
 
 // True once a STATUS shows the admin thread resting and the workers in `workers` state.
@@ -44,46 +41,12 @@ bool statesBecome(RawClient& c, int32_t workers) {
 
 }  // namespace
 
-// SUSPEND reaches each worker through its own list; the admin thread carries on.
-TEST(KcapServer, StatusSuspendResumeAndStop) {
-  klptest::TmpDir dir;
-  Server s(dir, "ST1");
-  ASSERT_TRUE(s.ready()) << s.proc().err();
-  RawClient c(s.queue());
-  ASSERT_TRUE(c.ok());
-  ASSERT_TRUE(statesBecome(c, KLP_THREAD_REST));  // the queue comes before the workers settle
-  Reply r;
-  ASSERT_TRUE(c.ask(kSuspend, &r));
-  EXPECT_EQ(r.header.func, kSuspend);
-  ASSERT_TRUE(statesBecome(c, KLP_THREAD_WAIT));
-  ASSERT_TRUE(c.ask(kResume, &r));
-  ASSERT_TRUE(statesBecome(c, KLP_THREAD_REST));
-  stopCleanly(s, &c, SIGINT);
-}
-
-// A long working directory and two long values: QRYPARMS comes in pieces.
-TEST(KcapServer, AQueryLongerThanOneMessageReachesTheCommandProgramInPieces) {
-  klptest::TmpDir dir;
-  const std::string v(1000, 'v');
-  std::string path = dir.path();
-  for (int i = 0; i < 5; ++i) ASSERT_EQ(mkdir((path += std::string(200, 'p') + "/").c_str(), 0700), 0);
-  Server s(dir, "LNG", {"CAPTURE_PATH=" + path, "CAP_DBNAME=D" + v, "COMPATIBILITY=C" + v});
-  ASSERT_TRUE(s.ready());
-  klptest::ProcessResult pr = klptest::run({klptest::binPath("klpkccmd"), "CAPTURE_SERVER=LNG", "QRYPARMS"});
-  EXPECT_EQ(pr.exitCode, 0) << pr.out;
-  for (const std::string& want : {"\"COMPATIBILITY\" has the value \"C" + v.substr(900),
-                                  "\"CAP_DBNAME\" has the value \"D" + v.substr(900),
-                                  std::string("\"CAPTURE_SERVER\" has the value \"LNG\"")})
-    EXPECT_NE(pr.out.find(want), std::string::npos) << want << "\n" << pr.out;
-  RawClient c(s.queue());
-  stopCleanly(s, &c);
-}
-
 // Shorter than a header, lengths that lie and a foreign eye-catcher get no
 // answer; a queue name of the largest size without NUL reaches its thread,
 // cut; a CHGPARMS value without NUL, longer than any parameter, is echoed
 // whole. A STATUS: 12 header bytes, a record per thread and room for one more.
-TEST(KcapServer, GarbageOnTheQueueNeitherCrashesNorHangsIt) {
+// SUSPEND then reaches each worker through its own list; the admin thread carries on.
+TEST(KcapServer, GarbageNeitherCrashesNorHangsItAndSuspendResumeReachTheWorkers) {
   klptest::TmpDir dir;
   Server s(dir, "GAR");
   ASSERT_TRUE(s.ready());
@@ -104,10 +67,33 @@ TEST(KcapServer, GarbageOnTheQueueNeitherCrashesNorHangsIt) {
     ASSERT_TRUE(func != kStatus ? c.receive(&r) : c.ask(kStatus, &r));
     EXPECT_EQ((Ints{r.header.func, r.header.msgLength}), (Ints{func, length}));
   }
+  EXPECT_EQ(r.header.senderPid, s.pid());
   EXPECT_TRUE(e2e::waitFor([&] { return s.log().find("reinitialized the send queue \"QQQQ") != std::string::npos; },
                            10000));
-  EXPECT_EQ(r.header.senderPid, s.pid());
-  stopCleanly(s, &c, SIGTERM);
+  ASSERT_TRUE(statesBecome(c, KLP_THREAD_REST));  // the queue comes before the workers settle
+  ASSERT_TRUE(c.ask(kSuspend, &r));
+  EXPECT_EQ(r.header.func, kSuspend);
+  ASSERT_TRUE(statesBecome(c, KLP_THREAD_WAIT));
+  ASSERT_TRUE(c.ask(kResume, &r));
+  ASSERT_TRUE(statesBecome(c, KLP_THREAD_REST));
+  endsBy(SIGTERM, s, e2e::logPath(dir, "GAR"));
+}
+
+// A long working directory and two long values: QRYPARMS comes in pieces.
+TEST(KcapServer, AQueryLongerThanOneMessageReachesTheCommandProgramInPieces) {
+  klptest::TmpDir dir;
+  const std::string v(1000, 'v');
+  std::string path = dir.path();
+  for (int i = 0; i < 5; ++i) ASSERT_EQ(mkdir((path += std::string(200, 'p') + "/").c_str(), 0700), 0);
+  Server s(dir, "LNG", {"CAPTURE_PATH=" + path, "CAP_DBNAME=D" + v, "COMPATIBILITY=C" + v});
+  ASSERT_TRUE(s.ready());
+  klptest::ProcessResult pr = klptest::run({klptest::binPath("klpkccmd"), "CAPTURE_SERVER=LNG", "QRYPARMS"});
+  EXPECT_EQ(pr.exitCode, 0) << pr.out;
+  for (const std::string& want : {"\"COMPATIBILITY\" has the value \"C" + v.substr(900),
+                                  "\"CAP_DBNAME\" has the value \"D" + v.substr(900),
+                                  std::string("\"CAPTURE_SERVER\" has the value \"LNG\"")})
+    EXPECT_NE(pr.out.find(want), std::string::npos) << want << "\n" << pr.out;
+  endsBy(SIGINT, s);
 }
 
 // 170 + ".KLP.KCAP" is more than the name prefix's 160 characters.

@@ -169,6 +169,9 @@ struct Outcome {
   std::string output;               // the step's and the server's
   std::vector<std::string> faults;  // crashes, hangs and leftovers
   std::string log;                  // the uses
+  void took(const klptest::ProcessResult& r, const std::string& who) {
+    if (r.timedOut || r.signal != 0) faults.push_back(who + (r.timedOut ? " did not end" : " ended by signal " + std::to_string(r.signal)));
+  }
 };
 
 std::unique_ptr<e2e::Server> startServer(const klptest::TmpDir& dir, const std::string& spec) {
@@ -185,8 +188,7 @@ void stopServer(e2e::Server& server, const klptest::TmpDir& dir, Outcome* o, std
   }
   klptest::ProcessResult r = server.proc().wait(30000);
   o->serverExit = r.exitCode;
-  if (r.timedOut) o->faults.push_back("the server did not end");
-  if (r.signal != 0) o->faults.push_back("the server ended by signal " + std::to_string(r.signal));
+  o->took(r, "the server");
   o->output += r.out + r.err + server.log();
 }
 
@@ -221,8 +223,7 @@ Outcome runPoint(const Scenario& sc, const std::string& spec, const klptest::Tmp
     std::ofstream(logPath, std::ios::app) << "mark end\n";
     o.stepExit = r.exitCode;
     o.output = r.out + r.err;
-    if (r.timedOut) o.faults.push_back("the step did not end");
-    if (r.signal != 0) o.faults.push_back("the step ended by signal " + std::to_string(r.signal));
+    o.took(r, "the step");
     for (const auto& cmd : sc.after) runStep(cmd, "sleep=100");
   }
   if (!shared) {
