@@ -12,11 +12,13 @@ int main(int argc, char **argv)
     klpStatusRequest req;
     klpStatusFmt3 st;
     klpResultBlock result;
+    int rc;
 
     memset(&req, 0, sizeof req);
     memset(&st, 0, sizeof st);
     if (argc < 2) {
-        printf("size %d %d\n", klpGetStatusSize(&rel, &req, &result), req.statusSize);
+        rc = klpGetStatusSize(&rel, &req, &result);
+        printf("size %d %d\n", rc, req.statusSize);
         return 0;
     }
     strcpy(req.serverName, argv[1]);
