@@ -1,5 +1,4 @@
-// End-to-end helpers: a sample server under the test's TMPDIR, and a raw
-// client that can put any bytes on the server's queue.
+// End-to-end helpers: a sample server under the test's TMPDIR, and a raw client putting any bytes on its queue.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -87,8 +86,7 @@ inline bool takeReply(HSVHIPCQueue& q, Reply* out, int timeoutMs) {
   return true;
 }
 
-// A client speaking the channel byte by byte; its reply queue
-// "<server queue>.CMD<pid>" (unless withReply is false) lives with it.
+// A client speaking the channel byte by byte; its reply queue "<server queue>.CMD<pid>" lives with it.
 class RawClient {
  public:
   explicit RawClient(const std::string& serverQueue, bool withReply = true) {

@@ -1,5 +1,4 @@
-// The command engine in this process, with thread objects that run no OS
-// thread: what each received is looked at directly, what it logs recorded.
+// The command engine in this process, with thread objects that run no OS thread, its log recorded.
 #include <fnmatch.h>
 
 #include <atomic>
@@ -127,8 +126,7 @@ std::vector<char> req(int32_t func, int32_t subFunc = 0, int32_t pid = getpid(),
   return m;
 }
 
-// Each request's answer and log; codes 60 to 62 are the interested thread's
-// to answer, TRCSTART with sub-function 1 (the trace-on notice) nobody's.
+// Each request's answer and log; 60 to 62 are the thread's to answer, TRCSTART 1 (trace-on notice) nobody's.
 TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
   klpThread* pruner = addThread("PruneThread", KLP_THREAD_REST, {kPrune, kStop});
   addThread("BehinderWorkerThread", KLP_THREAD_DBWAIT);  // cut to 14 characters
@@ -180,8 +178,7 @@ TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
   EXPECT_EQ((Ints{stopFlag_, st_.stopping}), (Ints{1, 1}));
 }
 
-// A value changes a changeable parameter by its type; the request is echoed
-// either way. An "xqapply" program may not set flag 18 while text 34 is set.
+// A changeable parameter changes by its type, echoed either way; "xqapply" may not set 18 while 34 is set.
 TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
   const struct {
     const char* program;
@@ -222,8 +219,7 @@ TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
   }
 }
 
-// One pass (mode 2): supervision, stop sequence, signal, result. 415 (threads
-// alive, none critical) stops a server unless, in one pass, flag 5 is not set;
+// One pass (mode 2): 415 (threads alive, none critical) stops a server unless flag 5 is not set;
 // an "xqapply" program stops only when its flag 18 or text 34 says so.
 TEST_F(Engine, OnePassOutcomes) {
   const std::string rrs = "590 klpThread::stop 1 *|952|Ended\n534 cmdsEngine 1 ENG|RRS NOT AVAILABLE";
@@ -288,8 +284,7 @@ std::future<int> loop(OrdList* threads, int32_t* flag) {
 }
 bool ended(std::future<int>& run) { return run.wait_for(std::chrono::seconds(0)) == std::future_status::ready; }
 
-// A database gone down starts the stop sequence (2006); once the threads have
-// stopped the loop ends with 929 and 534, and the server's queue goes.
+// A database gone down starts the stop sequence (2006); then 929 and 534, and the server's queue goes.
 TEST_F(Engine, ADatabaseThatGoesDownStopsTheServerWith929) {
   klpThread* a = addThread("A", KLP_THREAD_REST);
   ASSERT_EQ(setEnvIpcQRcvHdl(klpGetEnv()), 0);
@@ -309,8 +304,7 @@ TEST_F(Engine, ADatabaseThatGoesDownStopsTheServerWith929) {
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
 }
 
-// An "apply" program's grace ends only while its WorkerThread rests: one at
-// work holds the loop past the 8 s. Such a program checks no database.
+// An "apply" program's grace ends only while its WorkerThread rests; it checks no database.
 TEST_F(Engine, TheGraceOfAnApplyProgramWaitsForItsWorkerToRest) {
   program("applyX");
   g_dbRc = 929;
@@ -335,8 +329,7 @@ TEST_F(Engine, TheGraceOfAnApplyProgramWaitsForItsWorkerToRest) {
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
 }
 
-// A requester whose reply queue is full is dropped, not waited for: the first
-// piece goes only with room at once, the rest of a long reply gets little time.
+// A requester whose reply queue is full is dropped: a first piece goes only with room at once.
 TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
   const struct {
     int waiting, threads;

@@ -1,5 +1,4 @@
-// The sample server and its command engine, driven over the real queues by a
-// raw client, the command program and the exported control interface.
+// The sample server over the real queues: a raw client, the command program, the control interface.
 #include <sys/stat.h>
 
 #include "common/env/klpenv.h"
@@ -41,11 +40,7 @@ bool statesBecome(RawClient& c, int32_t workers) {
 
 }  // namespace
 
-// Shorter than a header, lengths that lie and a foreign eye-catcher get no
-// answer; a queue name of the largest size without NUL reaches its thread,
-// cut; a CHGPARMS value without NUL, longer than any parameter, is echoed
-// whole. A STATUS: 12 header bytes, a record per thread and room for one more.
-// SUSPEND then reaches each worker through its own list; the admin thread carries on.
+// Garbage gets no answer; values without NUL are cut or echoed whole; SUSPEND reaches the workers only.
 TEST(KcapServer, GarbageNeitherCrashesNorHangsItAndSuspendResumeReachTheWorkers) {
   klptest::TmpDir dir;
   Server s(dir, "GAR");

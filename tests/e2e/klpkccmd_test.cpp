@@ -1,5 +1,4 @@
-// The command program against the sample server: real processes, each test
-// under its own TMPDIR, nothing left behind.
+// The command program against the sample server: real processes, nothing left behind.
 #include <sys/resource.h>
 
 #include <chrono>
@@ -76,9 +75,7 @@ TEST(Klpkccmd, EveryCommandWordSucceedsAndClientsAtOnceGetTheirOwnReplies) {
   stopServer(dir, s, "ALL");
 }
 
-// Without a server the attach is tried five times (8 s, waited for once, by
-// all runs at once): STATUS ends with 12 like any command; the detailed
-// status gives the short report without claiming the server is up.
+// No server: five attaches (8 s, waited for once by all runs), exit 12, a short report without "up".
 TEST(Klpkccmd, WithoutAServerStatusEndsWith12) {
   klptest::TmpDir dir;
   const std::string longName(140, 'L');  // cut to the request's 128 it would name another server
@@ -88,7 +85,7 @@ TEST(Klpkccmd, WithoutAServerStatusEndsWith12) {
   klptest::ProcessResult st = ended(dir, "NOBODY", *status), det = ended(dir, "NOBODY", *details);
   EXPECT_GE(std::chrono::steady_clock::now() - began, std::chrono::milliseconds(4 * 2001));  // four pauses
   EXPECT_EQ(st.exitCode, 12) << st.out;
-  for (const std::string& want : {std::string("KLP0506E"), std::string("KLP0597E"), e2e::serverQueuePath(dir, "NOBODY")})
+  for (const std::string& want : {std::string("KLP0506E"), std::string("KLP0597E"), dir.path() + "NOBODY.KLP.KCAP.IPC"})
     EXPECT_TRUE(has(st.out, want)) << want << "\n" << st.out;
   for (auto [r, server, code] : {std::tuple{&det, std::string("NOBODY"), "\"2013\""}, {&cut, longName, "\"2009\""}}) {
     EXPECT_EQ(r->exitCode, 12) << r->out;
@@ -100,9 +97,7 @@ TEST(Klpkccmd, WithoutAServerStatusEndsWith12) {
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir, "NOBODY")));
 }
 
-// A killed server's queue takes the requests and nobody answers (30 s,
-// waited for once, by both runs at once): STATUS ends with 12, the detailed
-// status says the server did not answer. A new server replaces the queue.
+// A killed server's queue: no answer (30 s, waited for once by both runs), exit 12; a new server replaces it.
 TEST(Klpkccmd, AServerKilledBeforeItAnswersEndsInNoReplyAndAnotherReplacesIt) {
   klptest::TmpDir dir;
   {
@@ -131,9 +126,7 @@ TEST(Klpkccmd, AServerKilledBeforeItAnswersEndsInNoReplyAndAnotherReplacesIt) {
   stopServer(dir, second, "GONE");
 }
 
-// A signal while it waits for the reply: INT and TERM return to the recovery
-// point, which reports it and ends with 12; the others end it by their
-// default action once the reply queue is destroyed.
+// A signal while waiting: INT and TERM end with 12 at the recovery point, others by default, reply queue gone.
 TEST(Klpkccmd, ASignalWhileItWaitsDestroysItsReplyQueue) {
   const struct rlimit noCore = {0, 0};
   setrlimit(RLIMIT_CORE, &noCore);  // SIGQUIT's default action dumps core

@@ -1,6 +1,4 @@
-// The fault-injecting layer in one process: which uses its texts make fail,
-// the texts it refuses, its allocator, and the library loaders' failure
-// points, which no scenario of the walk reaches.
+// The fault-injecting layer: its texts, its allocator, and the loaders' points the walk cannot reach.
 #include <cerrno>
 #include <new>
 #include <cstdio>
@@ -17,8 +15,7 @@ struct Disarm {
   ~Disarm() { hsvFaultArm(nullptr); }
 };
 
-// What four resource-id lookups in a row answer under a text: '.' for
-// success, 'F' for the operation's own code, 'L' for ECF_LIMIT_REACHED.
+// Four resource-id lookups under a text: '.' success, 'F' the operation's code, 'L' ECF_LIMIT_REACHED.
 std::string lookups(const std::string& spec) {
   if (!hsvFaultArm(spec.c_str())) return "refused";
   std::string seen;
@@ -78,8 +75,7 @@ TEST(FaultLayer, PlatformObjectsComeFromAnAllocatorThatCanFail) {
   EXPECT_EQ(hsvFaultUses(HSV_FAULT_ALLOC), 4u);
 }
 
-// The loaders under a failing load, lookup or allocation, each in a child
-// of its own: their state is process-wide.
+// The loaders under a failing load, lookup or allocation, each in a child: their state is process-wide.
 TEST(FaultLayer, LibraryLoadersReportTheirFailures) {
   if (!hsvFaultCompiledIn()) GTEST_SKIP() << "built without KLP_FAULTS";
   const struct {
@@ -117,8 +113,7 @@ TEST(FaultLayer, LibraryLoadersReportTheirFailures) {
   }
 }
 
-// A server whose every get fails while a request waits on its queue keeps
-// looping, reporting once; it must pause between passes, not spin a core.
+// A server whose every get fails must pause between passes, not spin a core.
 TEST(FaultLayer, AServerWhoseGetsFailDoesNotSpin) {
   if (!hsvFaultCompiledIn()) GTEST_SKIP() << "built without KLP_FAULTS";
   klptest::TmpDir dir;

@@ -1,7 +1,5 @@
-// Walks every failure point of the platform layer (each use of each call, found
-// by a counting run) under real processes: STATUS, CHGPARMS, klptrc on, fmt and
-// off, a server's start and stop. Each must show its text and exit codes, and
-// nothing may crash, hang or be left behind.
+// Every failure point (each use of each platform call, found by a counting run) of STATUS, CHGPARMS,
+// klptrc on/fmt/off, a server's start and stop: its texts and exits; no crash, hang or leftover.
 #include <sys/stat.h>
 
 #include <cstdio>
@@ -38,10 +36,8 @@ const Scenario kScenarios[] = {
     {"ServerStartStop", {}, {"klpkccmd", "STOP"}, {}, true, "KLP0595I"},
 };
 
-// Points of some scenarios with one outcome. A point is the KLP_TEST_FAULTS
-// text of every process of the run ("program/operation:use", and knobs such
-// as the client's wait when no answer comes). The texts are looked for in the
-// step's output and the server's log ("!": must not be there; kDone: the scenario's own).
+// Points (KLP_TEST_FAULTS texts: "program/operation:use" and knobs) with one outcome; the texts are
+// looked for in the step's output and the server's log ("!": must be absent; kDone: the scenario's own).
 struct Row {
   const char* scenarios;
   std::vector<const char*> points;
@@ -114,8 +110,7 @@ const Row kRows[] = {
 };
 // clang-format on
 
-// Uses that follow the clock, not the command, and the keeper's second process
-// (it holds the block on its own clock): walked at their first use, not required to be reached.
+// Uses that follow the clock, as the keeper's second process does, need not be reached.
 bool counts(const std::string& program, const std::string& op) {
   return program != "klptrcbp" && op != "queue.hasMessage" && op != "queue.waitForMessage" && op != "waitpost.wait";
 }
@@ -132,9 +127,8 @@ std::vector<std::pair<std::string, bool>> failures(const std::string& point) {
   return out;
 }
 
-// The uses of a log ("<program> <pid> <operation> <use>[ fails]"): with a
-// scenario, the points of its counting run (the step's processes between
-// the marks, the server's from the step or its own start); else those that failed.
+// Uses logged ("<program> <pid> <operation> <use>[ fails]"): a counting run's points (between the marks,
+// or the server's from its start), or else those that failed.
 std::set<std::string> usesIn(const std::string& log, const Scenario* counting) {
   std::set<std::string> out;
   bool inStep = false;
@@ -170,7 +164,8 @@ struct Outcome {
   std::vector<std::string> faults;  // crashes, hangs and leftovers
   std::string log;                  // the uses
   void took(const klptest::ProcessResult& r, const std::string& who) {
-    if (r.timedOut || r.signal != 0) faults.push_back(who + (r.timedOut ? " did not end" : " ended by signal " + std::to_string(r.signal)));
+    if (r.timedOut || r.signal != 0)
+      faults.push_back(who + (r.timedOut ? " did not end" : " ended by signal " + std::to_string(r.signal)));
   }
 };
 
@@ -200,8 +195,7 @@ bool memoryLeft(const std::string& path) {
          stat((std::string("/dev/shm") + id.posixName()).c_str(), &st) == 0;
 }
 
-// Runs the scenario with spec handed to every process; against a shared
-// server, when given, which is left running.
+// Runs the scenario with spec handed to every process, against a shared server when given.
 Outcome runPoint(const Scenario& sc, const std::string& spec, const klptest::TmpDir& dir, e2e::Server* shared) {
   Outcome o;
   const std::string logPath = dir.path() + "uses.log";
@@ -231,7 +225,7 @@ Outcome runPoint(const Scenario& sc, const std::string& spec, const klptest::Tmp
     if (klptest::queueExists(server.queue())) o.faults.push_back("the server's queue was left");
   }
   for (int pid : clientPids)
-    if (klptest::queueExists(server.queue() + ".CMD" + std::to_string(pid))) o.faults.push_back("a reply queue was left");
+    if (klptest::queueExists(server.queue() + ".CMD" + std::to_string(pid))) o.faults.push_back("a reply queue left");
   if (memoryLeft(dir.path() + kServer + ".KLP.KCAP.TRC")) o.faults.push_back("the trace block was left");
   o.log = klptest::readFile(logPath);
   std::remove(logPath.c_str());

@@ -27,13 +27,12 @@ TEST(ManPages, RenderWithoutWarningsAndListTheValues) {
 }
 
 TEST(Completion, OffersTheWordsOfTheRightSet) {
-  // COMP_WORDS as bash splits the line: at blanks and around "=", so that
-  // "X=" is X and "=", and an empty last word follows a blank. The last word
-  // is the one completed; want is the exact answer, sorted.
+  // COMP_WORDS as bash splits the line ("X=" is X and "="); the last word is completed; answers sorted.
   const std::string dir = installtest::tmp().path();
   ASSERT_EQ(shell("touch " + dir + "trace.trc").exitCode, 0);
   const std::vector<std::pair<std::vector<std::string>, std::string>> cases = {
-      {{"klpkccmd", "st"}, "STARTQ= STATUS STOP STOPQ="}, {{"klpkccmd", "capture_s"}, "CAPTURE_SCHEMA= CAPTURE_SERVER="},
+      {{"klpkccmd", "st"}, "STARTQ= STATUS STOP STOPQ="},
+      {{"klpkccmd", "capture_s"}, "CAPTURE_SCHEMA= CAPTURE_SERVER="},
       {{"klpkccmd", "STOP", "s"}, ""}, {{"klpkccmd", "LOGSTDOUT", "="}, "N Y"}, {{"klpkccmd", "status", "s"}, "SHOW"},
       {{"klpkccmd", "STATUS", "SHOW", ""}, "DETAILS"},
       {{"klpkccmd", "CHGPARMS", "S"}, "SIGNAL_LIMIT= SLEEP_INTERVAL= STALE="},

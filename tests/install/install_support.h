@@ -21,8 +21,7 @@ inline klptest::ProcessResult shell(const std::string& line, const std::vector<s
   return klptest::run({"/bin/sh", "-c", line}, env, 120000);
 }
 
-// `cmake --install` of the build into a new directory under tmp(), once per
-// process; the directory, without a trailing "/".
+// `cmake --install` of the build into a new directory under tmp(), once per process; no trailing "/".
 inline const std::string& prefix() {
   static const std::string dir = [] {
     std::string d = tmp().path() + "prefix";
@@ -33,9 +32,7 @@ inline const std::string& prefix() {
   return dir;
 }
 
-// argv in a private mount namespace where empty file systems cover the build
-// and source trees, run from dir without KLP_CATALOG_DIR or LD_LIBRARY_PATH:
-// what the program needs must come from where it was installed.
+// argv run from dir with the build and source trees covered and no KLP_CATALOG_DIR or LD_LIBRARY_PATH.
 inline std::vector<std::string> hidden(const std::string& dir, const std::vector<std::string>& argv) {
   std::vector<std::string> v = {KLP_UNSHARE, "-rm", "/bin/sh", "-c",
                                 "mount -t tmpfs none \"$1\" && mount -t tmpfs none \"$2\" && cd \"$3\" && "

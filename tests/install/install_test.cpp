@@ -1,6 +1,4 @@
-// The installed tree and the Debian package: every piece where an operator
-// looks for it, the programs running from the prefix alone, and a program of
-// the operator's own built against the installed header and library.
+// The installed tree and package: every piece in place, programs running from the prefix alone, an own program.
 #include <unistd.h>
 
 #include <fstream>
@@ -86,7 +84,8 @@ TEST(Install, OwnProgramBuildsFromPkgConfigAndFindPackage) {
   const std::string proj = dir + "proj/";
   ASSERT_EQ(shell("mkdir -p " + proj + " && cp " + src + " " + proj).exitCode, 0);
   std::ofstream(proj + "CMakeLists.txt") << "cmake_minimum_required(VERSION 3.20)\nproject(own C)\n"
-      "find_package(klp 9 REQUIRED)\nadd_executable(bycmake status_client.c)\ntarget_link_libraries(bycmake klp::klp)\n";
+      "find_package(klp 9 REQUIRED)\nadd_executable(bycmake status_client.c)\n"
+      "target_link_libraries(bycmake klp::klp)\n";
   ProcessResult cm = shell(std::string(KLP_CMAKE) + " -S " + proj + " -B " + proj + "b -DCMAKE_PREFIX_PATH=" +
                            prefix() + " \"-DCMAKE_C_FLAGS=" + KLP_SANITIZE_FLAGS + "\" >/dev/null && " +
                            KLP_CMAKE + " --build " + proj + "b");
