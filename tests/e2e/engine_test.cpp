@@ -371,6 +371,7 @@ TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
   EXPECT_EQ(stuck->cmdList->count, 100);
   expectRecords("8054 cmdsEngine 1 Stuck|100|22\n8054 cmdsEngine 1 Stuck|100|22", "cap");
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
+  EXPECT_EQ(threads_.unlockList(), 1005);  // the stop sequence let go of the thread list
   EXPECT_EQ((Ints{stuck->cmdList->count, taking->cmdList->count}), (Ints{101, 1}));
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);  // once stopping, nothing more is sent
   EXPECT_EQ(taking->cmdList->count, 1);
