@@ -1,18 +1,14 @@
-// Helpers of the end-to-end tests: a sample server under the test's own
-// TMPDIR, a raw command-channel client that can put any bytes on the
-// server's queue, and readers of the replies.
+// End-to-end helpers: a sample server under the test's TMPDIR, and a raw client putting any bytes on its queue.
 #pragma once
 
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstring>
 #include <map>
 #include <memory>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "common/ipc/ipcmsg.h"
@@ -22,6 +18,7 @@
 namespace e2e {
 
 using Ints = std::vector<int32_t>;
+using klptest::waitFor;
 
 inline std::string serverQueuePath(const klptest::TmpDir& dir, const std::string& server) {
   return dir.path() + server + ".KLP.KCAP.IPC";
@@ -33,15 +30,6 @@ inline std::string logPath(const klptest::TmpDir& dir, const std::string& server
   return dir.path() + server + ".KLP.KCAP.log";
 }
 
-// Polls cond every 10 ms for at most timeoutMs.
-template <typename F>
-bool waitFor(F cond, int timeoutMs) {
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
-  for (; !cond(); std::this_thread::sleep_for(std::chrono::milliseconds(10)))
-    if (std::chrono::steady_clock::now() >= deadline) return false;
-  return true;
-}
-
 // Creates (or attaches to) the queue at path; false when that fails.
 inline bool openQueue(HSVHIPCQueue& q, const std::string& path, bool create) {
   HSVResID id;
@@ -49,25 +37,25 @@ inline bool openQueue(HSVHIPCQueue& q, const std::string& path, bool create) {
   return (create ? q.create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION) : q.attach(id)) == ECF_OK;
 }
 
-// One klpkcap process serving `name` in the directory's TMPDIR, logging there.
+// One klpkcap process serving `name` in the directory, logging there.
 class Server {
  public:
-  Server(const klptest::TmpDir& dir, const std::string& name, const std::vector<std::string>& extraArgs = {})
+  Server(const klptest::TmpDir& dir, const std::string& name, const std::vector<std::string>& extraArgs = {},
+         const std::vector<std::string>& env = {})
       : dir_(dir), name_(name) {
     std::vector<std::string> argv = {klptest::binPath("klpkcap"), "CAPTURE_SERVER=" + name,
                                      "CAPTURE_PATH=" + dir.path()};
     argv.insert(argv.end(), extraArgs.begin(), extraArgs.end());
-    proc_ = std::make_unique<klptest::Background>(argv);
+    proc_ = std::make_unique<klptest::Background>(argv, env);
   }
-  // A server a failed test left running is asked to stop, so that it
-  // removes its queue; only one that does not react is killed.
+  // One a failed test left running is asked to stop, so that it removes its queue.
   ~Server() {
     if (!proc_->running()) return;
     proc_->kill(SIGCONT);
     proc_->kill(SIGTERM);
     proc_->wait(15000);
   }
-  // True once the receiving queue exists.
+  // True once the receiving queue exists; false when the server ended first.
   bool ready() {
     return waitFor([&] { return klptest::queueExists(queue()) || !proc_->running(); }, 20000) && proc_->running();
   }
@@ -75,7 +63,6 @@ class Server {
   std::string log() const { return klptest::readFile(logPath(dir_, name_)); }
   klptest::Background& proc() { return *proc_; }
   int pid() const { return proc_->pid(); }
-
  private:
   const klptest::TmpDir& dir_;
   std::string name_;
@@ -84,7 +71,7 @@ class Server {
 
 struct Reply {
   IpcMsg header{};
-  std::vector<char> payload, raw;
+  std::vector<char> payload;
 };
 
 // Takes one message from q, waiting at most timeoutMs.
@@ -95,14 +82,11 @@ inline bool takeReply(HSVHIPCQueue& q, Reply* out, int timeoutMs) {
       got < IPC_HEADER_SIZE)
     return false;
   memcpy(&out->header, buf, IPC_HEADER_SIZE);
-  out->raw.assign(buf, buf + got);
   out->payload.assign(buf + IPC_HEADER_SIZE, buf + got);
   return true;
 }
 
-// A client that speaks the channel byte by byte: its reply queue is
-// "<server queue>.CMD<this process id>", made on construction (unless
-// withReply is false) and destroyed on destruction.
+// A client speaking the channel byte by byte; its reply queue "<server queue>.CMD<pid>" lives with it.
 class RawClient {
  public:
   explicit RawClient(const std::string& serverQueue, bool withReply = true) {
@@ -128,7 +112,6 @@ class RawClient {
   }
   bool receive(Reply* out) { return takeReply(reply_, out, 10000); }
   bool ask(int32_t func, Reply* out) { return sendBytes(request(func)) && receive(out); }
-
  private:
   HSVHIPCQueue server_, reply_;
   bool ok_ = false;
@@ -138,18 +121,6 @@ inline int32_t rd32(const std::vector<char>& p, size_t at) {
   int32_t v = 0;
   if (at + 4 <= p.size()) memcpy(&v, p.data() + at, 4);
   return v;
-}
-
-// Thread records of a STATUS reply: name -> state.
-inline std::map<std::string, int32_t> threadStates(const Reply& r) {
-  std::map<std::string, int32_t> out;
-  for (int32_t i = 0; i < rd32(r.payload, 8); ++i) {
-    size_t at = IPC_STATUS_HEADER + IPC_STATUS_RECORD * static_cast<size_t>(i);
-    if (at + IPC_STATUS_RECORD > r.payload.size()) break;
-    out[std::string(r.payload.data() + at, strnlen(r.payload.data() + at, IPC_STATUS_NAME))] =
-        rd32(r.payload, at + IPC_STATUS_NAME);
-  }
-  return out;
 }
 
 inline size_t countOf(const std::string& text, const std::string& what) {

@@ -1,22 +1,13 @@
-// The command engine inside this process: requests handed to its
-// per-message step and to the loop itself, with thread objects that run no
-// OS thread, so that what each thread received can be looked at directly,
-// and every message it logs is recorded.
+// The command engine in this process, with thread objects that run no OS thread, its log recorded.
 #include <fnmatch.h>
-#include <signal.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <chrono>
-#include <cstring>
-#include <memory>
-#include <string>
+#include <future>
 #include <thread>
-#include <vector>
 
 #include "common/env/klpenv.h"
 #include "common/ipc/cmdsengine.h"
-#include "common/ipc/ipcmsg.h"
 #include "common/parms/klpparm.h"
 #include "common/thread/klpthread.h"
 #include "common/thread/ordlist.h"
@@ -25,11 +16,11 @@
 
 namespace {
 
+using e2e::Ints;
 using e2e::RawClient;
 constexpr int kStop = 14, kStatus = 15, kChgparms = 20, kPrune = 22;
-// The parameters whose roles the engine knows: 5 ends a one-pass server
-// without critical threads, and in an "xqapply" program 18 (a flag) and 34
-// (a text) decide both that and whether 18 may be set.
+// Roles the engine knows: 5 ends a one-pass server without critical threads;
+// in an "xqapply" program flag 18 and text 34 decide that and whether 18 may be set.
 constexpr int kTerm = 5, kApplyFlag = 18, kApplyText = 34, kInterval = 30, kPath = 7;
 
 int g_dbRc = 0;
@@ -38,23 +29,11 @@ int testDbCheck(char* text, size_t len) {
   return g_dbRc;
 }
 
-std::string records(klptest::LogCapture& log) {
-  std::string text;
-  for (const auto& r : log.take()) text += (text.empty() ? "" : "\n") + r;
-  return text;
-}
-#define EXPECT_RECORDS(pattern, what)                                                      \
-  do {                                                                                     \
-    std::string got_ = records(log_);                                                      \
-    EXPECT_EQ(fnmatch(std::string(pattern).c_str(), got_.c_str(), 0), 0) << what << "\n" << got_; \
-  } while (0)
-
 class Engine : public ::testing::Test {
  protected:
   void SetUp() override {
     if (klpMainThread()->getState() == KLP_THREAD_EXIST) klpThread::prologue(klpMainThread());
-    // The roles above, a server name and schema for the prefix, and one
-    // parameter that may not change while the server runs.
+    // The roles above, server name and schema, and one parameter fixed while the server runs.
     std::vector<ParmEntry> table;
     for (int i = 0; i <= kApplyText; ++i) {
       const char* text = i == 0 ? "ENG" : i == 2 ? "KLP" : i == kPath ? "/p" : i == kApplyText ? "" : nullptr;
@@ -67,9 +46,8 @@ class Engine : public ::testing::Test {
     parms_ = std::make_unique<klpParmClass>(table.data(), static_cast<int>(table.size()), &rc);
     ASSERT_EQ(rc, 0);
     klpSetCurrentParms(parms_.get());
-    klpEnv* env = klpGetEnv();
-    klpEnvClear(env);
-    ASSERT_EQ(setEnvNamePrefix(env, "KCAP"), 0);
+    klpEnvClear(klpGetEnv());
+    ASSERT_EQ(setEnvNamePrefix(klpGetEnv(), "KCAP"), 0);
     program("klpkcap");
     g_dbRc = 0;
     cmdsSetDbStatusCheck(testDbCheck);
@@ -94,12 +72,18 @@ class Engine : public ::testing::Test {
       delete t;
     }
   }
+  // The records since the last look, one a line, against a fnmatch pattern.
+  template <typename What>
+  void expectRecords(const std::string& pattern, const What& what) {
+    std::string got;
+    for (const auto& r : log_.take()) got += (got.empty() ? "" : "\n") + r;
+    EXPECT_EQ(fnmatch(pattern.c_str(), got.c_str(), 0), 0) << what << "\n" << got;
+  }
   static void program(const char* name) {
     snprintf(klpGetEnv()->programName, sizeof klpGetEnv()->programName, "%s", name);
   }
 
-  // A thread object with its own command list, on the engine's list, that
-  // runs nothing.
+  // A thread object with its own command list, on the engine's list, running nothing.
   klpThread* addThread(const char* name, int32_t state, std::vector<int> interests = {}, int critical = 1) {
     klpThread* t = new klpThread();
     t->setName(name);
@@ -142,15 +126,14 @@ std::vector<char> req(int32_t func, int32_t subFunc = 0, int32_t pid = getpid(),
   return m;
 }
 
-// What each request is answered with and what the engine logs on the way.
-// Codes 60 to 62 are answered by the interested thread, TRCSTART with
-// sub-function 1 (the trace-on notice) by nobody.
+// Each request's answer and log; 60 to 62 are the thread's to answer, TRCSTART 1 (trace-on notice) nobody's.
 TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
   klpThread* pruner = addThread("PruneThread", KLP_THREAD_REST, {kPrune, kStop});
   addThread("BehinderWorkerThread", KLP_THREAD_DBWAIT);  // cut to 14 characters
   addThread("C", KLP_THREAD_RUN);
   const std::string get = "525 cmdsEngine 1 \\[NOT SET\\]\n589 cmdsEngine 1 cmdsEngine|816|HSVHIPCQueue::get\n"
                           "8999 cmdsEngine 1 a message of ";
+  auto perThread = [](const std::string& r) { return r + "\n" + r + "\n" + r; };
   const struct {
     std::vector<char> msg;
     int32_t length;  // of the reply, -1: none
@@ -159,10 +142,8 @@ TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
       {req(kStatus), 44 + 12 + 20 * 4, ""},   {req(10), 44, ""},          {req(10, 1), -1, ""},
       {req(60), -1, ""},                      {req(61), -1, ""},          {req(62), -1, ""},
       {req(16), 44, ""},  // codes no thread can declare interest in are reported per thread
-      {req(99), 44, "8006 klpThread::interestedInCmd 1 99\n8006 klpThread::interestedInCmd 1 99\n"
-                    "8006 klpThread::interestedInCmd 1 99"},
-      {req(-7), 44, "8006 klpThread::interestedInCmd 1 -7\n8006 klpThread::interestedInCmd 1 -7\n"
-                    "8006 klpThread::interestedInCmd 1 -7"},
+      {req(99), 44, perThread("8006 klpThread::interestedInCmd 1 99")},
+      {req(-7), 44, perThread("8006 klpThread::interestedInCmd 1 -7")},
       {req(59), 60, ""},                      {req(kPrune, 0, 0), -1, ""},
       {req(0, 0, 4711), -1, "511 cmdsEngine 1 4711"},
       {req(kStatus, 0, 1, 2), -1, "509 cmdsEngine 1 2"},
@@ -179,29 +160,25 @@ TEST_F(Engine, EachRequestIsAnsweredByItsCodeAndLogged) {
     e2e::Reply got;
     bool answered = receive(&got, 0);  // replies are put before the step returns
     EXPECT_EQ(answered ? (r.length == -2 ? -2 : got.header.msgLength) : -1, r.length) << func;
-    if (answered) { EXPECT_EQ((e2e::Ints{got.header.func, got.header.senderPid}), (e2e::Ints{func, getpid()})); }
+    if (answered) { EXPECT_EQ((Ints{got.header.func, got.header.senderPid}), (Ints{func, getpid()})); }
     if (func == 17) { EXPECT_EQ(std::string(got.payload.data() + 2, 8), "KLPQRYMG"); }
     if (func == 59) { EXPECT_EQ(std::string(got.payload.data(), 16), std::string("klpSISize: \0\3\0\0\0", 16)); }
     if (answered && func == kStatus) {  // one record per thread, in list order, and room for one more
-      EXPECT_EQ((e2e::Ints{e2e::rd32(got.payload, 0), e2e::rd32(got.payload, 4), e2e::rd32(got.payload, 8),
+      EXPECT_EQ((Ints{e2e::rd32(got.payload, 0), e2e::rd32(got.payload, 4), e2e::rd32(got.payload, 8),
                            e2e::rd32(got.payload, 28), e2e::rd32(got.payload, 48), e2e::rd32(got.payload, 68)}),
-                (e2e::Ints{0, 0, 3, KLP_THREAD_REST, KLP_THREAD_DBWAIT, KLP_THREAD_RUN}));
+                (Ints{0, 0, 3, KLP_THREAD_REST, KLP_THREAD_DBWAIT, KLP_THREAD_RUN}));
       EXPECT_EQ(std::string(got.payload.data() + 12) + "," + std::string(got.payload.data() + 32, 16),
                 "PruneThread," + std::string("BehinderWorker\0\0", 16));
     }
-    EXPECT_RECORDS(r.records, func);
+    expectRecords(r.records, func);
   }
-  // The code went to the interested thread only, without a requester when
-  // the request had none; STOP set the caller's flag once.
-  EXPECT_EQ((e2e::Ints{takeFunc(pruner), takeFunc(pruner), takeFunc(pruner), takeFunc(pruner)}),
-            (e2e::Ints{kPrune, kPrune, kStop, -1}));
-  EXPECT_EQ((e2e::Ints{stopFlag_, st_.stopping}), (e2e::Ints{1, 1}));
+  // The code went to the interested thread only; STOP set the caller's flag once.
+  EXPECT_EQ((Ints{takeFunc(pruner), takeFunc(pruner), takeFunc(pruner), takeFunc(pruner)}),
+            (Ints{kPrune, kPrune, kStop, -1}));
+  EXPECT_EQ((Ints{stopFlag_, st_.stopping}), (Ints{1, 1}));
 }
 
-// A value changes its parameter by the parameter's type, only when the
-// parameter may change while the server runs; the request is echoed either
-// way. In an "xqapply" program the flag 18 may not be set while the text 34
-// is set.
+// A changeable parameter changes by its type, echoed either way; "xqapply" may not set 18 while 34 is set.
 TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
   const struct {
     const char* program;
@@ -211,17 +188,15 @@ TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
     int source;
     const char* records = "";
   } rows[] = {
-      {"klpkcap", kTerm, "yes", "Y", 3},        {"klpkcap", kTerm, "n", "N", 3},
-      {"klpkcap", kTerm, "Y", "Y", 3},          {"klpkcap", kTerm, "No", "N", 3},
-      {"klpkcap", kTerm, "MAYBE", "N", 3},      {"klpkcap", kTerm, "YESYESYES", "N", 3},
+      {"klpkcap", kTerm, "yes", "Y", 3}, {"klpkcap", kTerm, "n", "N", 3}, {"klpkcap", kTerm, "Y", "Y", 3},
+      {"klpkcap", kTerm, "No", "N", 3}, {"klpkcap", kTerm, "MAYBE", "N", 3}, {"klpkcap", kTerm, "YESYESYES", "N", 3},
       {"klpkcap", kInterval, "1000", "1000", 3}, {"klpkcap", kInterval, "12abc", "1000", 3},
-      {"klpkcap", kInterval, "50", "1000", 3, "503 klpParmClass:setParm 2 50|COMMIT_INTERVAL"},  {"klpkcap", kInterval, "99999999999", "1000", 3},
-      {"klpkcap", kInterval, "+2000", "2000", 3}, {"klpkcap", kPath, "/elsewhere", "/p", 0},
-      {"klpkcap", kApplyText, "P1", "P1", 3},   {"klpkcap", kApplyFlag, "Y", "Y", 3},
-      {"klpkcap", kApplyFlag, "N", "N", 3},     {"xqapply1", kApplyFlag, "N", "N", 3},
-      {"xqapply1", kApplyFlag, "y", "N", 3, "9011 cmdsEngine 1 "},
-      {"xqapply1", kApplyText, "", "", 3},      {"xqapply1", kApplyFlag, "y", "Y", 3},
-      {"xqapply1", 4000, "7", nullptr, 0},
+      {"klpkcap", kInterval, "50", "1000", 3, "503 klpParmClass:setParm 2 50|COMMIT_INTERVAL"},
+      {"klpkcap", kInterval, "99999999999", "1000", 3}, {"klpkcap", kInterval, "+2000", "2000", 3},
+      {"klpkcap", kPath, "/elsewhere", "/p", 0}, {"klpkcap", kApplyText, "P1", "P1", 3},
+      {"klpkcap", kApplyFlag, "Y", "Y", 3}, {"klpkcap", kApplyFlag, "N", "N", 3}, {"xqapply1", kApplyFlag, "N", "N", 3},
+      {"xqapply1", kApplyFlag, "y", "N", 3, "9011 cmdsEngine 1 "}, {"xqapply1", kApplyText, "", "", 3},
+      {"xqapply1", kApplyFlag, "y", "Y", 3}, {"xqapply1", 4000, "7", nullptr, 0},
   };
   for (const auto& r : rows) {
     program(r.program);
@@ -230,9 +205,8 @@ TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
     ASSERT_EQ(handle(m), 0);
     e2e::Reply got;
     ASSERT_TRUE(receive(&got, 0)) << r.value;
-    EXPECT_EQ(got.raw.size(), m.size());
-    EXPECT_EQ((e2e::Ints{got.header.subFunc, memcmp(got.raw.data() + 44, m.data() + 44, m.size() - 44)}),
-              (e2e::Ints{r.index, 0}));
+    EXPECT_EQ(got.header.subFunc, r.index);
+    EXPECT_EQ(got.payload, std::vector<char>(m.begin() + 44, m.end()));
     if (r.after) {
       const ParmEntry* p = parms_->peekSlot(r.index);
       std::string now = p->type == PARM_BOOLEAN   ? (p->boolValue ? "Y" : "N")
@@ -241,15 +215,12 @@ TEST_F(Engine, ChgparmsChangesByTypeAndIsEchoed) {
       EXPECT_EQ(now, r.after) << r.program << " " << r.index << "=" << r.value;
       EXPECT_EQ(parms_->peekSlot(r.index)->source, r.source) << r.index << "=" << r.value;
     }
-    EXPECT_RECORDS(r.records, r.value);
+    expectRecords(r.records, r.value);
   }
 }
 
-// One pass of the loop (mode 2): supervision, the stop sequence, the signal
-// record and the result from the threads' end codes and the database. 415
-// (threads alive, none critical) stops a server unless, in one-pass mode,
-// its flag 5 is not set; an "xqapply" program stops only when its flag 18
-// or text 34 says so.
+// One pass (mode 2): 415 (threads alive, none critical) stops a server unless flag 5 is not set;
+// an "xqapply" program stops only when its flag 18 or text 34 says so.
 TEST_F(Engine, OnePassOutcomes) {
   const std::string rrs = "590 klpThread::stop 1 *|952|Ended\n534 cmdsEngine 1 ENG|RRS NOT AVAILABLE";
   const struct {
@@ -288,7 +259,7 @@ TEST_F(Engine, OnePassOutcomes) {
     int32_t flag = 0;
     EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_ONE_PASS, &flag), r.rc) << r.program << " " << r.state;
     EXPECT_EQ(r.state == KLP_THREAD_STOP ? -1 : takeFunc(t), r.stopped ? kStop : -1) << r.program;
-    EXPECT_RECORDS(r.records, r.program);
+    expectRecords(r.records, r.program);
     EXPECT_EQ(erGetGlobalSignal(), 0);
     EXPECT_TRUE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));  // kept in one-pass mode
     clearThreads();
@@ -296,7 +267,7 @@ TEST_F(Engine, OnePassOutcomes) {
   delEnvIpcQRcvHdl(klpGetEnv());
   log_.take();
   EXPECT_EQ(cmdsEngine(&threads_, CMDS_MODE_NORMAL, nullptr), 804);
-  EXPECT_RECORDS("589 cmdsEngine 1 cmdsEngine|804|getEnvIpcQRcvHdl", "no queue");
+  expectRecords("589 cmdsEngine 1 cmdsEngine|804|getEnvIpcQRcvHdl", "no queue");
 
   // The stop sequence's grace, by program name.
   for (auto [name, grace] : {std::pair{"xqapply", 180}, {"xqapplyZ", 180}, {"xqappl", 8}, {"apply", 8}}) {
@@ -307,71 +278,58 @@ TEST_F(Engine, OnePassOutcomes) {
   }
 }
 
-// Runs the loop in mode 0 on its own thread; the test thread plays the
-// threads' part.
-struct LoopRun {
-  std::atomic<bool> done{false};
-  int rc = -1;
-  int32_t flag = 0;
-  std::thread runner;
-  explicit LoopRun(OrdList* threads)
-      : runner([this, threads] {
-          rc = cmdsEngine(threads, CMDS_MODE_NORMAL, &flag);
-          done = true;
-        }) {}
-  ~LoopRun() { runner.join(); }
-};
+// The loop in mode 0 on its own thread; the test thread plays the threads' part.
+std::future<int> loop(OrdList* threads, int32_t* flag) {
+  return std::async(std::launch::async, [=] { return cmdsEngine(threads, CMDS_MODE_NORMAL, flag); });
+}
+bool ended(std::future<int>& run) { return run.wait_for(std::chrono::seconds(0)) == std::future_status::ready; }
 
-// A database that goes down ends the loop's normal work: 2006 starts the
-// stop sequence, and once the threads have stopped the result is 929 with
-// message 534; the server's queue goes with the environment.
+// A database gone down starts the stop sequence (2006); then 929 and 534, and the server's queue goes.
 TEST_F(Engine, ADatabaseThatGoesDownStopsTheServerWith929) {
   klpThread* a = addThread("A", KLP_THREAD_REST);
   ASSERT_EQ(setEnvIpcQRcvHdl(klpGetEnv()), 0);
   log_.take();
   g_dbRc = 929;  // the first check comes after more than 4 seconds
+  int32_t flag = 0;
   {
-    LoopRun run(&threads_);
+    std::future<int> run = loop(&threads_, &flag);
     ASSERT_TRUE(e2e::waitFor([&] { return a->cmdList->count > 0; }, 15000));
     EXPECT_EQ(takeFunc(a), kStop);
     a->setState(KLP_THREAD_STOP);
-    EXPECT_TRUE(e2e::waitFor([&] { return run.done.load(); }, 15000));
-    EXPECT_EQ((e2e::Ints{run.rc, run.flag}), (e2e::Ints{929, 0}));
+    EXPECT_TRUE(e2e::waitFor([&] { return ended(run); }, 15000));
+    EXPECT_EQ((Ints{run.get(), flag}), (Ints{929, 0}));
   }
-  EXPECT_RECORDS("590 klpThread::stop 1 *|0|A\n534 cmdsEngine 1 ENG|DOWN\n595 Klpenv:delEnvIpcQRcvHdl 0 *",
+  expectRecords("590 klpThread::stop 1 *|0|A\n534 cmdsEngine 1 ENG|DOWN\n595 Klpenv:delEnvIpcQRcvHdl 0 *",
                  "database down");
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
 }
 
-// After STOP the grace runs out only while an "apply" program's
-// WorkerThread rests: one still at work holds the loop past the 8 seconds,
-// and ends it as soon as it rests. Such a program checks no database.
+// An "apply" program's grace ends only while its WorkerThread rests; it checks no database.
 TEST_F(Engine, TheGraceOfAnApplyProgramWaitsForItsWorkerToRest) {
   program("applyX");
   g_dbRc = 929;
   klpThread* worker = addThread("WorkerThread", KLP_THREAD_RUN, {kStop});
   serverQueueWith(req(kStop));
   auto start = std::chrono::steady_clock::now();
+  int32_t flag = 0;
   {
-    LoopRun run(&threads_);
+    std::future<int> run = loop(&threads_, &flag);
     // Past the grace, still running: without the rule it would have ended.
     std::this_thread::sleep_for(std::chrono::milliseconds(10500));
-    EXPECT_FALSE(run.done.load());
+    EXPECT_FALSE(ended(run));
     worker->setState(KLP_THREAD_REST);
-    EXPECT_TRUE(e2e::waitFor([&] { return run.done.load(); }, 5000));
-    EXPECT_EQ((e2e::Ints{run.rc, run.flag}), (e2e::Ints{0, 1}));
+    EXPECT_TRUE(e2e::waitFor([&] { return ended(run); }, 5000));
+    EXPECT_EQ((Ints{run.get(), flag}), (Ints{0, 1}));
   }
   EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(9));
   e2e::Reply r;
   ASSERT_TRUE(receive(&r));
   EXPECT_EQ(r.header.func, kStop);
-  EXPECT_EQ((e2e::Ints{takeFunc(worker), takeFunc(worker)}), (e2e::Ints{kStop, -1}));  // the request itself
+  EXPECT_EQ((Ints{takeFunc(worker), takeFunc(worker)}), (Ints{kStop, -1}));  // the request itself
   EXPECT_FALSE(klptest::queueExists(e2e::serverQueuePath(dir_, "ENG")));
 }
 
-// A requester whose reply queue is full is dropped, not waited for: the
-// first message goes only when there is room at once, and what is left of
-// a long reply gets little time.
+// A requester whose reply queue is full is dropped: a first piece goes only with room at once.
 TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
   const struct {
     int waiting, threads;
@@ -396,14 +354,13 @@ TEST_F(Engine, ARequesterThatTakesNoRepliesIsDroppedNotWaitedFor) {
     for (e2e::Reply r; receive(&r, 0);) left.emplace_back(r.header.func, r.header.pieceNo);
     if (c.firstPiece) want.emplace_back(kStatus, 1);
     EXPECT_EQ(left, want) << c.threads;
-    EXPECT_RECORDS("508 cmdsEngine 1 (mqueue, /klpq.*, 48)\n589 cmdsEngine 1 cmdsEngine|805|HSVHIPCQueue::put\n"
+    expectRecords("508 cmdsEngine 1 (mqueue, /klpq.*, 48)\n589 cmdsEngine 1 cmdsEngine|805|HSVHIPCQueue::put\n"
                    "8999 cmdsEngine 1 *", c.threads);
   }
   freeIpcMsg(other);
 }
 
-// A thread that does not take its commands gets at most 100; the stop
-// sequence still reaches it.
+// A thread that takes no commands gets at most 100; the stop sequence still reaches it.
 TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
   klpThread* stuck = addThread("Stuck", KLP_THREAD_REST, {kPrune});
   klpThread* taking = addThread("Taking", KLP_THREAD_REST, {kPrune});
@@ -412,9 +369,10 @@ TEST_F(Engine, ACommandListIsCappedButTheStopSequenceStillReachesIt) {
     EXPECT_EQ(takeFunc(taking), kPrune);
   }
   EXPECT_EQ(stuck->cmdList->count, 100);
-  EXPECT_RECORDS("8054 cmdsEngine 1 Stuck|100|22\n8054 cmdsEngine 1 Stuck|100|22", "cap");
+  expectRecords("8054 cmdsEngine 1 Stuck|100|22\n8054 cmdsEngine 1 Stuck|100|22", "cap");
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);
-  EXPECT_EQ((e2e::Ints{stuck->cmdList->count, taking->cmdList->count}), (e2e::Ints{101, 1}));
+  EXPECT_EQ(threads_.unlockList(), 1005);  // the stop sequence let go of the thread list
+  EXPECT_EQ((Ints{stuck->cmdList->count, taking->cmdList->count}), (Ints{101, 1}));
   EXPECT_EQ(cmdsStartStop(&st_, &threads_), 0);  // once stopping, nothing more is sent
   EXPECT_EQ(taking->cmdList->count, 1);
 }

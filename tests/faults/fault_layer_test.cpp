@@ -1,22 +1,13 @@
-// The fault-injecting layer in one process: which uses its texts make fail,
-// the texts it refuses, its allocator, and the library loaders' failure
-// points, which no scenario of the walk reaches.
-#include <gtest/gtest.h>
-#include <signal.h>
-#include <unistd.h>
-
+// The fault-injecting layer: its texts, its allocator, and the loaders' points the walk cannot reach.
 #include <cerrno>
-#include <functional>
 #include <new>
-#include <sstream>
-#include <string>
-#include <vector>
+#include <cstdio>
 
 #include "common/db/klpdll.h"
 #include "common/db/oradl.h"
 #include "common/msg/msglogger.h"
 #include "common/platform/hsv_fault.h"
-#include "tests/testing/klptest.h"
+#include "tests/e2e/e2e_support.h"
 
 namespace {
 
@@ -24,8 +15,7 @@ struct Disarm {
   ~Disarm() { hsvFaultArm(nullptr); }
 };
 
-// What four resource-id lookups in a row answer under a text: '.' for
-// success, 'F' for the operation's own code, 'L' for ECF_LIMIT_REACHED.
+// Four resource-id lookups under a text: '.' success, 'F' the operation's code, 'L' ECF_LIMIT_REACHED.
 std::string lookups(const std::string& spec) {
   if (!hsvFaultArm(spec.c_str())) return "refused";
   std::string seen;
@@ -49,23 +39,14 @@ TEST(FaultLayer, TextsChooseTheUsesThatFail) {
   const struct {
     std::string spec, seen;
   } cases[] = {
-      {"", "...."},
-      {"resid.queue:2", ".F.."},
-      {"resid.queue:2-3", ".FF."},
-      {"resid.queue:3+", "..FF"},
-      {"resid.queue:1,resid.queue:4=0x9000000C", "F..L"},
-      {"resid.memory:1", "...."},
-      {self + "/resid.queue:1", "F..."},
-      {"klpkcap/resid.queue:1,wait=3,klpkcap/log=/nonexistent/dir/x", "...."},
-      {"resid.queue", "refused"},
-      {"resid.queue:0", "refused"},
-      {"resid.queue:3-2", "refused"},
-      {"resid.queue:1=0", "refused"},
-      {"resid.queue:x", "refused"},
-      {"queue.putt:1", "refused"},
-      {"sleep=0", "refused"},
+      {"", "...."}, {"resid.queue:2", ".F.."}, {"resid.queue:2-3", ".FF."}, {"resid.queue:3+", "..FF"},
+      {"resid.queue:1,resid.queue:4=0x9000000C", "F..L"}, {"resid.memory:1", "...."}, {self + "/resid.queue:1", "F..."},
+      {"klpkcap/resid.queue:1,wait=3,klpkcap/log=/nonexistent/dir/x", "...."}, {"resid.queue", "refused"},
+      {"resid.queue:0", "refused"}, {"resid.queue:3-2", "refused"}, {"resid.queue:1=0", "refused"},
+      {"resid.queue:x", "refused"}, {"queue.putt:1", "refused"}, {"sleep=0", "refused"},
       {"log=/nonexistent/dir/x", "refused"},
   };
+
   for (const auto& c : cases) EXPECT_EQ(lookups(c.spec), c.seen) << c.spec;
 
   klptest::TmpDir dir;
@@ -94,8 +75,7 @@ TEST(FaultLayer, PlatformObjectsComeFromAnAllocatorThatCanFail) {
   EXPECT_EQ(hsvFaultUses(HSV_FAULT_ALLOC), 4u);
 }
 
-// The loaders under a failing load, lookup or allocation, each in a child
-// of its own: their state is process-wide.
+// The loaders under a failing load, lookup or allocation, each in a child: their state is process-wide.
 TEST(FaultLayer, LibraryLoadersReportTheirFailures) {
   if (!hsvFaultCompiledIn()) GTEST_SKIP() << "built without KLP_FAULTS";
   const struct {
@@ -133,37 +113,22 @@ TEST(FaultLayer, LibraryLoadersReportTheirFailures) {
   }
 }
 
-// A server whose every get fails while a request waits on its queue keeps
-// looping, reporting once; it must pause between passes, not spin a core.
+// A server whose every get fails must pause between passes, not spin a core.
 TEST(FaultLayer, AServerWhoseGetsFailDoesNotSpin) {
   if (!hsvFaultCompiledIn()) GTEST_SKIP() << "built without KLP_FAULTS";
-  klptest::TmpDir tmp;
-  const std::string queuePath = tmp.path() + "GF.KLP.KCAP.IPC";
-  klptest::Background server({klptest::binPath("klpkcap"), "CAPTURE_SERVER=GF"},
-                             {"KLP_TEST_FAULTS=klpkcap/queue.get:1+"});
-  for (int i = 0; i < 500 && !klptest::queueExists(queuePath); ++i) usleep(10000);
-  ASSERT_TRUE(klptest::queueExists(queuePath));
-  HSVResID id;
-  HSVHIPCQueue q;
-  ASSERT_EQ(hsvIPCGetQueResID(queuePath.c_str(), HSV_QUEUE_RESID_OPTION, &id), ECF_OK);
-  ASSERT_EQ(q.attach(id), ECF_OK);
-  const char request[44] = {'I', 'P', 'C', ':', 0, 0, 0, 0, 1, 0, 0, 0, 44, 0, 0, 0, 15};
-  ASSERT_EQ(q.put(request, sizeof request), ECF_OK);
-  q.detach();
-  auto cpuTicks = [&] {
+  klptest::TmpDir dir;
+  e2e::Server server(dir, "GF", {}, {"KLP_TEST_FAULTS=klpkcap/queue.get:1+"});
+  ASSERT_TRUE(server.ready());
+  ASSERT_TRUE(e2e::RawClient(server.queue(), false).sendBytes(e2e::RawClient::request(15)));
+  auto cpuTicks = [&] {  // utime and stime, the 14th and 15th fields
     std::string stat = klptest::readFile("/proc/" + std::to_string(server.pid()) + "/stat");
-    std::istringstream in(stat.substr(stat.rfind(')') + 2));
-    std::string field;
-    long ticks = 0;
-    for (int f = 3; f <= 15 && in >> field; ++f)
-      if (f >= 14) ticks += std::stol(field);  // utime, stime
-    return ticks;
+    long utime = 0, stime = 0;
+    EXPECT_EQ(sscanf(stat.c_str() + stat.rfind(')') + 2, "%*s %*s %*s %*s %*s %*s %*s %*s %*s %*s %*s %ld %ld",
+                     &utime, &stime), 2) << stat;
+    return utime + stime;
   };
   long before = cpuTicks();
   sleep(2);
   long used = cpuTicks() - before;  // a spinning loop takes about 200 ticks here
-  server.kill(SIGKILL);
-  server.wait();
   EXPECT_LT(used, 50) << "ticks of CPU in 2 s";
-  if (q.attach(id) == ECF_OK) q.destroy();
 }

@@ -1,6 +1,5 @@
 // What the install tests share: the build installed into a fresh prefix once
-// per test process, running an installed program with the build and source
-// trees out of reach, and running a shell line.
+// per test process, and running programs with the build and source trees out of reach.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -18,15 +17,11 @@ inline const klptest::TmpDir& tmp() {
   return dir;
 }
 
-inline klptest::ProcessResult shell(const std::string& line,
-                                    const std::vector<std::string>& env = {},
-                                    int timeoutMs = 120000) {
-  return klptest::run({"/bin/sh", "-c", line}, env, timeoutMs);
+inline klptest::ProcessResult shell(const std::string& line, const std::vector<std::string>& env = {}) {
+  return klptest::run({"/bin/sh", "-c", line}, env, 120000);
 }
 
-// Installs the build with `cmake --install BUILD --prefix DIR` into a new
-// directory under tmp() and returns DIR (no trailing "/"); the same for
-// every call in a process.
+// `cmake --install` of the build into a new directory under tmp(), once per process; no trailing "/".
 inline const std::string& prefix() {
   static const std::string dir = [] {
     std::string d = tmp().path() + "prefix";
@@ -37,17 +32,12 @@ inline const std::string& prefix() {
   return dir;
 }
 
-// argv, run in a private mount namespace where the build and the source
-// trees are covered by empty file systems, from the working directory dir,
-// without KLP_CATALOG_DIR or LD_LIBRARY_PATH: what the program needs must
-// come from where it was installed.
-inline std::vector<std::string> hidden(const std::string& dir,
-                                       const std::vector<std::string>& argv) {
-  std::vector<std::string> v = {
-      KLP_UNSHARE, "-rm", "/bin/sh", "-c",
-      "mount -t tmpfs none \"$1\" && mount -t tmpfs none \"$2\" && cd \"$3\" && "
-      "unset KLP_CATALOG_DIR LD_LIBRARY_PATH && shift 3 && exec \"$@\"",
-      "sh", KLP_BUILD_DIR, KLP_SOURCE_DIR, dir};
+// argv run from dir with the build and source trees covered and no KLP_CATALOG_DIR or LD_LIBRARY_PATH.
+inline std::vector<std::string> hidden(const std::string& dir, const std::vector<std::string>& argv) {
+  std::vector<std::string> v = {KLP_UNSHARE, "-rm", "/bin/sh", "-c",
+                                "mount -t tmpfs none \"$1\" && mount -t tmpfs none \"$2\" && cd \"$3\" && "
+                                "unset KLP_CATALOG_DIR LD_LIBRARY_PATH && shift 3 && exec \"$@\"",
+                                "sh", KLP_BUILD_DIR, KLP_SOURCE_DIR, dir};
   v.insert(v.end(), argv.begin(), argv.end());
   return v;
 }

@@ -1,12 +1,8 @@
-// The installed tree and the Debian package: every piece where an operator
-// looks for it, the programs running from the prefix alone, and a program of
-// the operator's own built against the installed header and library.
+// The installed tree and package: every piece in place, programs running from the prefix alone, an own program.
 #include <unistd.h>
 
-#include <string>
-#include <vector>
+#include <fstream>
 
-#include "tests/e2e/e2e_support.h"
 #include "tests/install/install_support.h"
 
 using installtest::hidden;
@@ -24,26 +20,13 @@ struct Piece {
   std::string path, linkTo;
 };
 const std::vector<Piece> kPieces = {
-    {"bin/klpkccmd", ""},
-    {"bin/klptrc", ""},
-    {"bin/klptrcbp", ""},
-    {"bin/klpkcap", ""},
-    {kLib + "/libklp.so", "libklp.so.9"},
-    {kLib + "/libklp.so.9", "libklp.so.9.1.0"},
-    {kLib + "/libklp.so.9.1.0", ""},
-    {kLib + "/pkgconfig/klp.pc", ""},
-    {kLib + "/cmake/klp/klpConfig.cmake", ""},
-    {kLib + "/cmake/klp/klpConfigVersion.cmake", ""},
-    {"include/klp/klpapi.h", ""},
-    {"include/klp/klptrc.h", ""},
-    {"share/klp/vdbklp.mo", ""},
-    {"share/man/man1/klpkccmd.1", ""},
-    {"share/man/man1/klptrc.1", ""},
-    {"share/man/man1/klpkcap.1", ""},
-    {"share/man/man1/klptrcbp.1", ""},
-    {"share/man/man3/klpapi.3", ""},
-    {"share/man/man3/klpGetStatus.3", ""},
-    {"share/bash-completion/completions/klpkccmd", ""},
+    {"bin/klpkccmd", ""}, {"bin/klptrc", ""}, {"bin/klptrcbp", ""}, {"bin/klpkcap", ""},
+    {kLib + "/libklp.so", "libklp.so.9"}, {kLib + "/libklp.so.9", "libklp.so.9.1.0"}, {kLib + "/libklp.so.9.1.0", ""},
+    {kLib + "/pkgconfig/klp.pc", ""}, {kLib + "/cmake/klp/klpConfig.cmake", ""},
+    {kLib + "/cmake/klp/klpConfigVersion.cmake", ""}, {"include/klp/klpapi.h", ""}, {"include/klp/klptrc.h", ""},
+    {"share/klp/vdbklp.mo", ""}, {"share/man/man1/klpkccmd.1", ""}, {"share/man/man1/klptrc.1", ""},
+    {"share/man/man1/klpkcap.1", ""}, {"share/man/man1/klptrcbp.1", ""}, {"share/man/man3/klpapi.3", ""},
+    {"share/man/man3/klpGetStatus.3", ""}, {"share/bash-completion/completions/klpkccmd", ""},
     {"share/bash-completion/completions/klptrc", ""},
 };
 
@@ -79,16 +62,12 @@ TEST(Install, ProgramsRunFromThePrefixAloneWithTheBuildOutOfReach) {
   klptest::Background server(
       hidden(dir, {bin + "klpkcap", "CAPTURE_SERVER=INST", "CAPTURE_PATH=" + dir}));
   const std::string queue = dir + "INST.KLP.KCAP.IPC";
-  ASSERT_TRUE(e2e::waitFor([&] { return klptest::queueExists(queue); }, 60000)) << server.out();
-  struct Step {
-    const char* command;
-    const char* says;  // from the catalogue only: the built-in table has no such text
-  };
-  for (const Step& s : {Step{"STATUS", "KLP0520I"}, Step{"STOP", "KLP0522I"}}) {
-    ProcessResult r = klptest::run(hidden(dir, {bin + "klpkccmd", "CAPTURE_SERVER=INST", s.command}));
-    EXPECT_EQ(r.exitCode, 0) << s.command << r.out << r.err;
-    EXPECT_TRUE(contains(r.out, s.says)) << s.command << r.out;
-    EXPECT_FALSE(contains(r.out + r.err, "KLP0513E")) << "catalogue not found";
+  ASSERT_TRUE(klptest::waitFor([&] { return klptest::queueExists(queue); }, 60000)) << server.out();
+  // The texts come from the catalogue only: the built-in table has none such.
+  for (auto [command, says] : {std::pair{"STATUS", "KLP0520I"}, {"STOP", "KLP0522I"}}) {
+    ProcessResult r = klptest::run(hidden(dir, {bin + "klpkccmd", "CAPTURE_SERVER=INST", command}));
+    EXPECT_EQ(r.exitCode, 0) << command << r.out << r.err;
+    EXPECT_TRUE(contains(r.out, says) && !contains(r.out + r.err, "KLP0513E")) << command << r.out;
   }
   EXPECT_EQ(server.wait(30000).exitCode, 0) << server.out() << server.err();
   EXPECT_FALSE(klptest::queueExists(queue));
@@ -104,11 +83,9 @@ TEST(Install, OwnProgramBuildsFromPkgConfigAndFindPackage) {
 
   const std::string proj = dir + "proj/";
   ASSERT_EQ(shell("mkdir -p " + proj + " && cp " + src + " " + proj).exitCode, 0);
-  FILE* f = fopen((proj + "CMakeLists.txt").c_str(), "w");
-  ASSERT_NE(f, nullptr);
-  fputs("cmake_minimum_required(VERSION 3.20)\nproject(own C)\nfind_package(klp 9 REQUIRED)\n"
-        "add_executable(bycmake status_client.c)\ntarget_link_libraries(bycmake klp::klp)\n", f);
-  fclose(f);
+  std::ofstream(proj + "CMakeLists.txt") << "cmake_minimum_required(VERSION 3.20)\nproject(own C)\n"
+      "find_package(klp 9 REQUIRED)\nadd_executable(bycmake status_client.c)\n"
+      "target_link_libraries(bycmake klp::klp)\n";
   ProcessResult cm = shell(std::string(KLP_CMAKE) + " -S " + proj + " -B " + proj + "b -DCMAKE_PREFIX_PATH=" +
                            prefix() + " \"-DCMAKE_C_FLAGS=" + KLP_SANITIZE_FLAGS + "\" >/dev/null && " +
                            KLP_CMAKE + " --build " + proj + "b");
@@ -118,7 +95,7 @@ TEST(Install, OwnProgramBuildsFromPkgConfigAndFindPackage) {
 
   klptest::Background server({prefix() + "/bin/klpkcap", "CAPTURE_SERVER=OWN", "CAPTURE_PATH=" + dir});
   const std::string queue = dir + "OWN.KLP.KCAP.IPC";
-  ASSERT_TRUE(e2e::waitFor([&] { return klptest::queueExists(queue); }, 60000)) << server.out();
+  ASSERT_TRUE(klptest::waitFor([&] { return klptest::queueExists(queue); }, 60000)) << server.out();
   ProcessResult own = klptest::run({dir + "bypc", "OWN"});
   EXPECT_EQ(own.out, "status 0 format 3 required 2224\nstop 0\n") << own.err;
   EXPECT_EQ(server.wait(30000).exitCode, 0) << server.out() << server.err();

@@ -1,9 +1,6 @@
-/*
- * A program of an operator's own, built against the installed header and
- * library: without arguments it asks for the status size of a K Capture
- * server (answered without any server); with a server name it reads that
- * server's status and stops it.
- */
+/* An operator's own program against the installed header and library: with
+ * no argument the status size (needs no server), else that server's status,
+ * then its stop. */
 #include <stdio.h>
 #include <string.h>
 
@@ -11,8 +8,7 @@
 
 int main(int argc, char **argv)
 {
-    klpReleaseInfo rel = {KLP_KIND_KCAP, KLP_API_VERSION, KLP_API_RELEASE,
-                          KLP_API_MODIFICATION};
+    klpReleaseInfo rel = {KLP_KIND_KCAP, KLP_API_VERSION, KLP_API_RELEASE, KLP_API_MODIFICATION};
     klpStatusRequest req;
     klpStatusFmt3 st;
     klpResultBlock result;
@@ -29,9 +25,8 @@ int main(int argc, char **argv)
     strcpy(req.schema, "KLP");
     req.buffer = &st;
     req.bufferSize = sizeof st;
-    rc = klpGetStatus(&rel, &req, &result);
-    printf("status %d format %d required %d\n", rc, st.format, req.requiredSize);
-    rc = klpStopProgram(KLP_KIND_KCAP, argv[1], "KLP", 0, &result);
-    printf("stop %d\n", rc);
+    printf("status %d", klpGetStatus(&rel, &req, &result));
+    printf(" format %d required %d\n", st.format, req.requiredSize);
+    printf("stop %d\n", klpStopProgram(KLP_KIND_KCAP, argv[1], "KLP", 0, &result));
     return 0;
 }
