@@ -161,10 +161,15 @@ TEST(TrapFile, DumpFromASignalHandlerIsAppended) {
   HSVTrapFile t;  // an empty file is at its end, whatever errno held
   ASSERT_EQ(ECF_OK, t.open((tmp.path() + "empty").c_str(), HSV_TRAPFILE_OPEN_OPTION));
   errno = ENOENT;
-  EXPECT_TRUE(t.seekToEnd() == ECF_OK && t.close() == ECF_OK);
+  siginfo_t far{};  // an address of all sixteen hex digits
+  far.si_addr = reinterpret_cast<void*>(0xfedcba9876543210u);
+  EXPECT_TRUE(t.seekToEnd() == ECF_OK && t.dump(HSV_TRAPFILE_DUMP_OPTION, 11, &far, nullptr) == ECF_OK &&
+              t.close() == ECF_OK);
+  EXPECT_NE(std::string::npos, klptest::readFile(tmp.path() + "empty").find("Fault address: 0xfedcba9876543210\n"));
   EXPECT_TRUE(t.write("x", 1) == ECF_NOT_ATTACHED &&
               t.dump(HSV_TRAPFILE_DUMP_OPTION, 11, nullptr, nullptr) == ECF_NOT_ATTACHED);
   EXPECT_EQ(ECF_NOT_FOUND, t.open("/nonexistent-dir/x.DUMP", HSV_TRAPFILE_OPEN_OPTION));
+  EXPECT_TRUE(t.open("", 0) == ECF_INVALID_ARGUMENT && t.open(nullptr, 0) == ECF_INVALID_ARGUMENT);
   EXPECT_EQ(ECF_NOT_ATTACHED, t.close());
 }
 
