@@ -1,6 +1,4 @@
-// The trace writer, its reader and attaching to a block: damaged images,
-// what the writer keeps and drops, the trace command in the server and
-// short of memory.
+// Trace writer and reader: damaged images, what is kept, attaching, the command short of memory.
 #include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -9,6 +7,7 @@
 #include <atomic>
 #include <cstdio>
 #include <cstring>
+#include <fstream>
 #include <functional>
 #include <string>
 #include <thread>
@@ -75,13 +74,10 @@ Walk walkFile(const std::string& path) {
 }
 
 void save(const std::string& path, const std::string& bytes) {
-  FILE* f = fopen(path.c_str(), "wb");
-  fwrite(bytes.data(), 1, bytes.size(), f);
-  fclose(f);
+  std::ofstream(path, std::ios::binary) << bytes;
 }
 
-// A trace block of this process, created as the trace command does, from
-// the keys the anchor already holds.
+// A trace block of this process, made as the trace command does from the anchor's keys.
 struct Trace {
   klptest::TmpDir dir;
   explicit Trace(uint32_t size = TRC_MIN_SIZE, const std::string& file = "",
@@ -92,7 +88,6 @@ struct Trace {
     snprintf(a->keyPart2, TRC_KEY_SIZE, "%s", kKey);
     EXPECT_EQ(0, trcCreate(size, a->keyPart1, a->keyPart2, file.empty() ? nullptr : file.c_str(),
                            fileSize, 0x3F, true));
-    EXPECT_EQ(dir.path() + kKey, std::string(a->keyPart1) + a->keyPart2);
   }
   ~Trace() {
     trcFree();
@@ -108,8 +103,8 @@ void put(int v) { trcData(5, 7, "value", TRC_LVL_BASIC, TRC_OBJ_SIGNED, 4, &v); 
 struct Image {
   std::string bytes = std::string(TRC_MIN_SIZE, '\0');
   trcBlockHeader* h() { return reinterpret_cast<trcBlockHeader*>(bytes.data()); }
-  Image(uint32_t write, uint32_t oldest, uint32_t high, uint32_t count) {
-    h()->dataOffset = TRC_HEADER_SIZE;
+  Image(uint32_t write, uint32_t oldest, uint32_t high, uint32_t count, uint32_t data = TRC_HEADER_SIZE) {
+    h()->dataOffset = data;
     h()->writeOffset = write;
     h()->oldestOffset = oldest;
     h()->highWaterOffset = high;
@@ -145,28 +140,21 @@ TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
   const int OK = TRC_WALK_OK, HEADER = TRC_WALK_BAD_HEADER, RECORD = TRC_WALK_BAD_RECORD;
   std::vector<Row> rows = {
       {"length below 40", Image(80, 0, 80, 1).rec(0, 36), 0, RECORD, RECORD, "impossible length 36"},
-      {"length not a multiple of 4", Image(80, 0, 80, 1).rec(0, 42), 0, RECORD, RECORD,
-       "impossible length 42"},
+      {"length not 4-aligned", Image(80, 0, 80, 1).rec(0, 42), 0, RECORD, RECORD, "impossible length 42"},
       {"length 0 never loops", Image(80, 0, 80, 2).rec(0, 0), 0, RECORD, RECORD, "impossible length 0"},
-      {"length past the high-water offset", Image(40, 0, 40, 1).rec(0, 80), 0, RECORD, RECORD,
-       "impossible length 80"},
+      {"length past high water", Image(40, 0, 40, 1).rec(0, 80), 0, RECORD, RECORD, "impossible length 80"},
       {"entry count above the records held", Image(160, 0, 160, 3).rec(0, 80).rec(80, 80), 2,
        TRC_WALK_SHORT, TRC_WALK_SHORT, "counts 3 records but only 2"},
-      {"data-area offset inside the header",
-       [] { Image i(40, 0, 40, 1); i.h()->dataOffset = 95260; return i; }(), 0, HEADER, HEADER,
-       "data-area offset"},
+      {"data area inside the header", Image(40, 0, 40, 1, 95260), 0, HEADER, HEADER, "data-area offset"},
       {"offsets not multiples of 4", Image(42, 0, 42, 1), 0, HEADER, HEADER, "multiples of 4"},
-      {"oldest beyond the high-water offset", Image(40, 80, 40, 1), 0, HEADER, HEADER,
-       "beyond the high-water"},
+      {"oldest past high water", Image(40, 80, 40, 1), 0, HEADER, HEADER, "beyond the high-water"},
       {"more entries than bytes", Image(40, 0, 40, 2).rec(0, 40), 0, HEADER, HEADER, "more entries"},
       {"high-water offset beyond the buffer", Image(kArea + 40, 0, kArea + 40, 1), 0, HEADER, RECORD, ""},
       {"object runs past its record", Image(48, 0, 48, 1).rec(0, 48, 1, 1, 20), 1, OK, OK,
        "Object 1 of length 20 runs past"},
-      {"more objects counted than fit", Image(48, 0, 48, 1).rec(0, 48, 1, 2, 4), 1, OK, OK,
-       "Object 2 lies beyond"},
-      {"wrapped: oldest to high water, then from 0",
-       Image(40, 80, 120, 2).rec(0, 40, 2).rec(40, 40, 9).rec(80, 40, 1), 2, OK, OK, ""},
-      {"stale bytes beyond the write offset", Image(40, 0, 120, 1).rec(0, 40).rec(40, 40), 1, OK, OK, ""},
+      {"more objects than fit", Image(48, 0, 48, 1).rec(0, 48, 1, 2, 4), 1, OK, OK, "Object 2 lies beyond"},
+      {"wrapped", Image(40, 80, 120, 2).rec(0, 40, 2).rec(40, 40, 9).rec(80, 40, 1), 2, OK, OK, ""},
+      {"stale bytes past the write offset", Image(40, 0, 120, 1).rec(0, 40).rec(40, 40), 1, OK, OK, ""},
       // Files claiming more than they hold: refused before memory is sized by them.
       {"2 GB counters and length over 48 bytes",
        Image(0x7FFFFFF0, 0, 0x7FFFFFF0, 1).rec(0, 0x7FFFFFF0), 0, HEADER, RECORD, "", 48},
@@ -184,7 +172,6 @@ TEST(TraceReader, DamagedImagesEndTheWalkWithAMessage) {
       EXPECT_EQ(1, mem.records[0].function);  // the oldest first
       EXPECT_EQ(2, mem.records[1].function);
     }
-
     // The same bytes as a trace file.
     std::string path = dir.path() + "image.trc";
     snprintf(row.image.h()->fileName, TRC_KEY_SIZE, "%s", path.c_str());
@@ -210,6 +197,7 @@ TEST(TraceWriter, WhatARecordHolds) {
   };
   const int str = TRC_OBJ_STRING, exitValue = TRC_REC_EXIT_VALUE;
   auto none = [](trcBlockHeader*) {};
+  auto x = [] { return trcData(5, 7, "x", 2, TRC_OBJ_STRING, 1, "x"); };
   std::string big(kArea - 44, 'x');
   std::vector<Row> rows = {
       {"null pointer keeps its declared type", none,
@@ -220,9 +208,8 @@ TEST(TraceWriter, WhatARecordHolds) {
        TRC_REC_DATA, {{str, "ab"}}, "a name much too"},
       {"component 54 records nothing", none, [] { return trcEntry(54, 1); }, 0, 0, 0, {}, ""},
       {"function 250 records nothing", none, [] { return trcEntry(5, 250); }, 0, 0, 0, {}, ""},
-      {"function override without levels silences",
-       [](trcBlockHeader* b) { b->functionFilters[5][7] = 0x8000; },
-       [] { return trcData(5, 7, "x", 2, str, 1, "x"); }, 0, 0, 0, {}, ""},
+      {"function override of no levels", [](trcBlockHeader* b) { b->functionFilters[5][7] = 0x8000; },
+       x, 0, 0, 0, {}, ""},
       {"component override of level 2: no entry record",
        [](trcBlockHeader* b) { b->componentFilters[5] = 0x8002; },
        [] { return trcEntry(5, 7); }, 2, 0, 0, {}, ""},
@@ -234,10 +221,8 @@ TEST(TraceWriter, WhatARecordHolds) {
        1, exitValue, {{TRC_OBJ_POINTER, std::string("\2\1\0\0\0\0\0\0", 8)}}, nullptr},
       {"exit of another kind has no object", none,
        [] { trcExit(5, 7, 9, 12); return 1u; }, 1, 1, TRC_REC_EXIT, {}, nullptr},
-      {"a damaged area is started afresh, not stepped through forever",
-       [](trcBlockHeader* b) { b->highWaterOffset = kArea, b->entryCount = 5; },
-       [] { return trcData(5, 7, "x", 2, str, 1, "x"); }, 0x3F, 1, TRC_REC_DATA,
-       {{str, "x"}}, "x              "},
+      {"damaged area: start afresh", [](trcBlockHeader* b) { b->highWaterOffset = kArea, b->entryCount = 5; },
+       x, 0x3F, 1, TRC_REC_DATA, {{str, "x"}}, "x              "},
       {"a stopped block takes nothing", [](trcBlockHeader* b) { b->status = TRC_STATE_STOP; },
        [] { return trcEntry(5, 7); }, 0x3F, 0, 0, {}, ""},
       {"a record as large as the data area fits an empty buffer", none,
@@ -255,8 +240,7 @@ TEST(TraceWriter, WhatARecordHolds) {
          return trcDataN(5, 7, "many", 2, 33, types, lengths, pointers);
        }, 0x3F, 1, TRC_REC_DATA, std::vector<std::pair<int, std::string>>(32, {str, "z"}), "many           "},
       {"one byte more is never written", none,
-       [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 43, big.data()); }, 0x3F, 0,
-       0, {}, ""},
+       [&] { return trcData(5, 7, "big", 2, TRC_OBJ_RAW, kArea - 43, big.data()); }, 0x3F, 0, 0, {}, ""},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.what);
@@ -275,7 +259,6 @@ TEST(TraceWriter, WhatARecordHolds) {
     if (row.name != nullptr) { EXPECT_EQ(std::string(row.name) + '\0', r.name); }
     if (row.function != nullptr) { EXPECT_STREQ(row.function, trcFunctionName(r.component, r.function)); }
   }
-
 }
 
 TEST(TraceWriter, WrapKeepsTheNewestRecords) {
@@ -289,8 +272,7 @@ TEST(TraceWriter, WrapKeepsTheNewestRecords) {
 }
 
 TEST(TraceWriter, DirectToFileLosesNothingUntilItsLimit) {
-  // Each wrap appends a lap of 746 records (35808 bytes): three fit 131072;
-  // the last lap (at turning off) does not fit the 23648 bytes left.
+  // Laps of 746 records (35808 bytes): three fit 131072, the last one not the 23648 bytes left.
   struct Row {
     uint32_t fileSize;
     int written, kept;
@@ -366,9 +348,8 @@ TEST(TraceFile, FlushFaults) {
     const char* file = "f.trc";
   };
   auto header = [](const char* platform, uint32_t dataOffset) {
-    Image i(0, 0, 0, 0);
+    Image i(0, 0, 0, 0, dataOffset);
     strcpy(i.h()->platform, platform);
-    i.h()->dataOffset = dataOffset;
     return i.bytes.substr(0, TRC_HEADER_SIZE);
   };
   std::vector<Row> rows = {
@@ -459,9 +440,7 @@ TEST(TraceThreads, HashedSlotsOverflowAndLookups) {
   EXPECT_STREQ("last", t.b()->threadOverflow[149].threadName);
 }
 
-// A process attaching to a block the trace command created: the server
-// (declared the traced application) or another one, such as the command
-// program, which must leave the server's hold on the block alone.
+// Any process may attach to a block; only the declared server holds it, others leave its hold alone.
 TEST(TraceAttach, OnlyTheServerHoldsTheBlock) {
   struct Row {
     const char* what;
@@ -472,6 +451,7 @@ TEST(TraceAttach, OnlyTheServerHoldsTheBlock) {
     const char* seen;  // trcAttach's answer, attached or not, the flag while attached
     uint16_t flagAfter;
     bool kept;  // the block's name still exists afterwards
+    bool stopMidway = false;  // turned off after the first record: the next check silences the rest
   };
   auto shmPath = [](const std::string& dir) {
     HSVResID id;
@@ -489,6 +469,7 @@ TEST(TraceAttach, OnlyTheServerHoldsTheBlock) {
       {"readable by others", true, false, 0, "Linux", 0644, "1000 0 0", 0, true},
       {"another platform", true, false, 0, "Windows", 0, "1004 0 0", 0, true},
       {"still being built", true, false, TRC_STATE_STARTING, "Linux", 0, "0 0 0", 0, true},
+      {"another process, turned off while it writes", false, false, 0, "Linux", 0, "0 1 0", 0, true, true},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.what);
@@ -504,6 +485,13 @@ TEST(TraceAttach, OnlyTheServerHoldsTheBlock) {
       int rc = trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr);
       printf("%d %d %x", rc, trcGetAnchor()->block != nullptr, shared->appAttached);
       put(7);
+      if (row.stopMidway) {
+        shared->status = TRC_STATE_STOP;  // as "off" leaves it
+        trcCheckStop();
+        shared->status = TRC_STATE_RUNNING;  // the anchor alone keeps the point silent now
+        put(8);
+        if (trcAnchorState() != TRC_STATE_STOPPING || trcGetAnchor()->block == nullptr) return 2;
+      }
       trcDetach();
       return 0;
     });
@@ -519,25 +507,7 @@ TEST(TraceAttach, OnlyTheServerHoldsTheBlock) {
   }
 }
 
-TEST(TraceAttach, TurnedOffStopsWritingAtTheNextCheck) {
-  Trace t;
-  trcBlockHeader* shared = t.b();
-  klptest::Child c = klptest::inChild(t.dir.path(), [&] {
-    trcInitAnchor();
-    if (trcAttach(t.dir.path().c_str(), kKey, nullptr, nullptr) != 0) return 1;
-    put(1);
-    shared->status = TRC_STATE_STOP;  // as "off" leaves it
-    trcCheckStop();
-    shared->status = TRC_STATE_RUNNING;  // the anchor alone keeps the point silent now
-    put(2);
-    return trcAnchorState() == TRC_STATE_STOPPING && trcGetAnchor()->block != nullptr ? 0 : 2;
-  });
-  EXPECT_EQ(0, c.exitCode) << c.out << c.err;
-  EXPECT_EQ(1u, t.read().records.size());
-}
-
-// Leaves this process `spare` bytes of private memory beyond what it maps
-// now, as a machine short of memory would; shared memory does not count.
+// Leaves this process `spare` more bytes of private memory, as a machine short of memory would.
 void leaveOnly(rlim_t spare) {
   std::string status = klptest::readFile("/proc/self/status");
   rlim_t used = std::stoull(status.substr(status.find("VmData:") + 7)) * 1024;
@@ -559,10 +529,9 @@ TEST(TraceCommand, InsideTheServerOrShortOfMemory) {
   };
   klptest::TmpDir files;
   const std::string dump = files.path() + "dump.trc";
-  const char* hint =
-      "Unable to obtain memory to copy buffer for formatting.\nEither make more memory available "
-      "or use the '-holdlock' option\n(this will impact the performance of the running "
-      "application.)\n";
+  const char* hint = "Unable to obtain memory to copy buffer for formatting.\nEither make more memory "
+                     "available or use the '-holdlock' option\n(this will impact the performance of "
+                     "the running application.)\n";
   std::vector<Row> rows = {
       {"off in the server leaves the freeing to its stop check", true, false, false, {"off"},
        "Trace is turned off.\n", 0xFFFF, true, 0},
@@ -604,9 +573,7 @@ TEST(TraceCommand, InsideTheServerOrShortOfMemory) {
     EXPECT_STREQ("", t.b()->fileName);     // so is the block's own file name
     EXPECT_EQ(row.flag, t.b()->appAttached);
     EXPECT_EQ(row.kept, klptest::memoryExists(t.dir.path() + kKey + ".TRC"));
-    trcBlockHeader h;
-    bool wrote = trcReadFileHeader(dump.c_str(), &h) == TRC_READ_OK;
-    EXPECT_EQ(row.dumped, wrote ? walk(&h, 0, true).records.size() : 0u);
+    EXPECT_EQ(row.dumped, walkFile(dump).records.size());
   }
 }
 
