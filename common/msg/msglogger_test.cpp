@@ -85,8 +85,7 @@ struct Fixed : Base {
     return routed;
   }
 };
-// Words of msgLogger I 12, W 12, E 10, other 8; of msgLoggerU 28, 26, 26, 8. Bit 1
-// adds the word of the severity read from the text (made upper case); 4 needs LOGSTDOUT.
+// Words I/W/E/other: msgLogger 12/12/10/8, U 28/26/26/8; bit 1 adds the text's, 4 needs LOGSTDOUT.
 TEST(Routing, FollowsTheSeverityWordsAndTheConsoleFlag) {
   const struct { bool u; const char* text; int console, asked; const char* want; } rows[] = {
       {false, "KLP0700I i", 0, 1, "8 KLP0700I i"},      {false, "KLP0700I i", 1, 1, "12 KLP0700I i"},
@@ -103,8 +102,7 @@ TEST(Routing, FollowsTheSeverityWordsAndTheConsoleFlag) {
                           : Fixed<msgLogger>(r.text).route(r.console, r.asked));
 }
 
-// Each line opens, writes, closes the file (a moved one starts anew); a failed open is
-// reported once until a line is written again; origin and thread name cut to 30 and 15.
+// A moved file starts anew; a failed open reported once per good line; origin, thread cut to 30, 15.
 TEST_F(LoggerTest, TheLogFile) {
   std::string bad = tmp.path() + "missing-dir", t = "01234567890123456789", log = tmp.path() + "test.log";
   auto c = klptest::inChild(tmp.path(), [&] {
@@ -181,12 +179,7 @@ TEST_F(LoggerTest, NoMessageIsLostSilentlyForWantOfMemory) {
 
 std::vector<std::string> tableRows;
 int tableAnswer = 0;
-int writeTableRow(const char* table, const char* qualifier, const logMsg* r) {
-  tableRows.push_back(std::string(table) + "|" + qualifier + "|" + std::to_string(r->msgNumber));
-  return tableAnswer;
-}
-// Only msgLoggerU writes the table, once per message, with the qualifier as
-// "%-18.18s", and leaves it alone for a while after the database is gone.
+// Only msgLoggerU writes rows, qualifier "%-18.18s", and stops for a while once the database is gone.
 TEST(MessageTable, RowsAreWrittenUntilTheDatabaseIsGone) {
   const std::string row = "KLP.MSGS|KLP               |", longRow = "KLP.MSGS|ABCDEFGHIJKLMNOPQR|8999";
   const struct { std::vector<std::string> rows; int answer = 0, number = 8999, routing = 16;
@@ -196,7 +189,10 @@ TEST(MessageTable, RowsAreWrittenUntilTheDatabaseIsGone) {
       {{row + "7142", row + "7142"}, -204, 9005, 1 | 16},  // 'I': word 28
       {{}, 0, 8999, 1},                                     // 'D': word 8
       {{row + "8999"}, -968}, {{row + "8999"}, -289}, {{row + "8999"}, -904}};
-  msgSetTableWriter(writeTableRow);
+  msgSetTableWriter([](const char* table, const char* qualifier, const logMsg* r) {
+    tableRows.push_back(std::string(table) + "|" + qualifier + "|" + std::to_string(r->msgNumber));
+    return tableAnswer;
+  });
   for (const auto& c : cases) {
     std::unique_ptr<msgLogger> l(c.u ? createMsgLoggerU(MSG_APP_KLPKCCMD, 0) : new msgLogger(MSG_APP_KLPKCCMD, 0));
     l->loadBuiltinMsgs(builtinMsgTable);
@@ -340,9 +336,22 @@ TEST_F(LoggerTest, TextsComposeFromTheirRowsValuesAndHeaderValues) {
   for (int i = -1; i <= MSG_APPLICATION_COUNT; ++i) names += msgApplicationName(i) + std::string("|");
   EXPECT_EQ("|@A|Capture|Apply|KlpCcmd|KlpAcmd|K Capture|K Apply|Klpmon|Klppwd|KlpMcmd|KlpKCcmd|"
             "KlpKAcmd|KlpTDiff|KlpKMFmt|Analyzer|K Analyzer|KlpSList|KlpTRep||", names);
+  std::string big(1100, 'z');  // a text is cut at 1024, never written past the buffer
+  logMsg* r = msgNewRecord(8999, 0, "t", "T");
+  const char* v[MSG_MAX_VALUES] = {big.c_str()};
+  l.setMsgValues(r, MSG_MAX_VALUES, v);
+  l.composeKlpMsg(r);
+  EXPECT_EQ("KLP8999D " + big.substr(0, 1015), r->text);
+  msgFreeRecord(r);
+  char buf[32];
+  memset(buf, '#', sizeof buf);
+  EXPECT_EQ(19, l.getKlpMsgText(8006, "t", "T", buf, 20, "X"));
+  EXPECT_EQ(0, l.getKlpMsgText(8006, "t", "T", buf + 21, 0, "X"));  // untouched
+  EXPECT_EQ(std::string("KLP8006D  \"KlpKCcmd\0", 20) + std::string(12, '#'), std::string(buf, 32));
 }
 
-TEST_F(LoggerTest, HeaderValuesFollowTheNumberRangesAndPushOutTheLastCallerValues) {
+// Header values by number range push out the last caller values; long values are cut evenly.
+TEST_F(LoggerTest, HeaderValuesByRangeAndValueLengthBound) {
   const std::string none = "1|2|3|4|5|6|7|8|9", qt = "KLP\" : \"T|1|2|3|4|5|6|7|8",
                     app = "KlpKCcmd|KLP\" : \"T|1|2|3|4|5|6|7";
   const std::pair<int, const std::string*> rows[] = {
@@ -352,10 +361,7 @@ TEST_F(LoggerTest, HeaderValuesFollowTheNumberRangesAndPushOutTheLastCallerValue
       {5200, &none}, {6999, &none}, {7000, &app},  {8997, &app},  {8998, &none}, {-1, &none}};
   for (auto [number, want] : rows)
     EXPECT_EQ(*want, values(number, {"1", "2", "3", "4", "5", "6", "7", "8", "9"})) << number;
-}
-
-// The values sum to at most 1161, a share of 129: only longer values lose, all the same amount.
-TEST_F(LoggerTest, ValueLengthBoundCutsLongValuesEvenly) {
+  // The values sum to at most 1161, a share of 129: only longer values lose, all the same amount.
   std::string v200(200, 'v'), v1000(1000, 'w'), v129(129, 's'), v130(130, 'm'), huge(20000, 'h');
   const char *p = v200.c_str(), *w = v1000.c_str(), *m = v130.c_str();
   EXPECT_EQ("129 129 129 129 129 129 129 129 129", values(8999, {p, p, p, p, p, p, p, p, p}, true));
@@ -366,7 +372,8 @@ TEST_F(LoggerTest, ValueLengthBoundCutsLongValuesEvenly) {
   EXPECT_EQ("0 0 0 0 0 0 0 0 17792", values(8999, {m, m, m, m, m, m, m, m, huge.c_str()}, true));
 }
 
-TEST(Substitution, FollowsMarkerOrder) {
+// Markers are replaced in order; log base names are data-set or plain names.
+TEST(Helpers, SubstitutionFollowsMarkerOrderAndLogBaseNames) {
   char* values[3] = {const_cast<char*>("A"), const_cast<char*>(""), const_cast<char*>("$3")};
   const struct { const char* tmpl; int count, cap; const char* want; } rows[] = {
       {"<$1|$2|$3>", 3, 127, "<A|*|$3>"},         {"no markers", 3, 127, "no markers"},
@@ -382,29 +389,12 @@ TEST(Substitution, FollowsMarkerOrder) {
               msgSubstitute(r.tmpl, strlen(r.tmpl), values, r.count, out, r.cap));
     EXPECT_STREQ(r.want, out) << r.tmpl;
   }
-}
-
-TEST_F(LoggerTest, TextIsCutAt1024AndNeverWrittenPastTheBuffer) {
-  std::string big(1100, 'z');
-  logMsg* r = msgNewRecord(8999, 0, "t", "T");
-  const char* v[MSG_MAX_VALUES] = {big.c_str()};
-  l.setMsgValues(r, MSG_MAX_VALUES, v);
-  l.composeKlpMsg(r);
-  EXPECT_EQ("KLP8999D " + big.substr(0, 1015), r->text);
-  msgFreeRecord(r);
-  char buf[32];
-  memset(buf, '#', sizeof buf);
-  EXPECT_EQ(19, l.getKlpMsgText(8006, "t", "T", buf, 20, "X"));
-  EXPECT_EQ(0, l.getKlpMsgText(8006, "t", "T", buf + 21, 0, "X"));  // untouched
-  EXPECT_EQ(std::string("KLP8006D  \"KlpKCcmd\0", 20) + std::string(12, '#'), std::string(buf, 32));
-}
-
-TEST(LogBaseName, FormsDataSetAndPlainNames) {
-  const struct { const char *path, *name; size_t room; const char* want; } rows[] = {  // "": none
+  // Log base names: data-set style under "//", plain otherwise; "": none.
+  const struct { const char *path, *name; size_t room; const char* want; } names[] = {
       {"//HLQ", "MY_DB.KLP_X.KCAP", 64, "MYDB.KLPX.KCAP.LOG"}, {"//HLQ", "ONE.PART", 64, ""},
       {"//HLQ", "ABCDEFGHIJ.KLMNOPQRST.REST.MORE", 64, "ABCDEFGH.KLMNOPQR.REST.MORE.LOG"},
       {"/var/log/", "MYDB.KLP.KCAP", 64, "MYDB.KLP.KCAP.log"}, {"/x", "does-not-fit", 8, ""}};
-  for (const auto& r : rows) {
+  for (const auto& r : names) {
     char out[64] = "junk";
     EXPECT_EQ(r.want[0] != '\0', msgLogBaseName(r.path, r.name, out, r.room)) << r.name;
     EXPECT_STREQ(r.want, out);
@@ -446,8 +436,7 @@ std::string lookup(const std::vector<uint8_t>& image, const char* key) {
 // The reason of a failed catalogue call: three characters after the ':'.
 int reasonOf(const std::string& text) { return atoi(text.c_str() + text.find(':') + 3); }
 
-// Either byte order: only a decimal number finds a text, one with its own id; the first one wins.
-// A damaged image is refused without reading outside it.
+// Either byte order: a decimal id finds the first text of its own id; damage refused inside bounds.
 TEST(MoReader, FindsOnlyDecimalIdsWithTheirOwnTextsAndRefusesDamage) {
   Entries entries = {
       {"", "KLP0000E header"},      {"0500", "KLP0500E leading zero"}, {"abc", "KLP0500E letters"},
@@ -475,13 +464,11 @@ TEST(MoReader, FindsOnlyDecimalIdsWithTheirOwnTextsAndRefusesDamage) {
     put32(bad, r.at, r.value);
     EXPECT_EQ("<damaged 3>", lookup(bad, "500")) << r.what;
   }
-  // Far more entries than message numbers exist, every one sound: refused.
-  EXPECT_EQ("<damaged 3>", lookup(moImage(Entries(70000)), "500"));
+  EXPECT_EQ("<damaged 3>", lookup(moImage(Entries(70000)), "500"));  // more entries than numbers, all sound
 }
 
-// The text, or why not: 2 missing, 3 unreadable or damaged, 4 no such message, 5 a bad call;
-// only a regular, whole file in KLP_CATALOG_DIR is used and nothing there blocks.
-TEST(Catalogue, TextsOrTheReasonWhyNot) {
+// Reasons: 2 missing, 3 unreadable/damaged/not a regular file (never blocks), 4 no message, 5 bad call.
+TEST(Catalogue, TextsReasonsEveryIssuedNumberAndWhereProgramsLook) {
   std::string image = klptest::readFile(kCatalog);
   char* values[4] = {const_cast<char*>("App"), const_cast<char*>("KLP\" : \"T"),
                      const_cast<char*>("PARM"), const_cast<char*>("")};
@@ -499,8 +486,7 @@ TEST(Catalogue, TextsOrTheReasonWhyNot) {
       {fifo, 500, 200, "reason 3"},         {dir, 500, 200, "reason 3"},
       {file(image.substr(0, image.size() / 2)), 500, 200, "reason 3"},
       {file(std::string(misfiled.begin(), misfiled.end())), 500, 200, "reason 4"},
-      {file(image), 500, 200, "reason 2", "/no/such/dir/vdbklp.mo"},
-      {file(image), 500, 200, "reason 5", ""}};
+      {file(image), 500, 200, "reason 2", "/no/such/dir/vdbklp.mo"}, {file(image), 500, 200, "reason 5", ""}};
   for (const auto& r : rows) {
     klptest::TmpDir tmp;
     ASSERT_TRUE(r.make(tmp.path() + "vdbklp.mo"));
@@ -517,6 +503,36 @@ TEST(Catalogue, TextsOrTheReasonWhyNot) {
     EXPECT_EQ(0, c.exitCode) << r.want;
     EXPECT_EQ(r.want, c.out);
   }
+  // Every issued number has a built text: id, severity, markers filled; labels 7112+ lack header values.
+  const int issued[] = {500, 501, 502, 503, 504, 506, 507, 508, 509, 510, 511, 513, 514, 517, 518, 519, 520,
+                        521, 522, 523, 524, 525, 526, 527, 529, 534, 541, 543, 545, 552, 554, 568, 569, 574,
+                        575, 589, 590, 591, 592, 593, 594, 595, 596, 597, 598, 599, 600, 601, 602, 606, 615,
+                        616, 617, 619, 624, 626, 7112, 7113, 7114, 7115, 7116, 7117, 7118, 7119, 7120, 7121,
+                        7122, 7123, 7124, 7193};
+  char v[9][3] = {"v1", "v2", "v3", "v4", "v5", "v6", "v7", "v8", "v9"};
+  char* nine[9] = {v[0], v[1], v[2], v[3], v[4], v[5], v[6], v[7], v[8]};
+  for (int number : issued) {
+    char text[1100], id[8];
+    snprintf(id, sizeof id, "KLP%04d", number);
+    ASSERT_GT(retrieveCatalogMsg(kCatalog.c_str(), number, nullptr, nine, 9, text, sizeof text), 0) << number;
+    EXPECT_EQ(0, strncmp(text, id, 7)) << text;
+    EXPECT_NE(nullptr, strchr("EIW", text[7])) << text;
+    bool label = number >= 7112;
+    EXPECT_EQ(0, strncmp(text + 8, label ? "  " : "  \"v1\" : \"v2\" : ", label ? 2 : 16)) << text;
+    for (const char* p = text; (p = strchr(p, '$')) != nullptr; ++p)
+      EXPECT_FALSE(p[1] >= '1' && p[1] <= '9') << "unsubstituted marker in " << text;
+  }
+  // The catalogue is beside the program or in KLP_CATALOG_DIR, never taken from the build tree.
+  klptest::TmpDir tmp;
+  std::string built = klptest::binPath("klpkccmd"), copy = tmp.path() + "klpkccmd";
+  ASSERT_EQ(0, klptest::run({"/bin/cp", built, copy}).exitCode);
+  const struct { std::string program; std::vector<std::string> env; bool found; } programs[] = {
+      {built, {}, true}, {copy, {}, false}, {copy, {"KLP_CATALOG_DIR=" KLP_BIN_DIR}, true}};
+  for (const auto& r : programs) {
+    auto p = klptest::run({r.program}, r.env);
+    EXPECT_EQ(12, p.exitCode);
+    EXPECT_EQ(r.found, p.err.find("KLP0513E") == std::string::npos) << r.program << p.err;
+  }
 }
 
 struct NamedCatalogLogger : msgLoggerU {
@@ -524,8 +540,7 @@ struct NamedCatalogLogger : msgLoggerU {
     snprintf(catalogName_, sizeof catalogName_, "%s", name);
   }
 };
-// Below 8000 the catalogue's text, else the table's; without one KLP0513E once, to standard
-// error and the log file. A blank thread name is the run-time thread's, cut to 15 characters.
+// Below 8000 the catalogue's text; without one KLP0513E once to stderr and log; blank thread: run-time's.
 TEST_F(LoggerTest, LoggerUsesTheCatalogueAndFallsBack) {
   auto c = klptest::inChild(tmp.path(), [&] {
     msgSetThreadNameProvider([]() -> const char* { return "a-very-long-thread-name"; });
@@ -539,8 +554,7 @@ TEST_F(LoggerTest, LoggerUsesTheCatalogueAndFallsBack) {
   std::string head = "  \"KlpKCcmd\" : \"KLP\" : \"a-very-long-thr\" : ";
   const std::string want[] = {
       "KLP0506E" + head + "The program could not reach the \"Capture Commands\" queue of the "
-      "server. The server is not running or its queue is not available.",
-      "KLP0661E Job was cancelled",
+      "server. The server is not running or its queue is not available.", "KLP0661E Job was cancelled",
       "KLP0553W" + head + "An internal error  \"4\" occurred for message number \"506\"",
       "KLP0661E Job was cancelled"};
   auto out = klptest::lines(c.out);
@@ -549,47 +563,9 @@ TEST_F(LoggerTest, LoggerUsesTheCatalogueAndFallsBack) {
   EXPECT_EQ(27u, c.err.find("KLP0513E \"KlpKCcmd\":\"KLP\" : \" \": The program could not open the "
                             "message file named 'no-such-catalogue.mo', Reason: CATALOG:  2")) << c.err;
   EXPECT_EQ(1u, klptest::lines(c.err).size());
-  // Time stamp, origin, then the record's text with its own stamp.
   std::string log = klptest::readFile(tmp.path() + "test.log");
-  EXPECT_EQ(27u + 16u + 27u, log.find("KLP0513E")) << log;
+  EXPECT_EQ(27u + 16u + 27u, log.find("KLP0513E")) << log;  // stamp, origin, the record's own stamp
   EXPECT_EQ(27u, log.find("<composeKlpMsg> ")) << log;
 }
 
 }  // namespace
-
-// Every issued number has a built catalogue text with its id, severity and every marker
-// substituted (ascending); status labels 7112-7124, 7193 have no header values (cut by ten).
-TEST(Catalogue, BuiltFileHoldsEveryIssuedNumber) {
-  const int issued[] = {500, 501, 502, 503, 504, 506, 507, 508, 509, 510, 511, 513, 514, 517, 518, 519, 520,
-                        521, 522, 523, 524, 525, 526, 527, 529, 534, 541, 543, 545, 552, 554, 568, 569, 574,
-                        575, 589, 590, 591, 592, 593, 594, 595, 596, 597, 598, 599, 600, 601, 602, 606, 615,
-                        616, 617, 619, 624, 626, 7112, 7113, 7114, 7115, 7116, 7117, 7118, 7119, 7120, 7121,
-                        7122, 7123, 7124, 7193};
-  char v[9][3] = {"v1", "v2", "v3", "v4", "v5", "v6", "v7", "v8", "v9"};
-  char* values[9] = {v[0], v[1], v[2], v[3], v[4], v[5], v[6], v[7], v[8]};
-  for (int number : issued) {
-    char text[1100], id[8];
-    snprintf(id, sizeof id, "KLP%04d", number);
-    ASSERT_GT(retrieveCatalogMsg(kCatalog.c_str(), number, nullptr, values, 9, text, sizeof text), 0) << number;
-    EXPECT_EQ(0, strncmp(text, id, 7)) << text;
-    EXPECT_NE(nullptr, strchr("EIW", text[7])) << text;
-    bool label = number >= 7112;
-    EXPECT_EQ(0, strncmp(text + 8, label ? "  " : "  \"v1\" : \"v2\" : ", label ? 2 : 16)) << text;
-    for (const char* p = text; (p = strchr(p, '$')) != nullptr; ++p)
-      EXPECT_FALSE(p[1] >= '1' && p[1] <= '9') << "unsubstituted marker in " << text;
-  }
-}
-
-// The catalogue is beside the program or in KLP_CATALOG_DIR, never taken from the build tree.
-TEST(Catalogue, ProgramsLookBesideThemselvesNotInTheBuildTree) {
-  klptest::TmpDir tmp;
-  std::string built = klptest::binPath("klpkccmd"), copy = tmp.path() + "klpkccmd";
-  ASSERT_EQ(0, klptest::run({"/bin/cp", built, copy}).exitCode);
-  const struct { std::string program; std::vector<std::string> env; bool found; } rows[] = {
-      {built, {}, true}, {copy, {}, false}, {copy, {"KLP_CATALOG_DIR=" KLP_BIN_DIR}, true}};
-  for (const auto& r : rows) {
-    auto p = klptest::run({r.program}, r.env);
-    EXPECT_EQ(12, p.exitCode);
-    EXPECT_EQ(r.found, p.err.find("KLP0513E") == std::string::npos) << r.program << p.err;
-  }
-}

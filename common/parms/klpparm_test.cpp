@@ -43,8 +43,7 @@ std::string states(const klpParmClass& p, std::vector<int> slots = {0, 1, 2, 3, 
   return s;
 }
 
-// A current registry of each kind, numbered as the programs do (8 matched by 5 characters), the
-// logger keeping what is issued, a UTF-8 user locale, a private working directory.
+// A current registry of each kind (8 matched by 5 characters), a UTF-8 locale, a private directory.
 struct ParmTest : ::testing::Test {
   void SetUp() override {
     setenv("LC_ALL", "C.UTF-8", 1);
@@ -92,11 +91,9 @@ TEST_F(ParmTest, ConstructorRefusesBadTablesAndGettersTheirMisuse) {
   int rc = -5;
   std::unique_ptr<klpParmClass> p;
   auto make65 = [&] { p = std::make_unique<klpParmClass>(big.data(), 65, &rc); EXPECT_EQ(p->getParmInt(0), -1); };
-  EXPECT_EQ(klptest::stdoutOf(make65),
-            "klpParmClass: Error: parameter count (65) is out of range (0-64).\n"
-            "Parameter index 0 is out of range.\n");
+  EXPECT_EQ(klptest::stdoutOf(make65), "klpParmClass: Error: parameter count (65) is out of range (0-64).\n"
+                                       "Parameter index 0 is out of range.\n");
   EXPECT_EQ(rc, 0);
-
   // Bad entries are skipped, the good ones (at their bounds) still taken.
   ParmEntry longName = intEntry(1, "", 0, 9, 0);
   memset(longName.name, 'N', sizeof longName.name);  // 33 characters, no terminator
@@ -159,8 +156,8 @@ int apply(klpParmClass& p, const std::string& steps) {
   return rc;
 }
 
-// Every setter: what it stores from which source, its refusals and records; slot 4 is the console flag.
-TEST_F(ParmTest, SettersStoreByPriorityAndLogTheirRefusals) {
+// Setters by source and their refusals (slot 4 is the console flag); valid values; pending changes.
+TEST_F(ParmTest, SettersValidValuesAndPendingChanges) {
   const std::string sp = "<klpParmClass:setParm> 35: ", sps = "<klpParmClass::setParm> 1: ",
                     sb = "<klpParmClass:setBool> 35: ", c1040(1040, 'c'), c1041(1041, 'c');
   // A refusal answers 2002 and logs; console: the logger's flag afterwards, -1 when not looked at.
@@ -194,28 +191,21 @@ TEST_F(ParmTest, SettersStoreByPriorityAndLogTheirRefusals) {
     EXPECT_EQ(log_.take(), c.logged) << c.steps;
     EXPECT_TRUE(c.console < 0 || log_.get()->getConsoleFlag() == c.console) << c.steps;
   }
-  // A slot set from its own text must not read freed memory.
-  fresh();
+  fresh();  // a slot set from its own text must not read freed memory
   EXPECT_EQ(apply(*p_, "s2=\"@3") + p_->setParm(2, p_->getParmString(2), 3), 0);
   EXPECT_EQ(state(*p_, 2), "\"@3");
-}
-
-TEST_F(ParmTest, ValidValuesAndPendingChanges) {
-  struct { int index; std::string text; bool ok; } cases[] = {
-               {1, "42", true},  {1, "  +7", true}, {1, "7 ", false},   {1, "4x", false},
-               {1, "", false},   {1, "-", false},   {1, "0", false},    {1, "101", false},
-               {1, "1", true},   {1, "100", true},  {1, "4294967297", false},  // wraps to 1
-               {4, "yes", true}, {4, "n", true},    {4, "No", true},    {4, "Y", true},
-               {4, "1", false},  {4, "YESS", false}, {4, "", false},    {3, "x", false},
-               {2, "any text", true}, {2, std::string(1040, 'a'), true},
-               {2, std::string(1041, 'a'), false}};
-  for (const auto& c : cases) EXPECT_EQ(p_->isValidValue(c.index, c.text.c_str()), c.ok) << c.text;
+  struct { int index; std::string text; bool ok; } valid[] = {
+      {1, "42", true}, {1, "  +7", true}, {1, "7 ", false}, {1, "4x", false}, {1, "", false}, {1, "-", false},
+      {1, "0", false}, {1, "101", false}, {1, "1", true}, {1, "4294967297", false},  // wraps to 1
+      {1, "100", true}, {4, "yes", true}, {4, "n", true}, {4, "No", true}, {4, "Y", true}, {4, "1", false},
+      {4, "YESS", false}, {4, "", false}, {3, "x", false}, {2, "any text", true},
+      {2, std::string(1040, 'a'), true}, {2, std::string(1041, 'a'), false}};
+  for (const auto& c : valid) EXPECT_EQ(p_->isValidValue(c.index, c.text.c_str()), c.ok) << c.text;
   std::string changeable;  // by the keyword rule, never what is not changeable
   for (const char* kw : {"count", "LOGSTDOUT", "SCHEMA", "GO", "KLPPLACEHOLDER", "X", "LIMIT", "limits_x",
                          "LIMI", static_cast<const char*>(nullptr)})
     changeable += std::to_string(p_->findChangeableParm(kw)) + " ";
   EXPECT_EQ(changeable, "1 4 -1 -1 -1 -1 8 8 -1 -1 ");
-
   // One pending record per parameter, at most 64 of them.
   klpParmClass& p = *p_;
   EXPECT_EQ(p.addChgParm(30, "1000") + p.addChgParm(16, "200") + p.addChgParm(30, "2000"), 0);
@@ -225,13 +215,12 @@ TEST_F(ParmTest, ValidValuesAndPendingChanges) {
             "cmdParmsClass ERROR: no find room in chgparms array\n");
   EXPECT_EQ(p.addChgParm(16, "300"), 0);  // an existing record still takes a new value
   EXPECT_EQ(std::to_string(p.getChgParmsCount()) + " " + std::to_string(p.getChgParmsEntry(0)->index) +
-                "=" + p.getChgParmsEntry(0)->value + " " + p.getChgParmsEntry(1)->value,
-            "64 30=2000 300");
+                "=" + p.getChgParmsEntry(0)->value + " " + p.getChgParmsEntry(1)->value, "64 30=2000 300");
   EXPECT_EQ(p.getChgParmsEntry(64), nullptr);
 }
 
-// The base processCommandLine: the slots 0 to 4 it leaves and every record it logs.
-TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
+// processCommandLine: slots 0 to 4 and records; the leading server name; path and password file.
+TEST_F(ParmTest, CommandLineStepsRefusalsAndLeadingServer) {
   const std::string v1039(1039, 'v'), v1040(1040, 'v'), k33(33, 'K'), w41(41, 'w');
   const std::string pc = "<klpParmClass::parseCmdLine> 1: ", sp = "<klpParmClass:setParm> 35: ",
                     step = "589 <klpParmClass::processCommandLi> 1: klpParmClass::processCommandLine|",
@@ -265,8 +254,7 @@ TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
       {{"SERVER=" + v1040}, 2002, {"502 " + pc + v1040 + "|1041|SERVER|1040", pf}},
       {{"SERVER=" + v1039}, 2002, {"502 <klpParmClass::setParm> 1: " + v1039 + "|1039|SERVER|40",
                                    "589 " + pc + "klpParmClass::parseCmdLine|2002|klpParmClass::setParm", pf}},
-      // The schema: taken early, checked before it is replaced and at the end;
-      // under the user's locale (UTF-8 here) letters of any script, upper-cased.
+      // The schema: checked early, before it is replaced and at the end; any script's letters, upper-cased.
       ok("schema=my_s", "A@2 42@0 MY_S@2 0:@0 0@0"), ok("SCHEMA=\"My\"", "A@2 42@0 My@2 0:@0 0@0"),
       bad("SCHEMA=a-b", "500 " + pc + "a-b|SCHEMA"), bad("SCHEMA=\"a b\"", "500 " + pc + "\"a b\"|SCHEMA"),
       ok("SCHEMA=\xc3\xbc" "ber", "A@2 42@0 \xc3\x9c" "BER@2 0:@0 0@0"),
@@ -293,32 +281,25 @@ TEST_F(ParmTest, CommandLineStepsAndTheirRefusals) {
     EXPECT_EQ(out.rfind("usage\n", 0) == 0, c.rc == 416);  // printed before anything else
   }
   EXPECT_STREQ(setlocale(LC_CTYPE, nullptr), "C");  // the caller's locale is untouched
-}
-
-// getPositionalDBName: a leading word that names no parameter is the server;
-// one that does is, only when no keyword and no ORACLE_SID name the server.
-TEST_F(ParmTest, LeadingServerName) {
-  const std::string w41(41, 'w'), big = "502 <klpParmClass::setParm> 1: " + w41 + "|41|SERVER|40",
+  // A leading word naming no parameter is the server; one naming one, only if nothing else names it.
+  const std::string big = "502 <klpParmClass::setParm> 1: " + w41 + "|41|SERVER|40",
                     set = "589 <klpParmClass::getPositionalDBN> 1: klpParmClass::getPositionalDBName|2002|setParm ";
-  struct { std::vector<std::string> args; std::string sid, want; int rc = 0; Records logged = {}; } cases[] = {
+  struct { std::vector<std::string> args; std::string sid, want; int rc = 0; Records logged = {}; } rows[] = {
       {{"mydb", "GO"}, "", "1 mydb@2"}, {{"GO"}, "", "1 GO@2"}, {{"GO"}, "db1", "0 db1@0"},
       {{"COUNT"}, "db1", "0 db1@0"}, {{"GO", "server=x"}, "", "0 @0"}, {{"COUNT=1", "server=x"}, "", "0 @0"},
       {{"klpplaceholder"}, "db1", "1 klpplaceholder@2"}, {{"COUNT=1"}, "db1", "0 @0"}, {{}, "", "0 @0"},
       {{"COUNT=1"}, "", "0 @0", 2003, {"524 <klpParmClass::getPositionalDBN> 1: SERVER"}},
       {{w41}, "", "0 @0", 2002, {big, set + "1"}}, {{"GO"}, w41, "0 @0", 2002, {big, set + "3"}},
   };
-  for (const auto& c : cases) {
+  for (const auto& c : rows) {
     fresh();
     std::string leading;  // "consumed server@source"
     EXPECT_EQ(parse(c.args, c.sid.c_str(), &leading), c.rc);
     EXPECT_EQ(leading, c.want);
-    EXPECT_EQ(log_.take(), c.logged) << &c - cases;
+    EXPECT_EQ(log_.take(), c.logged) << &c - rows;
   }
-}
-
-// The path is the working directory with its "/"; the password file is
-// klppwd.aut there when it exists; CHGPARMS or above beats the command line.
-TEST_F(ParmTest, CommandLineRulesForPathPasswordFileAndPriority) {
+  // The path is the working directory; klppwd.aut there is the default; CHGPARMS beats the command line.
+  fresh();
   ASSERT_EQ(parse({"SERVER=a", "SCHEMA=\"Sch\""}), 0);
   EXPECT_EQ(states(*p_, {7, 6}), dir_.path() + "@0 @0");
   EXPECT_STREQ(log_.get()->getProgramQualifier(), "\"Sch\"");  // as typed, before the rule
@@ -344,11 +325,9 @@ TEST_F(ParmTest, QueryMessageBytesPrintoutAndDamage) {
     expected += std::string{static_cast<char>(40 + value.size()), 0, static_cast<char>(source), 0,
                             static_cast<char>(name.size()), 0} + name + std::string(32 - name.size(), '\0') +
                 std::string{static_cast<char>(value.size()), 0} + value;
-  ASSERT_EQ(p.getQueryMsgSize(), expected.size());
   std::string msg(p.getQueryMsgSize(), '\xEE');
   ASSERT_EQ(p.setQueryMsg(msg.data()), 0);
   EXPECT_EQ(msg, expected);
-
   ASSERT_EQ(apply(p, "s5=\"v\"@1;b4=0@5"), 0);
   EXPECT_EQ(p.getQueryMsgSize(), expected.size() + 40 + 3);
   msg.assign(p.getQueryMsgSize(), 0);
@@ -366,7 +345,6 @@ TEST_F(ParmTest, QueryMessageBytesPrintoutAndDamage) {
   std::string labels;
   for (int s = -1; s < 7; ++s) labels += std::string(parmSourceLabel(s, "T")) + ",";
   EXPECT_EQ(labels, "UNKNOWN,DEFAULT,T,COMMANDLINE,CHGPARMS COMMAND,SYSTEM OVERRIDE,K APPLY OVERRIDE,UNKNOWN,");
-
   // Every length received is checked. cut: bytes off the end; printed: records before the end.
   struct { std::vector<std::pair<size_t, uint8_t>> patch; size_t cut; int rc, printed; } cases[] = {
       {{{0, 0}}, msg.size() - 10, 0, 0},  // the bare header of an empty selection
