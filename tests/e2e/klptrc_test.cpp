@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <string>
 #include <vector>
@@ -179,8 +180,12 @@ TEST_F(Klptrc, TurnedOnForARunningServerThenKilled) {
   EXPECT_EQ(s.proc().wait(30000).exitCode, 0);
 }
 
+// Turned on by a copy of the program with no keeper beside it or on PATH.
 TEST_F(Klptrc, ResetlockFreesALockItsHolderLeft) {
-  ASSERT_TRUE(has(trc({"on"}).out, "Trace is turned on"));
+  std::string lone = dir.path() + "klptrc";
+  std::filesystem::copy_file(klptest::binPath("klptrc"), lone);
+  klptest::ProcessResult on = klptest::run({lone, "on", "-db", srv, "-kcap"}, {"PATH=/nonexistent"});
+  ASSERT_TRUE(has(on.out, "Trace is turned on") && has(on.out, "Create Process failed!!\n")) << on.out;
   HSVHIPCMemory* m = nullptr;
   trcBlockHeader* b = nullptr;
   klptest::Child holder = klptest::inChild(dir.path(), [&] {
