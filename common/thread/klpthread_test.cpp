@@ -28,9 +28,8 @@ std::atomic<klpThread*> g_seenCurrent{nullptr};
 sigset_t g_seenMask;
 Queue g_queue;
 
-// By the name's first letter: E ends with g_endWith; A with 9, then 0; W works, H rests (not
-// cancellable) until released; R waits on g_queue; D works on a connection until interrupted,
-// then ends with 5; N returns without ending itself.
+// By the name's first letter: E ends with g_endWith; A with 9, then 0; W works, H rests uncancellable till
+// released; R waits on g_queue; D works on a connection till interrupted, then ends with 5; N just returns.
 void body(klpThread* t) {
   klpThread::prologue(t);
   char k = t->name[0];
@@ -94,8 +93,7 @@ TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
   EXPECT_EQ("Worker>8006|body|1|fromWorker", got.empty() ? "" : got[0]);
 }
 
-// Exits 0 when exactly one of two threads took the first prologue; the id list's lock holds
-// the first to take it, so the other surely comes by.
+// Exits 0 when just one of two threads took the first prologue; the held id-list lock lets both come by.
 void firstPrologueRace() {
   OrdList* ids = klpThreadIdList();
   ids->makeShared("KlpThreadIDList", 0), ids->lockList();
