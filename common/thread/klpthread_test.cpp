@@ -201,9 +201,7 @@ TEST_F(MtThread, SupervisionJudgesTheSetRestartsAndRemoves) {
 }
 
 using Logs = std::vector<std::string>;
-
 void action(uint64_t arg) { printf("action %d\n", static_cast<int>(arg)), fflush(stdout); }
-
 bool endsWithMarker(const std::string& s) { return s.rfind(std::string("***E**O**D**M***\0", 17)) == s.size() - 17; }
 HSVHIPCQueue* g_ipcQueue = nullptr;  // of the queue actions: outlives every frame
 
@@ -218,23 +216,6 @@ TEST_F(MtThread, EachRoutineLogsItsRecords) {
   std::filesystem::create_directory(dir);
   HSVResID id;
   ASSERT_EQ(0u, hsvIPCGetQueResID((dir + "/Q.IPC").c_str(), HSV_QUEUE_RESID_OPTION, &id));
-  auto queue = [&](void (*act)(uint64_t), bool create) {  // the queue is gone only when destroyed
-    return [=] {
-      g_ipcQueue = new HSVHIPCQueue;
-      EXPECT_EQ(0u, create ? g_ipcQueue->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION) : g_ipcQueue->attach(id));
-      act(reinterpret_cast<uint64_t>(&g_ipcQueue));
-      EXPECT_TRUE(g_ipcQueue == nullptr && klptest::queueExists(dir + "/Q.IPC") == create);
-    };
-  };
-  auto report = [](int sig) {  // the signal report alone; none of these is kept as the global one
-    return [sig] {
-      recoveryMgr m;
-      m.signal = sig;
-      erClearGlobalSignal();
-      recoveryMgr::erWhatSignal(&m);
-      EXPECT_EQ(0, erGetGlobalSignal()) << sig;
-    };
-  };
   const std::string what = "591|recoveryMgr::erWhatSignal|1|Initial|";
   struct { std::function<void()> run; Logs logs; } rows[] = {
       {[] {  // connections are made for kind O only; a stop interrupts the work in progress
@@ -283,13 +264,27 @@ TEST_F(MtThread, EachRoutineLogsItsRecords) {
          endRcvyRes(r);
        },
        {"589|findRcvyMgr|1|findRcvyMgr|602|findThread", "589|addRcvyRes|1|addRcvyRes|602|findRcvyMgr"}},
-      {report(SIGFPE), {what + "Handled|SIGFPE"}},
-      {report(SIGILL), {what + "Handled|SIGILL"}},
-      {report(SIGSEGV), {"569|recoveryMgr::erWhatSignal|1|SIGSEGV", what + "Handled|SIGSEGV"}},
-      {report(SIGBUS), {what + "Non-handled|7"}},
-      {report(0), {}},
-      {queue(erHSVIPCQdetach, true), {std::string("593|erHSVIPCQdestroy|1|") + ref}},
-      {queue(erHSVIPCQdestroy, false), {std::string("595|erHSVIPCQdestroy|1|") + ref}},
+      {[] {  // the signal report alone; none of these is kept as the global one
+         for (int sig : {SIGFPE, SIGILL, SIGSEGV, SIGBUS, 0}) {
+           recoveryMgr m;
+           m.signal = sig;
+           erClearGlobalSignal();
+           recoveryMgr::erWhatSignal(&m);
+           EXPECT_EQ(0, erGetGlobalSignal()) << sig;
+         }
+       },
+       {what + "Handled|SIGFPE", what + "Handled|SIGILL", "569|recoveryMgr::erWhatSignal|1|SIGSEGV",
+        what + "Handled|SIGSEGV", what + "Non-handled|7"}},
+      {[&] {  // the queue is gone only when destroyed
+         for (bool create : {true, false}) {
+           g_ipcQueue = new HSVHIPCQueue;
+           EXPECT_EQ(0u, create ? g_ipcQueue->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION)
+                                : g_ipcQueue->attach(id));
+           (create ? erHSVIPCQdetach : erHSVIPCQdestroy)(reinterpret_cast<uint64_t>(&g_ipcQueue));
+           EXPECT_TRUE(g_ipcQueue == nullptr && klptest::queueExists(dir + "/Q.IPC") == create);
+         }
+       },
+       {std::string("593|erHSVIPCQdestroy|1|") + ref, std::string("595|erHSVIPCQdestroy|1|") + ref}},
       {[&] {  // a dump, then one more appended
          char path[1200];
          ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "S1", SIGSEGV, nullptr, nullptr, path, 1200));
