@@ -340,10 +340,7 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
   ASSERT_EQ(old.put(junk.data(), junk.size()), ECF_OK);
   old.detach();
   const std::string q = "(mqueue, /klpq.*, 48)", held = "592 cmdAPIFunc 1 " + q + "\n594 cmdAPIFunc 1 " + q;
-  const struct {
-    int func, rc;
-    std::string records;
-  } rows[] = {
+  const struct { int func, rc; std::string records; } rows[] = {
       {15, 0, held + "\n520 printState 2 AdminThread|is doing work\n520 printState 2 HoldLThread|is resting"},
       {14, 0, held + "\n522 cmdAPIFunc 2 STOP"},
       {20, 0, held + "\n523 cmdAPIFunc 2 COMMIT_INTERVAL|1000\n523 cmdAPIFunc 2 SLEEP_INTERVAL|200"},
@@ -373,13 +370,8 @@ TEST_F(CmdApiExchange, EachRoutineLogsItsRecords) {
                            "name and its suffix do not fit a server name*"));
   // Hand-made queues: open to others refused at once; too small refuses the put; a foreign reply queue kept.
   const std::string pid = std::to_string(getpid());
-  const struct {
-    const char *server, *suffix;
-    mode_t mode;
-    long msgSize;
-    int rc;
-    std::string records;
-  } queues[] = {
+  const struct { const char *server, *suffix; mode_t mode; long msgSize; int rc; std::string records; }
+      queues[] = {
       {"S2.KLP.CAP", ".IPC", 0666, HSV_MAX_MSG_SIZE, 815,
        "506 cmdAPIFunc 1 Capture\n597 cmdAPIFunc 1 " + q + "|*S2.KLP.CAP.IPC|object belongs to another user or is "
                                                           "open to group or others"},
@@ -530,11 +522,8 @@ class SignallingLogger : public msgLoggerU {
 
 // A signal anywhere in an exchange recovers (a control interface call ends with 2010); no reply queue is left.
 TEST_F(CmdApiExchange, ASignalAnywhereInTheExchangeLeavesNoQueue) {
-  const struct {
-    const char* when;
-    int raiseAt;  // message after which the signal comes; 0: from another thread
-    bool apiCall;
-  } cases[] = {
+  // raiseAt: the message after which the signal comes; 0: from another thread.
+  const struct { const char* when; int raiseAt; bool apiCall; } cases[] = {
       {"server queue just attached", 592, false},
       {"reply queue just created", 594, false},
       {"waiting for the reply", 0, false},
@@ -547,7 +536,8 @@ TEST_F(CmdApiExchange, ASignalAnywhereInTheExchangeLeavesNoQueue) {
       auto gone = [&] {  // a queue left behind is reported and removed
         HSVResID id;
         HSVHIPCQueue left;
-        if (hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id) != ECF_OK || left.attach(id) != ECF_OK)
+        if (hsvIPCGetQueResID(path.c_str(), HSV_QUEUE_RESID_OPTION, &id) != ECF_OK ||
+            left.attach(id) != ECF_OK)
           return true;
         return left.destroy(), false;
       };

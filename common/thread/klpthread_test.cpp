@@ -74,25 +74,6 @@ struct MtThread : ::testing::Test {
   }
 };
 
-TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
-  klpThread* t = make("Worker");
-  ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
-  EXPECT_TRUE(g_seenCurrent == t && g_seenState == KLP_THREAD_INIT && onIdList(t));
-  // Sent to the process, SIGINT and SIGTERM are the main thread's; a stop must still reach it.
-  EXPECT_TRUE(sigismember(&g_seenMask, SIGINT) && sigismember(&g_seenMask, SIGTERM) &&
-              !sigismember(&g_seenMask, erStopSignal()));
-  EXPECT_TRUE(threadStateByName(&list, "Worker") == KLP_THREAD_RUN && !threadStateByName(&list, "Work"));
-  EXPECT_TRUE(!strcmp("Worker", t->cmdList->qName) && t->cmdList->locked && t->cmdList->ownerCheck() &&
-              !strncmp(t->dbCtx.dbAlias, "MYDB    ", 8));
-  g_release = true;
-  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());  // 0 is stored as 2011
-  EXPECT_TRUE(t->userData == nullptr && !onIdList(t));  // an ended thread's id may be reused
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));
-  std::vector<std::string> got = records.take(true);  // the logger names the issuing thread
-  EXPECT_EQ("Worker>8006|body|1|fromWorker", got.empty() ? "" : got[0]);
-}
-
 // Exits 0 when just one of two threads took the first prologue; the held id-list lock lets both come by.
 void firstPrologueRace() {
   OrdList* ids = klpThreadIdList();
@@ -110,18 +91,34 @@ TEST(KlpThreadFirst, OnlyOneOfTwoThreadsAtOnceTakesTheFirstPrologue) {
   EXPECT_EXIT(firstPrologueRace(), ::testing::ExitedWithCode(0), "");
 }
 
-TEST_F(MtThread, StopRemovesAnEndedThreadEndsAWorkingOneAndWithdrawsOneItMustCutOff) {
+TEST_F(MtThread, ACreatedThreadRunsUnderItsNameAndAStopRemovesEndsOrWithdrawsIt) {
+  klpThread* t = make("Worker");
+  ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
+  EXPECT_TRUE(g_seenCurrent == t && g_seenState == KLP_THREAD_INIT && onIdList(t));
+  // Sent to the process, SIGINT and SIGTERM are the main thread's; a stop must still reach it.
+  EXPECT_TRUE(sigismember(&g_seenMask, SIGINT) && sigismember(&g_seenMask, SIGTERM) &&
+              !sigismember(&g_seenMask, erStopSignal()));
+  EXPECT_TRUE(threadStateByName(&list, "Worker") == KLP_THREAD_RUN && !threadStateByName(&list, "Work"));
+  EXPECT_TRUE(!strcmp("Worker", t->cmdList->qName) && t->cmdList->locked && t->cmdList->ownerCheck() &&
+              !strncmp(t->dbCtx.dbAlias, "MYDB    ", 8));
+  g_release = true;
+  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());  // 0 is stored as 2011
+  EXPECT_TRUE(t->userData == nullptr && !onIdList(t));  // an ended thread's id may be reused
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));
+  std::vector<std::string> got = records.take(true);  // the logger names the issuing thread
+  EXPECT_EQ("Worker>8006|body|1|fromWorker", got.empty() ? "" : got[0]);
   struct { const char* name; int32_t ready; int rc; const char* log; } rows[] = {  // ready: stopped in
       {"Ender", KLP_THREAD_STOP, 77, "590|klpThread::stop|1|Initial|77|Ender"},  // its end code
       {"NoEnd", KLP_THREAD_STOP, 2011, "590|klpThread::stop|1|Initial|2011|NoEnd"},  // returned
       {"DbWorker", KLP_THREAD_RUN, 5, "590|klpThread::stop|1|Initial|0|DbWorker"},  // interrupted
       {"Rester", KLP_THREAD_REST, 2009, "590|klpThread::stop|1|Initial|0|Rester"},  // withdrawn
   };
-  g_endWith = 77;
+  g_release = false, g_endWith = 77;
   OrdListElement pending[2];  // other threads' commands on the shared list
   for (OrdListElement& e : pending) klpSharedCmdList()->putTail(&e);
   for (const auto& row : rows) {
-    klpThread* t = make(row.name, 1, 0, row.name[0] == 'N');
+    t = make(row.name, 1, 0, row.name[0] == 'N');
     ASSERT_TRUE(waitState(t, row.ready)) << row.name;
     EXPECT_EQ(row.rc, klpThread::stop(t)) << row.name;
     EXPECT_EQ(row.rc == KLP_RC_RECOVERED, list.count) << row.name;
@@ -130,7 +127,7 @@ TEST_F(MtThread, StopRemovesAnEndedThreadEndsAWorkingOneAndWithdrawsOneItMustCut
   OrdList* s = klpSharedCmdList();  // locked, owner checked; a stop empties a thread's own list only
   EXPECT_TRUE(s->count == 2 && s->locked && s->ownerCheck() && !strcmp(s->qName, "KlpList"));
   for (OrdListElement& e : pending) EXPECT_EQ(&e, klpSharedCmdList()->getHead());
-  klpThread* t = klpThreadOf(list.olHead);
+  t = klpThreadOf(list.olHead);
   EXPECT_TRUE(t->ole.withdrawn && !list.browseHead() && !threadStateByName(&list, "Rester"));
   void* ret = nullptr;
   pthread_join(t->handle, &ret);
