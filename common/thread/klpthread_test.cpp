@@ -28,9 +28,8 @@ std::atomic<klpThread*> g_seenCurrent{nullptr};
 sigset_t g_seenMask;
 Queue g_queue;
 
-// By the name's first letter: E ends with g_endWith; A with 9, then 0; W works, H rests (not
-// cancellable) until released; R waits on g_queue; D works on a connection until interrupted,
-// then ends with 5; N returns without ending itself.
+// By the name's first letter: E ends with g_endWith; A with 9, then 0; W works, H rests uncancellable till
+// released; R waits on g_queue; D works on a connection till interrupted, then ends with 5; N just returns.
 void body(klpThread* t) {
   klpThread::prologue(t);
   char k = t->name[0];
@@ -75,27 +74,7 @@ struct MtThread : ::testing::Test {
   }
 };
 
-TEST_F(MtThread, ACreatedThreadRunsAsTheCurrentThreadUnderItsName) {
-  klpThread* t = make("Worker");
-  ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
-  EXPECT_TRUE(g_seenCurrent == t && g_seenState == KLP_THREAD_INIT && onIdList(t));
-  // Sent to the process, SIGINT and SIGTERM are the main thread's; a stop must still reach it.
-  EXPECT_TRUE(sigismember(&g_seenMask, SIGINT) && sigismember(&g_seenMask, SIGTERM) &&
-              !sigismember(&g_seenMask, erStopSignal()));
-  EXPECT_TRUE(threadStateByName(&list, "Worker") == KLP_THREAD_RUN && !threadStateByName(&list, "Work"));
-  EXPECT_TRUE(!strcmp("Worker", t->cmdList->qName) && t->cmdList->locked && t->cmdList->ownerCheck() &&
-              !strncmp(t->dbCtx.dbAlias, "MYDB    ", 8));
-  g_release = true;
-  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());  // 0 is stored as 2011
-  EXPECT_TRUE(t->userData == nullptr && !onIdList(t));  // an ended thread's id may be reused
-  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));
-  std::vector<std::string> got = records.take(true);  // the logger names the issuing thread
-  EXPECT_EQ("Worker>8006|body|1|fromWorker", got.empty() ? "" : got[0]);
-}
-
-// Exits 0 when exactly one of two threads took the first prologue; the id list's lock holds
-// the first to take it, so the other surely comes by.
+// Exits 0 when just one of two threads took the first prologue; the held id-list lock lets both come by.
 void firstPrologueRace() {
   OrdList* ids = klpThreadIdList();
   ids->makeShared("KlpThreadIDList", 0), ids->lockList();
@@ -112,18 +91,34 @@ TEST(KlpThreadFirst, OnlyOneOfTwoThreadsAtOnceTakesTheFirstPrologue) {
   EXPECT_EXIT(firstPrologueRace(), ::testing::ExitedWithCode(0), "");
 }
 
-TEST_F(MtThread, StopRemovesAnEndedThreadEndsAWorkingOneAndWithdrawsOneItMustCutOff) {
+TEST_F(MtThread, ACreatedThreadRunsUnderItsNameAndAStopRemovesEndsOrWithdrawsIt) {
+  klpThread* t = make("Worker");
+  ASSERT_TRUE(waitState(t, KLP_THREAD_RUN));
+  EXPECT_TRUE(g_seenCurrent == t && g_seenState == KLP_THREAD_INIT && onIdList(t));
+  // Sent to the process, SIGINT and SIGTERM are the main thread's; a stop must still reach it.
+  EXPECT_TRUE(sigismember(&g_seenMask, SIGINT) && sigismember(&g_seenMask, SIGTERM) &&
+              !sigismember(&g_seenMask, erStopSignal()));
+  EXPECT_TRUE(threadStateByName(&list, "Worker") == KLP_THREAD_RUN && !threadStateByName(&list, "Work"));
+  EXPECT_TRUE(!strcmp("Worker", t->cmdList->qName) && t->cmdList->locked && t->cmdList->ownerCheck() &&
+              !strncmp(t->dbCtx.dbAlias, "MYDB    ", 8));
+  g_release = true;
+  ASSERT_TRUE(waitState(t, KLP_THREAD_STOP));
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, t->getEndCode());  // 0 is stored as 2011
+  EXPECT_TRUE(t->userData == nullptr && !onIdList(t));  // an ended thread's id may be reused
+  EXPECT_EQ(KLP_RC_THREAD_ENDED, klpThread::stop(t));
+  std::vector<std::string> got = records.take(true);  // the logger names the issuing thread
+  EXPECT_EQ("Worker>8006|body|1|fromWorker", got.empty() ? "" : got[0]);
   struct { const char* name; int32_t ready; int rc; const char* log; } rows[] = {  // ready: stopped in
       {"Ender", KLP_THREAD_STOP, 77, "590|klpThread::stop|1|Initial|77|Ender"},  // its end code
       {"NoEnd", KLP_THREAD_STOP, 2011, "590|klpThread::stop|1|Initial|2011|NoEnd"},  // returned
       {"DbWorker", KLP_THREAD_RUN, 5, "590|klpThread::stop|1|Initial|0|DbWorker"},  // interrupted
       {"Rester", KLP_THREAD_REST, 2009, "590|klpThread::stop|1|Initial|0|Rester"},  // withdrawn
   };
-  g_endWith = 77;
+  g_release = false, g_endWith = 77;
   OrdListElement pending[2];  // other threads' commands on the shared list
   for (OrdListElement& e : pending) klpSharedCmdList()->putTail(&e);
   for (const auto& row : rows) {
-    klpThread* t = make(row.name, 1, 0, row.name[0] == 'N');
+    t = make(row.name, 1, 0, row.name[0] == 'N');
     ASSERT_TRUE(waitState(t, row.ready)) << row.name;
     EXPECT_EQ(row.rc, klpThread::stop(t)) << row.name;
     EXPECT_EQ(row.rc == KLP_RC_RECOVERED, list.count) << row.name;
@@ -132,7 +127,7 @@ TEST_F(MtThread, StopRemovesAnEndedThreadEndsAWorkingOneAndWithdrawsOneItMustCut
   OrdList* s = klpSharedCmdList();  // locked, owner checked; a stop empties a thread's own list only
   EXPECT_TRUE(s->count == 2 && s->locked && s->ownerCheck() && !strcmp(s->qName, "KlpList"));
   for (OrdListElement& e : pending) EXPECT_EQ(&e, klpSharedCmdList()->getHead());
-  klpThread* t = klpThreadOf(list.olHead);
+  t = klpThreadOf(list.olHead);
   EXPECT_TRUE(t->ole.withdrawn && !list.browseHead() && !threadStateByName(&list, "Rester"));
   void* ret = nullptr;
   pthread_join(t->handle, &ret);
@@ -203,9 +198,7 @@ TEST_F(MtThread, SupervisionJudgesTheSetRestartsAndRemoves) {
 }
 
 using Logs = std::vector<std::string>;
-
 void action(uint64_t arg) { printf("action %d\n", static_cast<int>(arg)), fflush(stdout); }
-
 bool endsWithMarker(const std::string& s) { return s.rfind(std::string("***E**O**D**M***\0", 17)) == s.size() - 17; }
 HSVHIPCQueue* g_ipcQueue = nullptr;  // of the queue actions: outlives every frame
 
@@ -220,23 +213,6 @@ TEST_F(MtThread, EachRoutineLogsItsRecords) {
   std::filesystem::create_directory(dir);
   HSVResID id;
   ASSERT_EQ(0u, hsvIPCGetQueResID((dir + "/Q.IPC").c_str(), HSV_QUEUE_RESID_OPTION, &id));
-  auto queue = [&](void (*act)(uint64_t), bool create) {  // the queue is gone only when destroyed
-    return [=] {
-      g_ipcQueue = new HSVHIPCQueue;
-      EXPECT_EQ(0u, create ? g_ipcQueue->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION) : g_ipcQueue->attach(id));
-      act(reinterpret_cast<uint64_t>(&g_ipcQueue));
-      EXPECT_TRUE(g_ipcQueue == nullptr && klptest::queueExists(dir + "/Q.IPC") == create);
-    };
-  };
-  auto report = [](int sig) {  // the signal report alone; none of these is kept as the global one
-    return [sig] {
-      recoveryMgr m;
-      m.signal = sig;
-      erClearGlobalSignal();
-      recoveryMgr::erWhatSignal(&m);
-      EXPECT_EQ(0, erGetGlobalSignal()) << sig;
-    };
-  };
   const std::string what = "591|recoveryMgr::erWhatSignal|1|Initial|";
   struct { std::function<void()> run; Logs logs; } rows[] = {
       {[] {  // connections are made for kind O only; a stop interrupts the work in progress
@@ -285,13 +261,27 @@ TEST_F(MtThread, EachRoutineLogsItsRecords) {
          endRcvyRes(r);
        },
        {"589|findRcvyMgr|1|findRcvyMgr|602|findThread", "589|addRcvyRes|1|addRcvyRes|602|findRcvyMgr"}},
-      {report(SIGFPE), {what + "Handled|SIGFPE"}},
-      {report(SIGILL), {what + "Handled|SIGILL"}},
-      {report(SIGSEGV), {"569|recoveryMgr::erWhatSignal|1|SIGSEGV", what + "Handled|SIGSEGV"}},
-      {report(SIGBUS), {what + "Non-handled|7"}},
-      {report(0), {}},
-      {queue(erHSVIPCQdetach, true), {std::string("593|erHSVIPCQdestroy|1|") + ref}},
-      {queue(erHSVIPCQdestroy, false), {std::string("595|erHSVIPCQdestroy|1|") + ref}},
+      {[] {  // the signal report alone; none of these is kept as the global one
+         for (int sig : {SIGFPE, SIGILL, SIGSEGV, SIGBUS, 0}) {
+           recoveryMgr m;
+           m.signal = sig;
+           erClearGlobalSignal();
+           recoveryMgr::erWhatSignal(&m);
+           EXPECT_EQ(0, erGetGlobalSignal()) << sig;
+         }
+       },
+       {what + "Handled|SIGFPE", what + "Handled|SIGILL", "569|recoveryMgr::erWhatSignal|1|SIGSEGV",
+        what + "Handled|SIGSEGV", what + "Non-handled|7"}},
+      {[&] {  // the queue is gone only when destroyed
+         for (bool create : {true, false}) {
+           g_ipcQueue = new HSVHIPCQueue;
+           EXPECT_EQ(0u, create ? g_ipcQueue->create(id, HSV_MAX_MSG_SIZE, HSV_CREATE_OPTION)
+                                : g_ipcQueue->attach(id));
+           (create ? erHSVIPCQdetach : erHSVIPCQdestroy)(reinterpret_cast<uint64_t>(&g_ipcQueue));
+           EXPECT_TRUE(g_ipcQueue == nullptr && klptest::queueExists(dir + "/Q.IPC") == create);
+         }
+       },
+       {std::string("593|erHSVIPCQdestroy|1|") + ref, std::string("595|erHSVIPCQdestroy|1|") + ref}},
       {[&] {  // a dump, then one more appended
          char path[1200];
          ASSERT_EQ(0, erDumpStackTraceTo(dir.c_str(), "S1", SIGSEGV, nullptr, nullptr, path, 1200));
