@@ -13,6 +13,7 @@
 #include <chrono>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <memory>
 #include <optional>
 #include <thread>
@@ -247,6 +248,12 @@ class CmdApiExchange : public ::testing::Test {
 };
 
 // A server in a forked child, its queue made before the fork; respond's answers or-ed into its exit code.
+// Descriptors the process holds (queues are descriptors too).
+size_t openFiles() {
+  std::filesystem::directory_iterator fds("/proc/self/fd");
+  return static_cast<size_t>(std::distance(begin(fds), end(fds)));
+}
+
 class FakeServer {
  public:
   FakeServer(const std::string& dir, const std::string& name) : dir_(dir), name_(name) {
@@ -480,6 +487,7 @@ TEST_F(CmdApiExchange, CollectorAndStatusSizeConvertWholeRepliesOnly) {
       {KLP_KIND_CAP, 59, sizeReply("klpSISize: ", -1), size_t(-1), 2017, 0},
   };
   const char* words[] = {"", "APP", "KAPP", "CAP", "KCAP", "MON"};
+  size_t fds = openFiles();  // every exchange lets go of both queues
   for (const auto& c : cases) {
     FakeServer srv(tmp_.path(), std::string("S1.KLP.") + words[c.kind]);
     srv.start(1, [&](const IpcMsgView& req) {
@@ -502,6 +510,7 @@ TEST_F(CmdApiExchange, CollectorAndStatusSizeConvertWholeRepliesOnly) {
     EXPECT_EQ(has(res.text, "KLP0589") && has(res.text, "2017"), c.rc != 0) << res.text;
     if (c.bufferSize == 0) std::free(req.buffer);
   }
+  EXPECT_EQ(openFiles(), fds);
   klpResultBlock res{};
   EXPECT_EQ(klpCollectStatus(nullptr, nullptr, &res, nullptr), 2001);
   EXPECT_EQ(res.rc, 2001);

@@ -150,7 +150,7 @@ TEST_F(Formatter, ObjectsDamagedOrWhole) {
       {19, timeValue(INT64_MAX, 0)}, {1, Bytes("\xff", 1)}, {1, le16(0xFFFE)},
       {21, le32(16) + "\xaa"}, {13, le16(0xFFFE)}, {16, le32(0xFFFFFFFF)}, {3, Bytes("a\nb", 4)},
       {2, "xyz"}, {17, Bytes(4, '\0')}, {17, Bytes("\0\1", 2)}, {18, le64(0x1234)},
-      {15, le16(3)}, {15, le16(99)}, {22, Bytes("\3", 1)}, {22, le32(9)}, {19, timeValue(0, 5)},
+      {15, le16(3)}, {15, le16(99)}, {22, Bytes("\3", 1)}, {22, le32(6)}, {19, timeValue(0, 5)},
       {4, Bytes(12, '\0') + le32(static_cast<uint32_t>(-204))},
       {5, sqlda(2, column(485, 0x0207, "AMOUNT", 6) + column(452, 10, "NAME", 4))},
       {6, ""}, {6, "SELECT A FROM T"}, {6, std::string(75, 'X') + " B"},
