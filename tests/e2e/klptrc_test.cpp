@@ -77,10 +77,8 @@ TEST_F(Klptrc, RefusalsWithoutATrace) {
   EXPECT_EQ(help.substr(0, help.find('\n') + 1),
             "klptrc  8.1.0 (platform: Linux; format: 0012/0024)\n");
   EXPECT_TRUE(has(klptest::lines(help).back(), "klptrc json [-fn file | <keys>] [-ofn outfile]"));
-  std::string symbols = trc({"-listsymbols"}, true).out;
-  EXPECT_EQ(e2e::countOf(symbols, "\nComponent: \""), 54u);
-  EXPECT_FALSE(has(symbols, "ZERO_PLACE_HOLDER"));
-  EXPECT_TRUE(has(symbols, "Component: \"Sample Trace\"\n  Functions:\n  \"main\"\n  \"printcb\"\n"));
+  // 54 components; rows that name no trace point are left out.
+  EXPECT_EQ(trc({"-listsymbols"}, true).out, klptest::readFile(KLP_SOURCE_DIR "/tests/e2e/klptrc_symbols.golden"));
   // -ofn appends to its file.
   std::string outFile = dir.path() + "out.txt";
   std::ofstream(outFile) << "before\n";
