@@ -6,7 +6,9 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <dirent.h>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <random>
 #include <string>
 #include <vector>
@@ -19,20 +21,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
 
 static std::vector<std::vector<uint8_t>> loadCorpus(const std::string& dir) {
   std::vector<std::vector<uint8_t>> out;
-  DIR* d = opendir(dir.c_str());
-  if (!d) return out;
-  while (dirent* e = readdir(d)) {
-    if (e->d_name[0] == '.') continue;
-    std::string p = dir + "/" + e->d_name;
-    FILE* f = fopen(p.c_str(), "rb");
-    if (!f) continue;
-    std::vector<uint8_t> buf;
-    int c;
-    while ((c = fgetc(f)) != EOF) buf.push_back(static_cast<uint8_t>(c));
-    fclose(f);
-    out.push_back(std::move(buf));
+  std::error_code missing;
+  for (const auto& e : std::filesystem::directory_iterator(dir, missing)) {
+    std::ifstream f(e.path(), std::ios::binary);
+    out.emplace_back(std::istreambuf_iterator<char>(f), std::istreambuf_iterator<char>());
   }
-  closedir(d);
   return out;
 }
 
