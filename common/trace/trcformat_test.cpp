@@ -164,6 +164,7 @@ TEST_F(Formatter, StatementAndDescriptorListingsStopWhenFull) {
   const std::string in = "\n         ";
   EXPECT_EQ(object(6, times("AAAAAAAAA ", 7) + "AAAAAAAAA"),
             in + times("AAAAAAAAA ", 6) + in + "AAAAAAAAA AAAAAAAAA\n");
+  EXPECT_EQ(object(6, "(" + std::string(70, 'B')), in + "(" + in + std::string(70, 'B') + "\n");
   std::string listed = object(6, times("AAAAAAAAAA ", 500));  // lines of 76 characters
   EXPECT_LT(listed.size(), 4000u);
   EXPECT_EQ(listed.substr(listed.size() - 15), "...buffer full\n");
