@@ -293,7 +293,11 @@ TEST_F(Engine, ADatabaseThatGoesDownStopsTheServerWith929) {
   int32_t flag = 0;
   {
     std::future<int> run = loop(&threads_, &flag);
-    ASSERT_TRUE(e2e::waitFor([&] { return a->cmdList->count > 0; }, 15000));
+    ASSERT_TRUE(e2e::waitFor([&] {  // under the list's lock: the engine fills it meanwhile
+      a->cmdList->lockList();
+      bool some = a->cmdList->count > 0;
+      return a->cmdList->unlockList() == 0 && some;
+    }, 15000));
     EXPECT_EQ(takeFunc(a), kStop);
     a->setState(KLP_THREAD_STOP);
     EXPECT_TRUE(e2e::waitFor([&] { return ended(run); }, 15000));
