@@ -30,13 +30,14 @@ test:
 # Every test but the fuzz corpora (one thread each) runs under ThreadSanitizer,
 # the programs the end-to-end tests start too. Their reports go to files, so
 # that a race in a server or a command program fails the run even when the
-# test that started it passed.
+# test that started it passed. With fault injection, so the walk of every
+# failure point runs here too.
 # Left out: a test that limits its process's data size to find the trace
 # command short of memory; the sanitizer's own allocator then fails first.
 TSAN_REPORTS = $(CURDIR)/build-tsan/tsan-reports
 TSAN_EXCLUDE = TraceCommand.InsideTheServerOrShortOfMemory
 tsan:
-	cmake -S . -B build-tsan -DCMAKE_BUILD_TYPE=Debug -DKLP_SANITIZE=thread >/dev/null
+	cmake -S . -B build-tsan -DCMAKE_BUILD_TYPE=Debug -DKLP_SANITIZE=thread -DKLP_FAULTS=ON >/dev/null
 	cmake --build build-tsan -j $(JOBS)
 	rm -rf $(TSAN_REPORTS) && mkdir -p $(TSAN_REPORTS)
 	ulimit -q unlimited 2>/dev/null || true; \
