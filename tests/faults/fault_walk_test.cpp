@@ -24,6 +24,7 @@ struct Scenario {
   bool serverFromStart;  // the server's points count from its start, not from the step
   const char* done;      // what the step shows when the failure did not stop it
 };
+void PrintTo(const Scenario& s, std::ostream* os) { *os << s.name; }  // in test listings
 
 const std::vector<std::string> kTrcKill = {"klptrc", "kill"};
 const std::vector<std::string> kTrcOn = {"klptrc", "on"};
