@@ -265,7 +265,7 @@ int ConvMgr::convert(uint32_t srcCcsid, const char** src, const char* srcEnd, ui
   trcEntry(kTrcComp, kFnCpcv);
   if (!src || !tgt || (!*src && srcEnd) || srcEnd < *src || (*tgt && tgtEnd < *tgt) ||
       static_cast<size_t>(srcEnd - *src) > kMaxSource) {
-    trcExit(kTrcComp, kFnCpcv, TRC_RET_RC, 0, KLP_RC_BAD_PARM);
+    trcExitRc(kTrcComp, kFnCpcv, KLP_RC_BAD_PARM);
     return KLP_RC_BAD_PARM;
   }
   const size_t srcLen = static_cast<size_t>(srcEnd - *src);
@@ -455,7 +455,7 @@ done:
   if (from && reset) ucnv_reset(from->conv);
   if (to && (reset || !from)) ucnv_reset(to->conv);
   arenaReset(&temp_);
-  trcExit(kTrcComp, kFnCpcv, TRC_RET_RC, 0, rc);
+  trcExitRc(kTrcComp, kFnCpcv, rc);
   return rc;
 }
 

@@ -141,7 +141,7 @@ int ConvMgr::openConverter(uint32_t ccsid, UConverter** conv, int encoding) {
     ucnv_setToUCallBack(*conv, UCNV_TO_U_CALLBACK_STOP, nullptr, nullptr, nullptr, &e);
     ucnv_setFromUCallBack(*conv, UCNV_FROM_U_CALLBACK_STOP, nullptr, nullptr, nullptr, &e);
   }
-  trcExit(kTrcComp, kFnOpen, TRC_RET_RC, 0, rc);
+  trcExitRc(kTrcComp, kFnOpen, rc);
   return rc;
 }
 

@@ -94,7 +94,7 @@ int klpdll::loadLib(klpDLL* dll) {
   } else {
     resolveFunctions(dll, dll->optional_);
   }
-  trcExit(kTrcComp, kFnLoadLib, TRC_RET_RC, 0, result);
+  trcExitRc(kTrcComp, kFnLoadLib, result);
   return result;
 }
 

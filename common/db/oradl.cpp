@@ -75,7 +75,7 @@ int ORADL::OCIInit() {
   trcEntry(kTrcComp, kFnInit);
   std::lock_guard<std::mutex> guard(gInitLock);
   if (gLoaded.load() == 1) {
-    trcExit(kTrcComp, kFnInit, TRC_RET_RC, 0, 1);
+    trcExitRc(kTrcComp, kFnInit, 1);
     return 1;
   }
   HSVSharedLib& lib = ociLibrary();
@@ -90,7 +90,7 @@ int ORADL::OCIInit() {
         logKlpMsg(657, "ORADL:OCIInit", KLP_DEST_SEVERITY, gLibName, nullptr, 2, code,
                   ecfErrorGetDescription(rc));
       }
-      trcExit(kTrcComp, kFnInit, TRC_RET_RC, 0, 0);
+      trcExitRc(kTrcComp, kFnInit, 0);
       return 0;
     }
     if (!quiet()) logKlpMsg(658, "ORADL:OCIInit", KLP_DEST_SEVERITY, gLibName, nullptr, 0);
@@ -112,7 +112,7 @@ int ORADL::OCIInit() {
     gSlots[i].store(address, std::memory_order_release);
   }
   gLoaded.store(result, std::memory_order_release);
-  trcExit(kTrcComp, kFnInit, TRC_RET_RC, 0, result);
+  trcExitRc(kTrcComp, kFnInit, result);
   return result;
 }
 

@@ -260,7 +260,7 @@ void sendReply(IpcMsg* reply, int32_t requester) {
     logKlpMsg(597, kOrigin, KLP_DEST_SEVERITY, IPC_RESID_UNKNOWN, nullptr, 2, "*",
               ecfErrorGetDescription(ECF_INVALID_ARGUMENT));
     logKlpMsg(506, kOrigin, KLP_DEST_SEVERITY, ipcProgramCmdWord(namePrefix()), nullptr, 0);
-    trcExit(kTrcComp, kFnReply, TRC_RET_RC, 0, 597);
+    trcExitRc(kTrcComp, kFnReply, 597);
     return;
   }
   HSVResID id;
@@ -276,7 +276,7 @@ void sendReply(IpcMsg* reply, int32_t requester) {
               nullptr, 2, path, ecfErrorGetDescription(prc));
     logKlpMsg(506, kOrigin, KLP_DEST_SEVERITY, ipcProgramCmdWord(namePrefix()), nullptr, 0);
     free(idText);
-    trcExit(kTrcComp, kFnReply, TRC_RET_RC, 0, 597);
+    trcExitRc(kTrcComp, kFnReply, 597);
     return;
   }
   // A requester that does not take its replies must not hold up everyone
@@ -290,7 +290,7 @@ void sendReply(IpcMsg* reply, int32_t requester) {
   }
   q.detach();
   free(idText);
-  trcExit(kTrcComp, kFnReply, TRC_RET_RC, 0, 0);
+  trcExitRc(kTrcComp, kFnReply, 0);
 }
 
 }  // namespace
@@ -395,7 +395,7 @@ int cmdsStartStop(cmdsState* st, OrdList* threads) {
       rc = CMDS_RC_UNLOCK_FAILED;
     }
   }
-  trcExit(kTrcComp, kFnStop, TRC_RET_RC, 0, rc);
+  trcExitRc(kTrcComp, kFnStop, rc);
   return rc;
 }
 
@@ -480,7 +480,7 @@ int cmdsHandleMessage(cmdsState* st, OrdList* threads, const void* buf, size_t r
     sendReply(reply, h.senderPid);
     freeIpcMsg(reply);
   }
-  trcExit(kTrcComp, kFnHandle, TRC_RET_RC, 0, 0);
+  trcExitRc(kTrcComp, kFnHandle, 0);
   return 0;
 }
 
@@ -525,7 +525,7 @@ int cmdsEngine(OrdList* threads, int mode, int32_t* stopRequested) {
   HSVHIPCQueue* q = getEnvIpcQRcvHdl(env);
   if (q == nullptr) {
     logInternalError(kOrigin, KLP_RC_QUEUE_UNAVAILABLE, "getEnvIpcQRcvHdl");
-    trcExit(kTrcComp, kFnEngine, TRC_RET_RC, 0, KLP_RC_QUEUE_UNAVAILABLE);
+    trcExitRc(kTrcComp, kFnEngine, KLP_RC_QUEUE_UNAVAILABLE);
     return KLP_RC_QUEUE_UNAVAILABLE;
   }
   cmdsState st;
@@ -629,6 +629,6 @@ int cmdsEngine(OrdList* threads, int mode, int32_t* stopRequested) {
     delEnvIpcQRcvHdl(env);
     klpEnvClear(env);
   }
-  trcExit(kTrcComp, kFnEngine, TRC_RET_RC, 0, result);
+  trcExitRc(kTrcComp, kFnEngine, result);
   return result;
 }

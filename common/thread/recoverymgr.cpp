@@ -290,7 +290,7 @@ int recoveryMgr::erSetRecovery(recoveryMgr* mgr) {
   // Inside a control interface call the process is the caller's: the call
   // brings its own handling and gives the caller's back.
   if (tlsCall == nullptr && g_handlerInstalled.compare_exchange_strong(expected, 1)) erReinstall();
-  trcExit(kTrcComp, 1, TRC_RET_RC, 0, 0);
+  trcExitRc(kTrcComp, 1, 0);
   return 0;
 }
 

@@ -114,6 +114,10 @@ inline void trcExit(int component, int function, int returnKind, int16_t value16
                     int32_t value32 = 0, int64_t value64 = 0) {
   if (trcIsRunning()) trcExitBody(component, function, returnKind, value16, value32, value64);
 }
+// The exit of a routine that answers a code: its record carries the code.
+inline void trcExitRc(int component, int function, int32_t rc) {
+  trcExit(component, function, TRC_RET_RC, static_cast<int16_t>(rc));
+}
 
 // Common body of the trcData family: up to 32 objects (more are ignored).
 uint32_t trcDataN(int component, int function, const char* dataName, uint32_t levelMask,

@@ -259,6 +259,11 @@ TEST(TraceWriter, WhatARecordHolds) {
     if (row.name != nullptr) { EXPECT_EQ(std::string(row.name) + '\0', r.name); }
     if (row.function != nullptr) { EXPECT_STREQ(row.function, trcFunctionName(r.component, r.function)); }
   }
+  Trace t;  // a routine's exit record carries the code it answers
+  ASSERT_EQ(1, compareIgnTransCriteria("A%C", "ABBC"));
+  Walk w = t.read();
+  ASSERT_EQ(2u, w.records.size());
+  EXPECT_EQ((std::vector<std::pair<int, std::string>>{{TRC_OBJ_RC, std::string("\1\0", 2)}}), w.records[1].objects);
 }
 
 TEST(TraceWriter, WrapKeepsTheNewestRecords) {

@@ -612,7 +612,7 @@ int getFileHandle(FILE** fh, uint32_t flags, const char* suffix, char* nameOut, 
     char errText[16];
     snprintf(errText, sizeof errText, "%d", err);
     logKlpMsg(626, "getFileHandle", KLP_DEST_SEVERITY, "fopen", nullptr, 3, name, mode, errText);
-    trcExit(11, 94, TRC_RET_RC, 0, err);
+    trcExitRc(11, 94, err);
     return err;
   }
   trcData(11, 94, "file opened", 2, 7, static_cast<uint32_t>(strlen(name)), name, 7,
@@ -621,7 +621,7 @@ int getFileHandle(FILE** fh, uint32_t flags, const char* suffix, char* nameOut, 
   else fclose(f);
   if (nameOut) memcpy(nameOut, name, static_cast<size_t>(n) + 1);
   trcData(11, 94, "returned file", 2, 7, static_cast<uint32_t>(strlen(name)), name);
-  trcExit(11, 94, TRC_RET_RC, 0, 0);
+  trcExitRc(11, 94, 0);
   return 0;
 }
 
@@ -681,7 +681,7 @@ int compareIgnTransCriteria(const char* pattern, const char* text) {
   trcEntry(kTrcIgnTrans, kFnIgnTrans);
   int result = 0;
   if (!pattern || !text) {
-    trcExit(kTrcIgnTrans, kFnIgnTrans, TRC_RET_RC, 0, 0);
+    trcExitRc(kTrcIgnTrans, kFnIgnTrans, 0);
     return 0;
   }
   const char* p = pattern;
@@ -743,6 +743,6 @@ int compareIgnTransCriteria(const char* pattern, const char* text) {
       backP = nullptr;
     }
   }
-  trcExit(kTrcIgnTrans, kFnIgnTrans, TRC_RET_RC, 0, result);
+  trcExitRc(kTrcIgnTrans, kFnIgnTrans, result);
   return result;
 }
