@@ -76,11 +76,10 @@ std::string readFile(const std::string& path);
 // Lines of a text, without their line feeds.
 std::vector<std::string> lines(const std::string& text);
 
-// Messages issued through the process logger, recorded as their callers gave
-// them, one text each: "number origin kind values", the values joined by "|"
-// (kind 0 log file, 1 by severity, 2 console; the header values the logger
-// puts in front and the blank pads are left out). Installed as the process
-// logger for the object's life; recorded messages are not written anywhere.
+// Messages issued through the process logger, as their callers gave them, one text each:
+// "number origin kind values", the values joined by "|" (kind 0 log file, 1 by severity,
+// 2 console; the logger's header values and the blank pads are left out). Installed as the
+// process logger for the object's life; recorded messages are not written anywhere.
 class LogCapture {
  public:
   LogCapture();
@@ -99,9 +98,8 @@ class LogCapture {
 // What f writes to standard output while it runs.
 std::string stdoutOf(const std::function<void()>& f);
 
-// Runs body in a forked child whose standard output and error go to files
-// under dir (ending in "/"); it exits with body's answer or is killed after
-// timeoutMs.
+// Runs body in a forked child whose standard output and error go to files under dir (ending
+// in "/"); it exits with body's answer or is killed after timeoutMs.
 Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs = 20000);
 
 // The process logger a program makes first (application 10 unless given,
