@@ -187,16 +187,6 @@ void trcFlushLastLap(trcBlockHeader* block) {
   if (copy == nullptr) trcUnlockBuffer(block);
 }
 
-void trcWriteRecord(int component, int function, uint16_t levelMask, const void* timeOrName,
-                    uint8_t recordType, uint32_t recordLength, int objectCount, const int* types,
-                    const uint32_t* lengths, const void* const* pointers) {
-  trcBlockHeader* b = trcint::enterBlock();
-  if (b == nullptr) return;
-  writeRecord(b, component, function, levelMask, timeOrName, recordType, recordLength,
-              objectCount, types, lengths, pointers);
-  trcint::leaveBlock();
-}
-
 uint32_t trcLevelBody(int component, int function) {
   trcBlockHeader* b = trcint::enterBlock();
   if (b == nullptr) return 0;

@@ -1,19 +1,9 @@
-// The writer under the trace points, and the copy of a block image to its
-// trace file.
+// The copy of a block image to its trace file, whole or lap by lap.
 #pragma once
 
 #include <cstdint>
 
 #include "common/trace/trcblock.h"
-
-// Appends one record to the attached block: wraps the data area when the
-// record does not fit at the write offset (dropping the oldest records it
-// overwrites; in direct-to-file mode the area written since the last wrap is
-// first appended to the trace file). timeOrName is the record's 16-byte time
-// value or data name. A record longer than the data area is not written.
-void trcWriteRecord(int component, int function, uint16_t levelMask, const void* timeOrName,
-                    uint8_t recordType, uint32_t recordLength, int objectCount,
-                    const int* types, const uint32_t* lengths, const void* const* pointers);
 
 // Answers of trcFlushToFile.
 enum : int {
