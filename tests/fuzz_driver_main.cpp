@@ -15,10 +15,6 @@
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
 
-#ifndef KLP_SOURCE_DIR
-#define KLP_SOURCE_DIR "."
-#endif
-
 static std::vector<std::vector<uint8_t>> loadCorpus(const std::string& dir) {
   std::vector<std::vector<uint8_t>> out;
   std::error_code missing;

@@ -102,10 +102,9 @@ std::string stdoutOf(const std::function<void()>& f);
 // in "/"); it exits with body's answer or is killed after timeoutMs.
 Child inChild(const std::string& dir, const std::function<int()>& body, int timeoutMs = 20000);
 
-// The process logger a program makes first (application 10 unless given,
-// synchronous, built-in texts loaded), installed for the object's life and
-// writing to dir/file when both are given; the previous logger comes back.
-// It keeps every message it issues, for take().
+// The process logger a program makes first (application 10 unless given, synchronous, built-in
+// texts loaded), installed for the object's life and writing to dir/file when both are given;
+// the previous logger comes back. It keeps every message it issues, for take().
 class ProcessLogger {
  public:
   explicit ProcessLogger(int applicationIndex = 10, const std::string& logDir = "",
@@ -115,10 +114,9 @@ class ProcessLogger {
   ProcessLogger& operator=(const ProcessLogger&) = delete;
   msgLogger* operator->() const;
   msgLogger* get() const;
-  // Messages issued since the last take(): number as issued, origin, routing
-  // asked for (12: destination kind 0, 35: kind 2, 1: others), values after
-  // the header ones less trailing pads (" ", "*"), extra pair unless (-1,-1):
-  // "589 <where> 1: where|801|what", "575 <mq> 1: 2059|a|b (-1,2059)".
+  // Messages issued since the last take(): number as issued, origin, routing asked for (12:
+  // destination kind 0, 35: kind 2, 1: others), values after the header ones less trailing pads
+  // (" ", "*"), extra pair unless (-1,-1): "589 <where> 1: where|801|what", "575 <mq> 1: 2059|a|b (-1,2059)".
   std::vector<std::string> take();
 
  private:
@@ -126,11 +124,10 @@ class ProcessLogger {
   msgLogger* saved_;
 };
 
-// The process logger while the object lives, writing nowhere but a record
-// file in dir (so that forked children's records count): per message
-// "number|origin|kind|values..." with the destination kind 0, 1 or 2 (or
-// "r" and the routing word given directly) and the caller's values in order,
-// trailing pads (" ", "*") left out.
+// The process logger while the object lives, writing nowhere but a record file in dir (so that
+// forked children's records count): per message "number|origin|kind|values..." with the
+// destination kind 0, 1 or 2 (or "r" and the routing word given directly) and the caller's
+// values in order, trailing pads (" ", "*") left out.
 class LogRecords {
  public:
   explicit LogRecords(const std::string& dir);
